@@ -1,0 +1,161 @@
+#include "options.h"
+
+#include <cstdio>
+#include <cstdlib>
+#include <iterator>
+#include <map>
+
+namespace {
+
+constexpr int kOptionBase = 'b';
+constexpr int kOptionHelp = 'h';
+constexpr int kOptionIndex = 'i';
+constexpr int kOptionData = 'm';
+constexpr int kOptionData2 = 'n';
+constexpr int kOptionVerbose = 'v';
+constexpr int kOptionType = 1000;
+constexpr int kOptionTarget = 1001;
+constexpr int kOptionCheck = 1003;
+constexpr int kOptionDebug = 1004;
+constexpr int kOptionIfNotPresent = 1005;
+constexpr int kOptionQueryPresent = 1006;
+
+constexpr unsigned kHelpColumn = 26;
+constexpr unsigned kUsageWidth = 80;
+
+using Kind = GetOptHelper::OptionKind;
+
+// Only the targets that have a command-line name can be chosen.
+std::map<std::string, int32_t> targetChoices() {
+    std::map<std::string, int32_t> choices;
+    for (uint32_t value = 0; value < kStorageTargetCount; ++value) {
+        if (const char* name = commandLineName(static_cast<StorageTarget>(value))) {
+            choices.emplace(name, static_cast<int32_t>(value));
+        }
+    }
+    return choices;
+}
+
+// In the order of the usage text.
+const GetOptHelper::OptionSpec kOptionTable[] = {
+    {kOptionBase, "base", "/var/nonvolatile/app", 1, "Base path for storage.", Kind::Plain, {}, nullptr},
+    {kOptionType, "type", "", 1, "Migration type to perform", Kind::Choice,
+     {{"simple", static_cast<int32_t>(MigrationType::simple)},
+      {"checked", static_cast<int32_t>(MigrationType::checked)},
+      {"redundant", static_cast<int32_t>(MigrationType::redundant)}},
+     nullptr},
+    {kOptionTarget, "target", "", 1, "Target to assign result to", Kind::Choice, targetChoices(), nullptr},
+    {kOptionCheck, "check", "settings", 1, "Check to apply in checked/redundant mode", Kind::Choice,
+     {{"settings", static_cast<int32_t>(CheckType::settings)},
+      {"lut", static_cast<int32_t>(CheckType::lut)},
+      {"overlay", static_cast<int32_t>(CheckType::overlay)}},
+     nullptr},
+    {kOptionQueryPresent, "query-present", "", 0,
+     "Don't migrate, return success if target exists, failure otherwise.  For scripting.", Kind::Plain, {},
+     nullptr},
+    {kOptionIfNotPresent, "if-not-present", "", 0, "Only migrate if not already present", Kind::Plain, {}, nullptr},
+    {kOptionIndex, "index", "0", 1, "Slot index within target.", Kind::Plain, {}, nullptr},
+    {kOptionData, "data", "", 1, "Path to file to read for migration data.", Kind::Plain, {}, nullptr},
+    {kOptionData2, "data2", "", 1,
+     "Path to file to read for 2nd block of migration data.  Required for 'redundant' migration type.", Kind::Plain,
+     {}, nullptr},
+    {kOptionVerbose, "verbose", "", 0, "Runs with extra logging.", Kind::Plain, {}, nullptr},
+    {kOptionDebug, "debug", "", 0, "Runs with extra debug logging.", Kind::Plain, {}, nullptr},
+    {kOptionHelp, "help", "", 0, "Print usage instructions.", Kind::Plain, {}, nullptr},
+};
+
+// Base 0, so "0x10" is 16 and "010" is 8. strtoul takes "-1" as the largest
+// unsigned long, which the range test then rejects.
+Status parseSlotIndex(const char* text, uint32_t& slotIndex) {
+    char* end = nullptr;
+    const unsigned long value = std::strtoul(text, &end, 0);
+    if (end == text || *end != '\0' || value > UINT32_MAX) return STATUS_INVALID_PARAMETER;
+    slotIndex = static_cast<uint32_t>(value);
+    return STATUS_OK;
+}
+
+}  // namespace
+
+Options::Options(int argc, char** argv) : GetOptHelper(kOptionTable, std::size(kOptionTable)) {
+    if (const OptionSpec* base = optFor(kOptionBase)) basePath = base->defaultValue;
+    programName = argv[0];
+    if (parse(argc, argv) != STATUS_OK) printUsage(1);
+}
+
+Options::~Options() = default;
+
+Status Options::handleOption(int id, const char* argument) {
+    switch (id) {
+        case -1: return STATUS_OK;
+        case kOptionBase: basePath = argument; return STATUS_OK;
+        case kOptionHelp: printUsage(0);
+        case kOptionIndex: return parseSlotIndex(argument, slotIndex);
+        case kOptionData: dataPath = argument; return STATUS_OK;
+        case kOptionData2: data2Path = argument; return STATUS_OK;
+        case kOptionVerbose: verbose = true; return STATUS_OK;
+        case kOptionDebug: debug = true; return STATUS_OK;
+        case kOptionIfNotPresent: ifNotPresent = true; return STATUS_OK;
+        case kOptionQueryPresent: queryPresent = true; return STATUS_OK;
+        default:
+            // getopt_long has already explained '?' on standard error.
+            std::printf("Unexpected option %d %c\n", id, id);
+            return STATUS_INVALID_PARAMETER;
+    }
+}
+
+Status Options::handleChoice(int id, const char*, int value) {
+    switch (id) {
+        case kOptionType:
+            migrationType = static_cast<MigrationType>(value);
+            migrationTypeSet = true;
+            return STATUS_OK;
+        case kOptionTarget:
+            target = static_cast<StorageTarget>(value);
+            targetSet = true;
+            return STATUS_OK;
+        case kOptionCheck:
+            // No "set" flag: the start value already means the settings check.
+            checkType = static_cast<CheckType>(value);
+            return STATUS_OK;
+        default:
+            std::printf("Invalid option %d\n", id);
+            return STATUS_INVALID_PARAMETER;
+    }
+}
+
+Status Options::invalidChoice(int id, const char* argument) {
+    switch (id) {
+        case kOptionType: std::printf("Invalid migration type '%s'\n", argument); break;
+        case kOptionTarget: std::printf("Invalid target type '%s'\n", argument); break;
+        case kOptionCheck: std::printf("Invalid check type '%s'\n", argument); break;
+        default: std::printf("Invalid option %d\n", id); break;
+    }
+    return STATUS_INVALID_PARAMETER;
+}
+
+// The positional arguments are ignored.
+Status Options::finish(char**, int) {
+    const char* missing = nullptr;
+    if (!targetSet) {
+        missing = "Please specify a target";
+    } else if (queryPresent) {
+        return STATUS_OK;  // a query needs nothing else
+    } else if (!migrationTypeSet) {
+        missing = "Please specify a migration type";
+    } else if (dataPath.empty()) {
+        missing = "Please specify a path to migration data";
+    } else if (migrationType == MigrationType::redundant && data2Path.empty()) {
+        missing = "Please specify a path to 2nd migration data block";
+    } else {
+        return STATUS_OK;
+    }
+    std::printf("%s\n", missing);
+    return STATUS_INVALID_PARAMETER;
+}
+
+void Options::printUsage(int status) const {
+    std::printf("Usage: %s [OPTIONS]\n", programName != nullptr ? programName : "");
+    std::fputs(usageText(kHelpColumn, kUsageWidth).c_str(), stdout);
+    std::fputs("\n", stdout);
+    std::exit(status);
+}

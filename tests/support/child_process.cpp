@@ -1,0 +1,65 @@
+#include "child_process.h"
+
+#include <cstdio>
+#include <cstdlib>
+#include <fcntl.h>
+#include <stdexcept>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "files.h"
+#include "scratch_dir.h"
+
+namespace testing_support {
+namespace {
+
+ProcessResult runCaptured(const std::function<void()>& inChild) {
+    ScratchDir dir;
+    const std::string outPath = (dir / "stdout").string();
+    const std::string errPath = (dir / "stderr").string();
+    std::fflush(stdout);
+    std::fflush(stderr);
+    const pid_t pid = fork();
+    if (pid < 0) throw std::runtime_error("fork failed");
+    if (pid == 0) {
+        const int out = open(outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+        const int err = open(errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+        const int in = open("/dev/null", O_RDONLY | O_CLOEXEC);
+        if (out < 0 || err < 0 || in < 0 || dup2(out, 1) < 0 || dup2(err, 2) < 0 || dup2(in, 0) < 0) _exit(126);
+        inChild();
+        _exit(127);
+    }
+    int status = 0;
+    while (waitpid(pid, &status, 0) < 0) {
+    }
+    ProcessResult result;
+    if (WIFEXITED(status)) result.exitStatus = WEXITSTATUS(status);
+    if (WIFSIGNALED(status)) result.signal = WTERMSIG(status);
+    result.out = readText(outPath);
+    result.err = readText(errPath);
+    return result;
+}
+
+}  // namespace
+
+ProcessResult runInChild(const std::function<int()>& body) {
+    return runCaptured([&] {
+        const int code = body();
+        std::fflush(stdout);
+        std::fflush(stderr);
+        _exit(code);
+    });
+}
+
+ProcessResult runProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& extraEnv) {
+    return runCaptured([&] {
+        for (const auto& [name, value] : extraEnv) setenv(name.c_str(), value.c_str(), 1);
+        std::vector<char*> args;
+        for (const auto& arg : argv) args.push_back(const_cast<char*>(arg.c_str()));
+        args.push_back(nullptr);
+        execv(args[0], args.data());
+        _exit(127);
+    });
+}
+
+}  // namespace testing_support

@@ -1,0 +1,27 @@
+// Running code and programs in child processes with their output captured.
+#pragma once
+
+#include <functional>
+#include <map>
+#include <string>
+#include <vector>
+
+namespace testing_support {
+
+struct ProcessResult {
+    int exitStatus = -1;  // exit code, or -1 when ended by a signal
+    int signal = 0;       // the signal that ended it, else 0
+    std::string out;      // everything written to standard output
+    std::string err;      // everything written to standard error
+};
+
+// Runs `body` in a forked child whose standard output and error go to
+// files; the child exits with body's return value. Use it for code that
+// changes process-wide state (log output mode, umask) or that must crash.
+ProcessResult runInChild(const std::function<int()>& body);
+
+// Runs a program (argv[0] is its path) with extra environment variables.
+ProcessResult runProgram(const std::vector<std::string>& argv,
+                         const std::map<std::string, std::string>& extraEnv = {});
+
+}  // namespace testing_support

@@ -1,0 +1,18 @@
+// Whole-file helpers for tests.
+#pragma once
+
+#include <cstdint>
+#include <filesystem>
+#include <string>
+#include <vector>
+
+namespace testing_support {
+
+using Bytes = std::vector<uint8_t>;
+
+std::string readText(const std::filesystem::path& path);
+Bytes readBytes(const std::filesystem::path& path);
+void writeText(const std::filesystem::path& path, const std::string& text);
+void writeBytes(const std::filesystem::path& path, const Bytes& bytes);
+
+}  // namespace testing_support

@@ -1,0 +1,20 @@
+#include "scratch_dir.h"
+
+#include <cstdlib>
+#include <stdexcept>
+#include <system_error>
+
+namespace testing_support {
+
+ScratchDir::ScratchDir() {
+    std::string pattern = (std::filesystem::temp_directory_path() / "migrate-settings-test-XXXXXX").string();
+    if (mkdtemp(pattern.data()) == nullptr) throw std::runtime_error("mkdtemp failed");
+    path_ = pattern;
+}
+
+ScratchDir::~ScratchDir() {
+    std::error_code ignored;
+    std::filesystem::remove_all(path_, ignored);
+}
+
+}  // namespace testing_support

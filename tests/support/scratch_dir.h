@@ -1,0 +1,24 @@
+// A scratch directory that is removed with everything in it when the test
+// ends, whether or not its assertions held.
+#pragma once
+
+#include <filesystem>
+#include <string>
+
+namespace testing_support {
+
+class ScratchDir {
+public:
+    ScratchDir();
+    ~ScratchDir();
+    ScratchDir(const ScratchDir&) = delete;
+    ScratchDir& operator=(const ScratchDir&) = delete;
+
+    const std::filesystem::path& path() const { return path_; }
+    std::filesystem::path operator/(const std::string& name) const { return path_ / name; }
+
+private:
+    std::filesystem::path path_;
+};
+
+}  // namespace testing_support

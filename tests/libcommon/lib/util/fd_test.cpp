@@ -258,9 +258,10 @@ TEST(OpenFd, SuccessKeepsCloseOnExecAndLogsNothing) {
         if ((fcntl(withCloexec.get(), F_GETFD) & FD_CLOEXEC) == 0) return 2;
         char buffer[16];
         if (::read(withCloexec.get(), buffer, sizeof buffer) != 7 || std::string(buffer, 7) != "content") return 3;
-        const UniqueFd without = openFd(path.c_str(), O_RDONLY);
-        if (!without) return 4;
-        if ((fcntl(without.get(), F_GETFD) & FD_CLOEXEC) != 0) return 5;
+        const UniqueFd synced = openFd(path.c_str(), O_RDONLY | O_CLOEXEC | O_SYNC);
+        if (!synced) return 4;
+        if ((fcntl(synced.get(), F_GETFL) & O_SYNC) != O_SYNC) return 5;
+        if ((fcntl(withCloexec.get(), F_GETFL) & O_SYNC) == O_SYNC) return 6;
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);

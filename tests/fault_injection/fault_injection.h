@@ -1,0 +1,38 @@
+// Running programs under the LD_PRELOAD fault-injection shim. The variables
+// and what they do are described at the top of fault_injection_shim.c.
+#pragma once
+
+#include <filesystem>
+#include <map>
+#include <string>
+
+namespace testing_support {
+
+using Environment = std::map<std::string, std::string>;
+
+// Path of the built shim.
+const char* faultInjectionLibrary();
+
+// Environment for runProgram that preloads the shim and nothing else: the
+// shim only forwards. ASAN_OPTIONS carries the inherited options plus
+// verify_asan_link_order=0, which a sanitized program needs to start with a
+// library preloaded ahead of its runtime.
+Environment preloadEnv();
+
+// Fails or ends the program at the `nth` call matching `call` ("rename",
+// "open", "mutating", ...). `action` is "errno:EIO" (any errno name or
+// number), "crash" or "short:BYTES". An empty `pathSubstr` counts calls on
+// every path; a non-empty `countFile` (absolute) receives the number of
+// matching calls seen.
+Environment faultEnv(const std::string& call, unsigned long nth, const std::string& action,
+                     const std::string& pathSubstr = "", const std::string& countFile = "");
+
+// Only counts the calls matching `call` into `countFile` (absolute).
+Environment faultCountEnv(const std::string& call, const std::string& countFile,
+                          const std::string& pathSubstr = "");
+
+// The number the shim wrote to a count file. Throws std::runtime_error when
+// the file is missing or does not hold one decimal number and a newline.
+unsigned long readFaultCount(const std::filesystem::path& countFile);
+
+}  // namespace testing_support

@@ -1,0 +1,161 @@
+#include "lib/util/crc32.h"
+
+#include <algorithm>
+#include <cstdint>
+#include <random>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+namespace {
+
+using Bytes = std::vector<uint8_t>;
+
+Bytes bytesOf(const std::string& text) { return Bytes(text.begin(), text.end()); }
+
+Bytes counting(size_t count) {
+    Bytes bytes(count);
+    for (size_t i = 0; i < count; ++i) bytes[i] = static_cast<uint8_t>(i);
+    return bytes;
+}
+
+Bytes repeated(const std::string& text, size_t times) {
+    Bytes bytes;
+    for (size_t i = 0; i < times; ++i) bytes.insert(bytes.end(), text.begin(), text.end());
+    return bytes;
+}
+
+// One bit at a time, straight from the polynomial: shares nothing with the
+// tables under test.
+uint32_t bitwiseCrc32(const uint8_t* data, size_t length) {
+    uint32_t state = 0xFFFFFFFFu;
+    for (size_t i = 0; i < length; ++i) {
+        state ^= data[i];
+        for (int bit = 0; bit < 8; ++bit) state = (state >> 1) ^ (0xEDB88320u & (0u - (state & 1u)));
+    }
+    return ~state;
+}
+
+Bytes randomBytes(std::mt19937& random, size_t count) {
+    std::uniform_int_distribution<int> byte(0, 255);
+    Bytes bytes(count);
+    for (auto& b : bytes) b = static_cast<uint8_t>(byte(random));
+    return bytes;
+}
+
+struct Vector {
+    const char* name;
+    Bytes data;
+    uint32_t expected;
+};
+
+// Expected values taken from Python's zlib.crc32.
+TEST(Crc32, KnownVectors) {
+    const std::vector<Vector> vectors = {
+        {"empty", Bytes{}, 0x00000000u},
+        {"a", bytesOf("a"), 0xE8B7BE43u},
+        {"check string", bytesOf("123456789"), 0xCBF43926u},
+        {"eight digits", bytesOf("12345678"), 0x9AE0DAAFu},
+        {"fox", bytesOf("The quick brown fox jumps over the lazy dog"), 0x414FA339u},
+        {"counting 0..255", counting(256), 0x29058C73u},
+        {"4096 zeros", Bytes(4096, 0x00), 0xC71C0011u},
+        {"4097 x 0xFF", Bytes(4097, 0xFF), 0x1F24BD79u},
+        {"check string x1000", repeated("123456789", 1000), 0x407589CFu},
+    };
+    for (const Vector& v : vectors) {
+        EXPECT_EQ(crc32(v.data.data(), v.data.size()), v.expected) << v.name;
+        EXPECT_EQ(crc32Finish(crc32Update(kCrc32Initial, v.data.data(), v.data.size())), v.expected) << v.name;
+    }
+}
+
+TEST(Crc32, NoBytesLeaveTheStateAndMayBeNull) {
+    EXPECT_EQ(crc32(nullptr, 0), 0u);
+    for (const uint32_t state : {0u, 1u, 0x12345678u, kCrc32Initial}) {
+        EXPECT_EQ(crc32Update(state, nullptr, 0), state);
+    }
+}
+
+TEST(Crc32, FinishInvertsTheState) {
+    EXPECT_EQ(kCrc32Initial, 0xFFFFFFFFu);
+    EXPECT_EQ(crc32Finish(0xFFFFFFFFu), 0u);
+    EXPECT_EQ(crc32Finish(0x340BC6D9u), 0xCBF43926u);
+    const Bytes digits = bytesOf("123456789");
+    EXPECT_EQ(crc32Update(kCrc32Initial, digits.data(), digits.size()), 0x340BC6D9u);
+}
+
+// Every length through a few eight-byte strides at every start alignment,
+// so each tail length meets each alignment.
+TEST(Crc32, ShortInputsAtEveryAlignmentMatchBitwise) {
+    std::mt19937 random(20240501u);
+    const Bytes buffer = randomBytes(random, 64 + 16);
+    for (size_t offset = 0; offset < 16; ++offset) {
+        for (size_t length = 0; length <= 64; ++length) {
+            ASSERT_EQ(crc32(buffer.data() + offset, length), bitwiseCrc32(buffer.data() + offset, length))
+                << "offset " << offset << " length " << length;
+        }
+    }
+}
+
+TEST(Crc32, RandomInputsMatchBitwise) {
+    std::mt19937 random(0xC0FFEEu);
+    std::uniform_int_distribution<size_t> lengthOf(0, 70000);
+    std::uniform_int_distribution<size_t> offsetOf(0, 15);
+    for (int round = 0; round < 150; ++round) {
+        const size_t length = lengthOf(random);
+        const size_t offset = offsetOf(random);
+        const Bytes buffer = randomBytes(random, offset + length);
+        ASSERT_EQ(crc32(buffer.data() + offset, length), bitwiseCrc32(buffer.data() + offset, length))
+            << "round " << round << " offset " << offset << " length " << length;
+    }
+}
+
+TEST(Crc32, IncrementalAtRandomSplitsMatchesOneShot) {
+    std::mt19937 random(77u);
+    std::uniform_int_distribution<size_t> lengthOf(0, 70000);
+    std::uniform_int_distribution<int> piecesOf(1, 12);
+    for (int round = 0; round < 100; ++round) {
+        const Bytes data = randomBytes(random, lengthOf(random));
+        std::vector<size_t> cuts{0, data.size()};
+        const int pieces = piecesOf(random);
+        std::uniform_int_distribution<size_t> cutAt(0, data.size());
+        for (int i = 1; i < pieces; ++i) cuts.push_back(cutAt(random));
+        std::sort(cuts.begin(), cuts.end());
+
+        uint32_t state = kCrc32Initial;
+        for (size_t i = 0; i + 1 < cuts.size(); ++i) {
+            state = crc32Update(state, data.data() + cuts[i], cuts[i + 1] - cuts[i]);
+        }
+        ASSERT_EQ(crc32Finish(state), bitwiseCrc32(data.data(), data.size())) << "round " << round;
+        ASSERT_EQ(crc32Finish(state), crc32(data.data(), data.size())) << "round " << round;
+    }
+}
+
+// The way a file is checksummed: whole 4096-byte blocks and a short tail.
+TEST(Crc32, BlocksOf4096MatchOneShot) {
+    std::mt19937 random(4096u);
+    for (const size_t length : {size_t{0}, size_t{1}, size_t{4095}, size_t{4096}, size_t{4097}, size_t{8192},
+                                size_t{3 * 4096 + 123}}) {
+        const Bytes data = randomBytes(random, length);
+        uint32_t state = kCrc32Initial;
+        for (size_t at = 0; at < length; at += 4096) {
+            state = crc32Update(state, data.data() + at, std::min<size_t>(4096, length - at));
+        }
+        EXPECT_EQ(crc32Finish(state), bitwiseCrc32(data.data(), data.size())) << "length " << length;
+    }
+}
+
+TEST(Crc32, EverySingleBitFlipChangesTheValue) {
+    std::mt19937 random(5u);
+    Bytes data = randomBytes(random, 40);
+    const uint32_t original = crc32(data.data(), data.size());
+    for (size_t bit = 0; bit < data.size() * 8; ++bit) {
+        data[bit / 8] ^= static_cast<uint8_t>(1u << (bit % 8));
+        const uint32_t flipped = crc32(data.data(), data.size());
+        ASSERT_NE(flipped, original) << "bit " << bit;
+        ASSERT_EQ(flipped, bitwiseCrc32(data.data(), data.size())) << "bit " << bit;
+        data[bit / 8] ^= static_cast<uint8_t>(1u << (bit % 8));
+    }
+}
+
+}  // namespace

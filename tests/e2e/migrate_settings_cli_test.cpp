@@ -1,19 +1,30 @@
 // The command line of migrate_settings, seen from outside: the built binary
 // runs as a child process and its output is compared byte for byte.
 
+#include <filesystem>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include <gtest/gtest.h>
 
-#include "child_process.h"
+#include "scratch_dir.h"
+#include "tool_run.h"
 
 namespace {
 
-using testing_support::ProcessResult;
-using testing_support::runProgram;
+namespace fs = std::filesystem;
+using e2e::Bytes;
+using e2e::concat;
+using e2e::describe;
+using e2e::ProcessResult;
+using e2e::registerLines;
+using e2e::runTool;
+using e2e::storedFiles;
+using testing_support::readBytes;
+using testing_support::ScratchDir;
 
-const std::string kBinary = MIGRATE_SETTINGS_BIN;
+using Files = std::vector<std::string>;
 
 const std::string kOptionList =
     "  -b, --base=arg          Base path for storage.\n"
@@ -34,48 +45,86 @@ const std::string kOptionList =
     "  --debug                 Runs with extra debug logging.\n"
     "  -h, --help              Print usage instructions.\n";
 
-const std::string kUsage = "Usage: " + kBinary + " [OPTIONS]\n" + kOptionList + "\n";
+const std::string kUsage = "Usage: " + e2e::kBinary + " [OPTIONS]\n" + kOptionList + "\n";
 
-ProcessResult run(std::vector<std::string> args) {
-    args.insert(args.begin(), kBinary);
-    return runProgram(args);
+// Passes the settings check as well as the LUT check: its first bytes
+// 80 11 declare a settings block of 0x1180 bytes, whose checksum follows.
+constexpr size_t kDualLength = 0x1180;
+Bytes settingsAndLut() {
+    Bytes bytes = e2e::lutFile(19784);
+    e2e::putLe16(bytes, kDualLength - 2, e2e::bsdChecksum16(bytes.data(), kDualLength - 2));
+    return bytes;
 }
 
-std::string describe(const std::vector<std::string>& args) {
-    std::string text;
-    for (const std::string& arg : args) text += " '" + arg + "'";
-    return text;
-}
+Bytes head(const Bytes& bytes, size_t length) { return Bytes(bytes.begin(), bytes.begin() + length); }
 
-// A line that passes all option checks; no target is registered yet, so the
-// run ends there with status 1 and, without --verbose, says nothing.
+// Lines that get past option parsing run for real, so every one of them
+// names a scratch store with --base (first, so that a "--" later on the
+// line cannot turn it into a positional argument). Data file "a" passes the
+// settings and LUT checks, "b" is an overlay.
+class CliRun : public ::testing::Test {
+protected:
+    ScratchDir scratch;
+    const fs::path base = scratch / "base";
+    const Bytes aBytes = settingsAndLut();
+    const Bytes bBytes = e2e::overlayFile(16, 300);
+    const std::string a = write("a", aBytes);
+    const std::string b = write("b", bBytes);
+
+    std::string write(const std::string& name, const Bytes& bytes) const {
+        testing_support::writeBytes(scratch / name, bytes);
+        return (scratch / name).string();
+    }
+
+    ProcessResult run(const std::vector<std::string>& args) const {
+        return runTool(concat({"--base", base.string()}, args));
+    }
+
+    // A valid query: the fresh slot is absent, and a query stores nothing.
+    void expectQueried(const std::vector<std::string>& args) const {
+        SCOPED_TRACE(describe(args));
+        const ProcessResult result = run(args);
+        EXPECT_EQ(result.exitStatus, 10);
+        EXPECT_EQ(result.out, "");
+        EXPECT_EQ(result.err, "");
+        EXPECT_EQ(storedFiles(base), Files{});
+    }
+
+    // A valid migration: `stored` lands in copy "2" of `slotDirectory`.
+    void expectMigrated(const std::vector<std::string>& args, const std::string& slotDirectory,
+                        const Bytes& stored) const {
+        SCOPED_TRACE(describe(args));
+        const ProcessResult result = run(args);
+        EXPECT_EQ(result.exitStatus, 0);
+        EXPECT_EQ(result.out, "");
+        EXPECT_EQ(result.err, "");
+        const std::string dataPath = slotDirectory + "/2/data";
+        EXPECT_EQ(storedFiles(base), (Files{dataPath, dataPath + ".chk"}));
+        if (fs::exists(base / dataPath)) {
+            EXPECT_EQ(readBytes(base / dataPath), stored);
+        }
+        fs::remove_all(base);
+    }
+
+    // Rejected while parsing: no store is built.
+    void expectRejected(const std::vector<std::string>& args, const std::string& message) const {
+        SCOPED_TRACE(describe(args));
+        const ProcessResult result = run(args);
+        EXPECT_EQ(result.exitStatus, 1);
+        EXPECT_EQ(result.out, message + kUsage);
+        EXPECT_EQ(result.err, "");
+        EXPECT_FALSE(fs::exists(base));
+    }
+};
+
 const std::vector<std::string> kValidQuery = {"--target", "settings", "--query-present"};
-
-void expectAccepted(const std::vector<std::string>& args) {
-    SCOPED_TRACE(describe(args));
-    const ProcessResult result = run(args);
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "");
-    EXPECT_EQ(result.err, "");
-}
-
-void expectRejected(const std::vector<std::string>& args, const std::string& message) {
-    SCOPED_TRACE(describe(args));
-    const ProcessResult result = run(args);
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, message + kUsage);
-    EXPECT_EQ(result.err, "");
-}
-
-std::vector<std::string> concat(std::vector<std::string> head, const std::vector<std::string>& tail) {
-    head.insert(head.end(), tail.begin(), tail.end());
-    return head;
-}
 
 // ---------------------------------------------------------------------------
 // Help
 
-TEST(MigrateSettingsHelp, PrintsTheUsageAndExitsZero) {
+using MigrateSettingsHelp = CliRun;
+
+TEST_F(MigrateSettingsHelp, PrintsTheUsageAndExitsZero) {
     for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
              {"-h"}, {"--help"}, {"-vh"}, {"pos", "-h"}}) {
         SCOPED_TRACE(describe(args));
@@ -84,14 +133,16 @@ TEST(MigrateSettingsHelp, PrintsTheUsageAndExitsZero) {
         EXPECT_EQ(result.out, kUsage);
         EXPECT_EQ(result.err, "");
     }
+    EXPECT_FALSE(fs::exists(base));
 }
 
-TEST(MigrateSettingsHelp, WinsWhenParsedEvenIfLaterOptionsAreBad) {
+TEST_F(MigrateSettingsHelp, WinsWhenParsedEvenIfLaterOptionsAreBad) {
     for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
              {"-h", "--type", "foo"},
              {"-h", "--bogus"},
              {"--target", "settings", "-h", "--index", "12abc"},
              {"--target", "settings", "--query-present", "-h"},
+             {"--target", "settings", "--type", "simple", "--data", a, "--help"},
              {"--help", "--check"},
          }) {
         SCOPED_TRACE(describe(args));
@@ -100,9 +151,10 @@ TEST(MigrateSettingsHelp, WinsWhenParsedEvenIfLaterOptionsAreBad) {
         EXPECT_EQ(result.out, kUsage);
         EXPECT_EQ(result.err, "");  // getopt_long never reached the bad option
     }
+    EXPECT_FALSE(fs::exists(base));
 }
 
-TEST(MigrateSettingsHelp, AnErrorBeforeHelpWins) {
+TEST_F(MigrateSettingsHelp, AnErrorBeforeHelpWins) {
     expectRejected({"--type", "foo", "-h"}, "Invalid migration type 'foo'\n");
     expectRejected({"--index", "12abc", "--help"}, "");
 
@@ -110,12 +162,15 @@ TEST(MigrateSettingsHelp, AnErrorBeforeHelpWins) {
     EXPECT_EQ(unknown.exitStatus, 1);
     EXPECT_EQ(unknown.out, "Unexpected option 63 ?\n" + kUsage);
     EXPECT_NE(unknown.err, "");
+    EXPECT_FALSE(fs::exists(base));
 }
 
 // ---------------------------------------------------------------------------
 // Missing options (checked after all options were read)
 
-TEST(MigrateSettingsRequired, EachMissingPieceIsNamed) {
+using MigrateSettingsRequired = CliRun;
+
+TEST_F(MigrateSettingsRequired, EachMissingPieceIsNamed) {
     struct Case {
         std::vector<std::string> args;
         const char* message;
@@ -123,72 +178,107 @@ TEST(MigrateSettingsRequired, EachMissingPieceIsNamed) {
     const std::vector<Case> cases = {
         {{}, "Please specify a target\n"},
         {{"--query-present"}, "Please specify a target\n"},
-        {{"--type", "simple", "--data", "a", "--if-not-present"}, "Please specify a target\n"},
+        {{"--type", "simple", "--data", a, "--if-not-present"}, "Please specify a target\n"},
         {{"--target", "settings"}, "Please specify a migration type\n"},
-        {{"--target", "settings", "--if-not-present", "--data", "a"}, "Please specify a migration type\n"},
+        {{"--target", "settings", "--if-not-present", "--data", a}, "Please specify a migration type\n"},
         {{"--target", "settings", "--type", "simple"}, "Please specify a path to migration data\n"},
-        {{"--target", "settings", "--type", "checked", "--data2", "b"}, "Please specify a path to migration data\n"},
+        {{"--target", "settings", "--type", "checked", "--data2", b}, "Please specify a path to migration data\n"},
         {{"--target", "settings", "--type", "simple", "--data", ""}, "Please specify a path to migration data\n"},
-        {{"--type", "redundant", "--target", "lut", "--data", "a"},
+        {{"--type", "redundant", "--target", "lut", "--data", a},
          "Please specify a path to 2nd migration data block\n"},
-        {{"--type", "redundant", "--target", "lut", "-m", "a", "-n", ""},
+        {{"--type", "redundant", "--target", "lut", "-m", a, "-n", ""},
          "Please specify a path to 2nd migration data block\n"},
     };
     for (const Case& c : cases) expectRejected(c.args, c.message);
 }
 
-TEST(MigrateSettingsRequired, QueryPresentWithTargetNeedsNothingElse) {
-    expectAccepted(kValidQuery);
-    expectAccepted({"--query-present", "--target", "lut"});
-    expectAccepted({"--query-present", "--target", "overlay", "--type", "redundant"});
+TEST_F(MigrateSettingsRequired, QueryPresentWithTargetNeedsNothingElse) {
+    expectQueried(kValidQuery);
+    expectQueried({"--query-present", "--target", "lut"});
+    expectQueried({"--query-present", "--target", "overlay", "--type", "redundant"});
 }
 
-TEST(MigrateSettingsRequired, CompleteMigrationLinesAreAccepted) {
-    expectAccepted({"--target", "settings", "--type", "simple", "--data", "a"});
-    expectAccepted({"--target", "lut", "--type", "checked", "--check", "lut", "-m", "a"});
-    expectAccepted({"--target", "overlay", "--type", "redundant", "--data", "a", "--data2", "b"});
-    expectAccepted({"--target", "overlay", "--type", "redundant", "-m", "a", "-n", "b", "--check", "overlay"});
+TEST_F(MigrateSettingsRequired, CompleteMigrationLinesAreAccepted) {
+    expectMigrated({"--target", "settings", "--type", "simple", "--data", a}, "settings", aBytes);
+    expectMigrated({"--target", "lut", "--type", "checked", "--check", "lut", "-m", a}, "app/luts/0", aBytes);
+    // Without --check the settings check picks "a", cut to its declared length.
+    expectMigrated({"--target", "overlay", "--type", "redundant", "--data", a, "--data2", b}, "app/overlays/0",
+                   head(aBytes, kDualLength));
+    expectMigrated({"--target", "overlay", "--type", "redundant", "-m", a, "-n", b, "--check", "overlay"},
+                   "app/overlays/0", bBytes);
     // --data2 is accepted with every type.
-    expectAccepted({"--target", "settings", "--type", "simple", "--data", "a", "--data2", "b"});
-    expectAccepted({"--target=settings", "--type=checked", "--data=a", "--if-not-present", "--base=/tmp/x",
-                    "-b", "/tmp/y", "-i", "0", "--check=settings"});
+    expectMigrated({"--target", "settings", "--type", "simple", "--data", a, "--data2", b}, "settings", aBytes);
 }
 
-TEST(MigrateSettingsRequired, PositionalArgumentsAreIgnored) {
-    expectAccepted({"extra", "--target", "settings", "more", "--query-present", "words"});
-    expectAccepted({"--target", "settings", "--query-present", "--", "--bogus"});
+TEST_F(MigrateSettingsRequired, EqualsFormsAndTheLastBaseWin) {
+    const fs::path x = scratch / "x";
+    const fs::path y = scratch / "y";
+    const ProcessResult result =
+        runTool({"--target=settings", "--type=checked", "--data=" + a, "--if-not-present", "--base=" + x.string(),
+                 "-b", y.string(), "-i", "0", "--check=settings"});
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(result.out, "");
+    EXPECT_EQ(result.err, "");
+    EXPECT_FALSE(fs::exists(x));
+    EXPECT_EQ(storedFiles(y), (Files{"settings/2/data", "settings/2/data.chk"}));
+    EXPECT_EQ(readBytes(y / "settings/2/data"), head(aBytes, kDualLength));
 }
 
-TEST(MigrateSettingsRequired, ARepeatedOptionOverwritesTheEarlierValue) {
-    expectAccepted({"--type", "redundant", "--type", "simple", "--target", "settings", "--data", "a"});
-    expectRejected({"--type", "simple", "--type", "redundant", "--target", "settings", "--data", "a"},
+TEST_F(MigrateSettingsRequired, PositionalArgumentsAreIgnored) {
+    expectQueried({"extra", "--target", "settings", "more", "--query-present", "words"});
+    expectQueried({"--target", "settings", "--query-present", "--", "--bogus"});
+    expectMigrated({"--target", "settings", "--type", "simple", "--data", a, "--", "--data", b}, "settings", aBytes);
+}
+
+TEST_F(MigrateSettingsRequired, ARepeatedOptionOverwritesTheEarlierValue) {
+    expectMigrated({"--type", "redundant", "--type", "simple", "--target", "settings", "--data", a}, "settings",
+                   aBytes);
+    expectMigrated({"--target", "lut", "--target", "overlay", "--type", "simple", "--data", b, "--data", a},
+                   "app/overlays/0", aBytes);
+    expectRejected({"--type", "simple", "--type", "redundant", "--target", "settings", "--data", a},
                    "Please specify a path to 2nd migration data block\n");
-    expectRejected({"--data", "a", "--data", "", "--target", "settings", "--type", "simple"},
+    expectRejected({"--data", a, "--data", "", "--target", "settings", "--type", "simple"},
                    "Please specify a path to migration data\n");
-    expectRejected({"--target", "settings", "--type", "redundant", "-m", "a", "-n", "b", "--data2", ""},
+    expectRejected({"--target", "settings", "--type", "redundant", "-m", a, "-n", b, "--data2", ""},
                    "Please specify a path to 2nd migration data block\n");
 }
 
 // ---------------------------------------------------------------------------
 // Choice options
 
-TEST(MigrateSettingsChoices, EveryTypeWordIsAccepted) {
-    for (const char* type : {"simple", "checked"}) expectAccepted({"--target", "lut", "--type", type, "--data", "a"});
-    expectAccepted({"--target", "lut", "--type", "redundant", "--data", "a", "--data2", "b"});
+using MigrateSettingsChoices = CliRun;
+
+TEST_F(MigrateSettingsChoices, EveryTypeWordIsAccepted) {
+    expectMigrated({"--target", "lut", "--type", "simple", "--data", a}, "app/luts/0", aBytes);
+    expectMigrated({"--target", "lut", "--type", "checked", "--data", a}, "app/luts/0", head(aBytes, kDualLength));
+    expectMigrated({"--target", "lut", "--type", "redundant", "--data", b, "--data2", a}, "app/luts/0",
+                   head(aBytes, kDualLength));
 }
 
-TEST(MigrateSettingsChoices, EveryNamedTargetIsAccepted) {
+TEST_F(MigrateSettingsChoices, EveryNamedTargetIsAccepted) {
     for (const char* target : {"settings", "lut", "overlay", "calib_save", "calib_extra", "util_save",
                                "application_internal", "reboot_persistent"}) {
-        expectAccepted({"--query-present", "--target", target});
+        expectQueried({"--query-present", "--target", target});
     }
 }
 
-TEST(MigrateSettingsChoices, EveryCheckWordIsAccepted) {
-    for (const char* check : {"settings", "lut", "overlay"}) expectAccepted(concat(kValidQuery, {"--check", check}));
+TEST_F(MigrateSettingsChoices, EveryCheckWordIsAccepted) {
+    for (const char* check : {"settings", "lut", "overlay"}) expectQueried(concat(kValidQuery, {"--check", check}));
+    // Each word selects its own check: only "overlay" accepts "b".
+    expectMigrated({"--target", "overlay", "--type", "checked", "--check", "overlay", "--data", b}, "app/overlays/0",
+                   bBytes);
+    // The overlay's magic reads as LUT version 0x089C.
+    for (const auto& [check, out] :
+         {std::pair{"settings", ""}, std::pair{"lut", "Unable to parse LUT header at index 0\n"}}) {
+        SCOPED_TRACE(check);
+        const ProcessResult result = run({"--target", "overlay", "--type", "checked", "--check", check, "--data", b});
+        EXPECT_EQ(result.exitStatus, 1);
+        EXPECT_EQ(result.out, out);
+        EXPECT_EQ(storedFiles(base), Files{});
+    }
 }
 
-TEST(MigrateSettingsChoices, UnknownWordsAreNamedWithTheirOption) {
+TEST_F(MigrateSettingsChoices, UnknownWordsAreNamedWithTheirOption) {
     struct Case {
         std::vector<std::string> args;
         const char* message;
@@ -215,7 +305,9 @@ TEST(MigrateSettingsChoices, UnknownWordsAreNamedWithTheirOption) {
 // ---------------------------------------------------------------------------
 // Options that getopt_long itself rejects
 
-TEST(MigrateSettingsUnexpected, UnknownOptionsAndMissingArgumentsArriveAsQuestionMark) {
+using MigrateSettingsUnexpected = CliRun;
+
+TEST_F(MigrateSettingsUnexpected, UnknownOptionsAndMissingArgumentsArriveAsQuestionMark) {
     struct Case {
         std::vector<std::string> args;
         const char* inDiagnostic;  // part of getopt_long's own message on stderr
@@ -240,22 +332,55 @@ TEST(MigrateSettingsUnexpected, UnknownOptionsAndMissingArgumentsArriveAsQuestio
         EXPECT_EQ(result.out, "Unexpected option 63 ?\n" + kUsage);
         EXPECT_NE(result.err.find(c.inDiagnostic), std::string::npos) << result.err;
     }
+    EXPECT_FALSE(fs::exists(base));
 }
 
 // ---------------------------------------------------------------------------
 // --index
 
-TEST(MigrateSettingsIndex, AcceptedForms) {
-    for (const char* index : {"0", "31", "0x1f", "0X1F", "010", "4294967295", "0xffffffff", "037777777777", "+7",
-                              " 7", "-0"}) {
-        expectAccepted(concat(kValidQuery, {"--index", index}));
+using MigrateSettingsIndex = CliRun;
+
+// Each accepted form is told by its effect on the 26-slot LUT target: below
+// 26 the block lands in that slot; above, the range test names the count.
+TEST_F(MigrateSettingsIndex, AcceptedForms) {
+    struct Case {
+        std::vector<std::string> indexArgs;
+        unsigned long value;
+    };
+    const std::vector<Case> cases = {
+        {{"--index", "0"}, 0},
+        {{"--index", "25"}, 25},
+        {{"--index", "31"}, 31},
+        {{"--index", "0x1f"}, 31},
+        {{"--index", "0X1F"}, 31},
+        {{"--index", "0x19"}, 25},
+        {{"--index", "010"}, 8},
+        {{"--index", "031"}, 25},
+        {{"--index", "4294967295"}, 4294967295},
+        {{"--index", "0xffffffff"}, 4294967295},
+        {{"--index", "037777777777"}, 4294967295},
+        {{"--index", "+7"}, 7},
+        {{"--index", " 7"}, 7},
+        {{"--index", "-0"}, 0},
+        {{"-i", "5"}, 5},
+        {{"--index=0x10"}, 16},
+        {{"-i010"}, 8},
+    };
+    for (const Case& c : cases) {
+        const std::vector<std::string> args = concat({"--target", "lut", "--type", "simple", "--data", b}, c.indexArgs);
+        if (c.value < 26) {
+            expectMigrated(args, "app/luts/" + std::to_string(c.value), bBytes);
+        } else {
+            SCOPED_TRACE(describe(args));
+            const ProcessResult result = run(concat(args, {"--verbose"}));
+            EXPECT_EQ(result.exitStatus, 1);
+            EXPECT_EQ(result.out, registerLines(base) + "index is out of range of available slots 26\n");
+            EXPECT_EQ(storedFiles(base), Files{});
+        }
     }
-    expectAccepted(concat(kValidQuery, {"-i", "5"}));
-    expectAccepted(concat(kValidQuery, {"--index=0x10"}));
-    expectAccepted(concat(kValidQuery, {"-i010"}));
 }
 
-TEST(MigrateSettingsIndex, RejectedFormsPrintOnlyTheUsage) {
+TEST_F(MigrateSettingsIndex, RejectedFormsPrintOnlyTheUsage) {
     for (const char* index : {"12abc", "", "4294967296", "0x100000000", "-1", "-4294967295", "18446744073709551616",
                               "0x", "08", "7 ", "abc", " ", "1.0"}) {
         expectRejected(concat(kValidQuery, {"--index", index}), "");
@@ -265,24 +390,24 @@ TEST(MigrateSettingsIndex, RejectedFormsPrintOnlyTheUsage) {
 }
 
 // ---------------------------------------------------------------------------
-// Logging level and the run after parsing
+// Logging level once the line is accepted
 
-TEST(MigrateSettingsRun, VerboseOrDebugShowsThatTheTargetIsNotAvailable) {
-    for (const char* option : {"--verbose", "-v", "--debug"}) {
-        SCOPED_TRACE(option);
-        const ProcessResult result = run(concat(kValidQuery, {option}));
-        EXPECT_EQ(result.exitStatus, 1);
-        EXPECT_EQ(result.out, "Target not available\n");
+using MigrateSettingsLevel = CliRun;
+
+TEST_F(MigrateSettingsLevel, VerboseOrDebugListsTheStores) {
+    for (const std::vector<std::string>& levels : std::vector<std::vector<std::string>>{
+             {"--verbose"}, {"-v"}, {"--debug"}, {"--debug", "--verbose"}}) {
+        SCOPED_TRACE(describe(levels));
+        const ProcessResult result = run(concat(kValidQuery, levels));
+        EXPECT_EQ(result.exitStatus, 10);
+        EXPECT_EQ(result.out, registerLines(base));
         EXPECT_EQ(result.err, "");
     }
-    const ProcessResult both = run(concat(kValidQuery, {"--debug", "--verbose"}));
-    EXPECT_EQ(both.exitStatus, 1);
-    EXPECT_EQ(both.out, "Target not available\n");
 }
 
-TEST(MigrateSettingsRun, WithoutVerboseNothingIsPrinted) {
+TEST_F(MigrateSettingsLevel, WithoutVerboseNothingIsPrinted) {
     const ProcessResult result = run(kValidQuery);
-    EXPECT_EQ(result.exitStatus, 1);
+    EXPECT_EQ(result.exitStatus, 10);
     EXPECT_EQ(result.out, "");
     EXPECT_EQ(result.err, "");
 }

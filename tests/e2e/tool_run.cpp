@@ -1,0 +1,125 @@
+#include "tool_run.h"
+
+#include <algorithm>
+
+namespace e2e {
+namespace fs = std::filesystem;
+
+const std::string kBinary = MIGRATE_SETTINGS_BIN;
+
+ProcessResult runTool(std::vector<std::string> args) {
+    args.insert(args.begin(), kBinary);
+    return testing_support::runProgram(args);
+}
+
+std::string describe(const std::vector<std::string>& args) {
+    std::string text;
+    for (const std::string& arg : args) text += " '" + arg + "'";
+    return text;
+}
+
+std::vector<std::string> concat(std::vector<std::string> head, const std::vector<std::string>& tail) {
+    head.insert(head.end(), tail.begin(), tail.end());
+    return head;
+}
+
+std::string registerLines(const fs::path& base) {
+    struct Row {
+        const char* name;
+        const char* location;
+        const char* slots;
+    };
+    const Row rows[] = {
+        {"kIpiStorageTargetSettings", "settings", "1"},
+        {"kIpiStorageTargetOverlay", "app/overlays", "8"},
+        {"kIpiStorageTargetLUT", "app/luts", "26"},
+        {"kIpiStorageTargetCalibSave", "app/calibSave", "1"},
+        {"kIpiStorageTargetCalibExtra", "app/calibExtra", "1"},
+        {"kIpiStorageTargetUtilSave", "app/utilSave", "1"},
+        {"kIpiStorageTargetApplicationInternal", "app/internal", "1"},
+        {"kIpiStorageTargetRebootPersistent", "app/rebootPersistent", "1"},
+    };
+    std::string lines;
+    for (const Row& row : rows) {
+        lines += std::string("Register ") + row.name + " = DualFileTarget " + (base / row.location).string() + " [" +
+                 row.slots + "]\n";
+    }
+    return lines;
+}
+
+std::vector<std::string> storedFiles(const fs::path& base) {
+    std::vector<std::string> files;
+    std::error_code error;
+    if (!fs::is_directory(base, error)) return files;
+    for (const fs::directory_entry& entry : fs::recursive_directory_iterator(base)) {
+        if (!entry.is_directory()) files.push_back(entry.path().lexically_relative(base).generic_string());
+    }
+    std::sort(files.begin(), files.end());
+    return files;
+}
+
+uint32_t crc32(const Bytes& bytes) {
+    uint32_t crc = 0xFFFFFFFFu;
+    for (const uint8_t byte : bytes) {
+        crc ^= byte;
+        for (int bit = 0; bit < 8; ++bit) crc = (crc & 1u) != 0 ? (crc >> 1) ^ 0xEDB88320u : crc >> 1;
+    }
+    return ~crc;
+}
+
+Bytes checkFileFor(const Bytes& data) {
+    Bytes check(8);
+    putLe32(check, 0, static_cast<uint32_t>(data.size()));
+    putLe32(check, 4, crc32(data));
+    return check;
+}
+
+uint16_t bsdChecksum16(const uint8_t* data, size_t count) {
+    uint16_t sum = 0;
+    for (size_t i = 0; i < count; ++i) {
+        sum = static_cast<uint16_t>((sum >> 1) | ((sum & 1u) << 15));
+        sum = static_cast<uint16_t>(sum + data[i]);
+    }
+    return sum;
+}
+
+Bytes pattern(size_t size, uint8_t seed) {
+    Bytes bytes(size);
+    for (size_t i = 0; i < size; ++i) bytes[i] = static_cast<uint8_t>(i * 7 + i / 251 + seed * 13);
+    return bytes;
+}
+
+void putLe16(Bytes& bytes, size_t offset, uint16_t value) {
+    bytes.at(offset) = static_cast<uint8_t>(value);
+    bytes.at(offset + 1) = static_cast<uint8_t>(value >> 8);
+}
+
+void putLe32(Bytes& bytes, size_t offset, uint32_t value) {
+    for (size_t i = 0; i < 4; ++i) bytes.at(offset + i) = static_cast<uint8_t>(value >> (8 * i));
+}
+
+Bytes settingsBlock(uint16_t declared, size_t fileSize, uint8_t seed) {
+    Bytes bytes = pattern(fileSize, seed);
+    std::fill(bytes.begin() + declared, bytes.end(), 0xEE);
+    putLe16(bytes, 0, declared);
+    putLe16(bytes, declared - 2u, bsdChecksum16(bytes.data(), declared - 2u));
+    return bytes;
+}
+
+Bytes lutFile(size_t size, uint8_t seed) {
+    Bytes bytes = pattern(size, seed);
+    const uint8_t header[] = {0x80, 0x11, 0x02, 0x00};
+    std::copy(std::begin(header), std::end(header), bytes.begin());
+    return bytes;
+}
+
+Bytes overlayFile(uint32_t payload, size_t fileSize, uint8_t seed) {
+    Bytes bytes = pattern(fileSize, seed);
+    putLe32(bytes, 0, 0x089CC2CBu);
+    putLe16(bytes, 6, 5);
+    putLe32(bytes, 8, 1);
+    putLe32(bytes, 280, payload);
+    return bytes;
+}
+
+}  // namespace e2e

@@ -1,0 +1,65 @@
+// Running the built migrate_settings and looking at what it left in a store,
+// with the block formats and checksums computed here, independently of the
+// product's own code.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <filesystem>
+#include <string>
+#include <vector>
+
+#include "child_process.h"
+#include "files.h"
+
+namespace e2e {
+
+using testing_support::Bytes;
+using testing_support::ProcessResult;
+
+extern const std::string kBinary;
+
+// Runs the tool with `args` after its own path.
+ProcessResult runTool(std::vector<std::string> args);
+
+// " 'a' 'b'" for traces.
+std::string describe(const std::vector<std::string>& args);
+
+std::vector<std::string> concat(std::vector<std::string> head, const std::vector<std::string>& tail);
+
+// The eight "Register " lines that --verbose prints for `base`, in order.
+std::string registerLines(const std::filesystem::path& base);
+
+// Every entry below `base` that is not a directory, as sorted relative
+// paths; empty when `base` does not exist.
+std::vector<std::string> storedFiles(const std::filesystem::path& base);
+
+// IEEE 802.3 CRC-32, bit by bit.
+uint32_t crc32(const Bytes& bytes);
+
+// The 8 bytes a check file holds for a data file with these contents:
+// size, then CRC-32, both little-endian.
+Bytes checkFileFor(const Bytes& data);
+
+// The 16-bit rotate-right-and-add checksum, seed 0.
+uint16_t bsdChecksum16(const uint8_t* data, size_t count);
+
+// Bytes that differ from offset to offset, so that a shifted or truncated
+// copy never compares equal. `seed` tells two such blocks apart.
+Bytes pattern(size_t size, uint8_t seed);
+
+void putLe16(Bytes& bytes, size_t offset, uint16_t value);
+void putLe32(Bytes& bytes, size_t offset, uint32_t value);
+
+// A settings block declaring `declared` bytes (length field, contents,
+// checksum), filled with 0xEE up to `fileSize`. Needs 4 <= declared <= fileSize.
+Bytes settingsBlock(uint16_t declared, size_t fileSize, uint8_t seed = 1);
+
+// A lookup table of `size` bytes with the header 80 11 02 00.
+Bytes lutFile(size_t size, uint8_t seed = 2);
+
+// An overlay: good 284-byte header declaring `payload` bytes, `fileSize`
+// bytes in all.
+Bytes overlayFile(uint32_t payload, size_t fileSize, uint8_t seed = 3);
+
+}  // namespace e2e

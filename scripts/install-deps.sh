@@ -1,8 +1,13 @@
 #!/usr/bin/env bash
-# Installs the Debian packages that the build and the tests need, when missing.
+# Installs the Debian packages that the build needs, when missing.
+# `install-deps.sh tests`: also what the tests need (the simulated device is
+# partitioned with sfdisk and formatted with mkfs.ext4).
 set -euo pipefail
 
 packages=(cmake ninja-build g++ libgtest-dev)
+if [ "${1:-}" = tests ]; then
+  packages+=(fdisk e2fsprogs)
+fi
 
 missing=()
 for package in "${packages[@]}"; do

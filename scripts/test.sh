@@ -3,7 +3,7 @@
 # AddressSanitizer + UndefinedBehaviorSanitizer build.
 set -euo pipefail
 cd "$(dirname "$0")/.."
-scripts/install-deps.sh
+scripts/install-deps.sh tests
 
 for preset in default asan; do
   echo "=== preset: $preset"

@@ -1,15 +1,24 @@
 // The targets. Some error lines carry fixed line numbers (the *_LINE
 // constants) because device scripts match on them.
+#include <algorithm>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 #include <iomanip>
+#include <sys/stat.h>
 #include <sys/types.h>
 #include <unistd.h>
 
+#include "lib/storage/boot_vector_target.h"
 #include "lib/storage/check_value.h"
 #include "lib/storage/directories.h"
 #include "lib/storage/dual_file_target.h"
+#include "lib/storage/file_read_target.h"
+#include "lib/storage/firmware_update_boot_target.h"
+#include "lib/storage/firmware_update_partition_target.h"
+#include "lib/storage/mount_commands.h"
 #include "lib/util/log.h"
+#include "lib/util/run_command.h"
 
 namespace Storage {
 namespace fs = std::filesystem;
@@ -293,6 +302,431 @@ Status DualFileTarget::Slot::erase() {
         return status;
     }
     return commitOther(previousTime);
+}
+
+// ---------------------------------------------------------------------------
+// File-read target
+
+SlotHandle FileReadTarget::getSlot(size_t index) {
+    const auto found = slots_.find(static_cast<uint32_t>(index));
+    return found == slots_.end() ? SlotHandle() : SlotHandle::borrow(found->second.get());
+}
+
+Status FileReadTarget::addSlot(const char* name, size_t& index, size_t& size) {
+    const fs::path path = basePath_ / name;
+    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!fd) {
+        logOpenFailure(path.c_str(), errno);
+        return STATUS_FAILED;
+    }
+    size = fs::file_size(path);
+    index = nextIndex_;
+    // After the counter wraps, a new slot replaces the old one at its index.
+    slots_[nextIndex_++] = std::make_unique<Slot>(std::move(fd));
+    return STATUS_OK;
+}
+
+Status FileReadTarget::removeSlot(size_t index) {
+    return slots_.erase(static_cast<uint32_t>(index)) == 0 ? STATUS_INVALID_PARAMETER : STATUS_OK;
+}
+
+Status FileReadTarget::removeAllSlots() {
+    slots_.clear();
+    return STATUS_OK;
+}
+
+Status FileReadTarget::Slot::read(uint8_t* buffer, size_t size, int64_t offset) {
+    size_t ignored = 0;
+    return readSome(buffer, size, offset, ignored);
+}
+
+Status FileReadTarget::Slot::readSome(uint8_t* buffer, size_t size, int64_t offset, size_t& bytesRead) {
+    const ssize_t count = ::pread(fd_.get(), buffer, size, offset);
+    if (count < 0) {
+        bytesRead = 0;
+        return static_cast<Status>(errno);
+    }
+    bytesRead = static_cast<size_t>(count);
+    return STATUS_OK;
+}
+
+// ---------------------------------------------------------------------------
+// Boot-vector target
+
+namespace {
+
+constexpr const char* kFlashDevice = "/dev/mmcblk0";
+// The first number of the last line is the start of the last free area.
+constexpr const char* kFreeAreaCommand = "/usr/sbin/sfdisk -q -n -F /dev/mmcblk0 | tail -1";
+
+void logFlashWriteFailure(bool opened, int64_t written) {
+    LOGE << "Failed to write to flash: valid=" << (opened ? 1 : 0) << " written=" << written;
+}
+
+}  // namespace
+
+BootVectorTarget::Slot::Slot() {
+    if (locate() != STATUS_OK || sector_ == 0) return;
+    load();
+}
+
+Status BootVectorTarget::Slot::locate() {
+    std::string output;
+    if (runCommand(kFreeAreaCommand, output) != STATUS_OK) {
+        LOGE << "Failed to query flash size";
+        return STATUS_FAILED;
+    }
+    uint64_t sector = 0;
+    switch (parseBootVectorSector(output, sector)) {
+        case SectorParse::kNotANumber:
+            LOGE << "Failed to parse flash size '" << output << "'";
+            return STATUS_FAILED;
+        case SectorParse::kOutOfRange:
+            LOGE << "Boot vector " << sector << " not in range " << kBootVectorFirstSector << " to "
+                 << kBootVectorLastSector;
+            return STATUS_FAILED;
+        case SectorParse::kOk:
+            break;
+    }
+    sector_ = sector;
+    return STATUS_OK;
+}
+
+void BootVectorTarget::Slot::load() {
+    const UniqueFd fd(::open(kFlashDevice, O_RDONLY | O_CLOEXEC | O_SYNC));
+    if (!fd) logOpenFailure(kFlashDevice, errno);
+    if (!fd || ::lseek(fd.get(), static_cast<off_t>(sector_ * kSectorSize), SEEK_SET) < 0 ||
+        ::read(fd.get(), record_, sizeof record_) != static_cast<ssize_t>(sizeof record_) ||
+        !isValidBootVectorRecord(record_)) {
+        sector_ = 0;
+        LOGE << "Boot vector query failed!";
+    }
+}
+
+Status BootVectorTarget::Slot::read(uint8_t* buffer, size_t size, int64_t offset) {
+    if (sector_ == 0) {
+        LOGE << "Cannot read boot vector";
+        return STATUS_NOT_FOUND;
+    }
+    if (size != sizeof record_ || offset != 0) {
+        LOGE << "Unexpected length " << size << " or offset " << offset;
+        return STATUS_INVALID_PARAMETER;
+    }
+    std::memcpy(buffer, record_, sizeof record_);
+    return STATUS_OK;
+}
+
+Status BootVectorTarget::Slot::readSome(uint8_t* buffer, size_t size, int64_t offset, size_t& bytesRead) {
+    const Status status = read(buffer, size, offset);
+    if (status == STATUS_OK) bytesRead = sizeof record_;
+    return status;
+}
+
+Status BootVectorTarget::Slot::write(const uint8_t* data, size_t size) {
+    if (sector_ == 0) {
+        LOGE << "Cannot change boot vector";
+        return STATUS_NOT_FOUND;
+    }
+    if (size != sizeof record_) {
+        LOGE << "Unexpected length " << size;
+        return STATUS_INVALID_PARAMETER;
+    }
+    uint8_t candidate[kBootVectorRecordSize];
+    std::memcpy(candidate, data, sizeof candidate);
+    if (!isValidBootVectorRecord(candidate)) {
+        LOGE << "Failed validation of boot vectors";
+        return STATUS_FAILED;
+    }
+    // Cached before the device is written: a read after a failed write
+    // returns the record that was meant to be stored.
+    std::memcpy(record_, candidate, sizeof record_);
+
+    // O_SYNC is what makes the record durable; there is no separate sync.
+    const UniqueFd fd(::open(kFlashDevice, O_WRONLY | O_SYNC | O_CLOEXEC));
+    if (!fd) {
+        logOpenFailure(kFlashDevice, errno);
+        logFlashWriteFailure(false, 0);
+        return STATUS_FAILED;
+    }
+    if (::lseek(fd.get(), static_cast<off_t>(sector_ * kSectorSize), SEEK_SET) < 0) {
+        logFlashWriteFailure(true, 0);
+        return STATUS_FAILED;
+    }
+    const ssize_t written = ::write(fd.get(), record_, sizeof record_);
+    if (written < 0) {
+        const int error = errno;
+        LOGE << "BootVector write failed: " << error << ": " << std::strerror(error);
+        logFlashWriteFailure(true, -1);
+        return STATUS_FAILED;
+    }
+    if (written != static_cast<ssize_t>(sizeof record_)) {
+        logFlashWriteFailure(true, written);
+        return STATUS_FAILED;
+    }
+    LOGI << "Changed boot vector to " << bootVectorValue(record_);
+    return STATUS_OK;
+}
+
+// ---------------------------------------------------------------------------
+// Mount and remount commands
+
+const fs::path kBootMountPoint = "/media/boot";
+
+namespace {
+
+Status runMountCommand(const char* notice, const char* command, const std::string& mountPoint) {
+    LOGW << notice << std::quoted(mountPoint);
+    std::string ignoredOutput;
+    const Status status = runCommand(command + mountPoint, ignoredOutput);
+    if (status != STATUS_OK) LOG_STATUS(status);
+    return status;
+}
+
+}  // namespace
+
+Status remountBootPartition(bool writable) {
+    const char* const mode = writable ? "rw" : "ro";
+    LOGW << "Remounting " << std::quoted(kBootMountPoint.string()) << " as " << mode;
+    const std::string command = std::string("mount -o remount,") + mode + " " + kBootMountPoint.string();
+    if (std::system(command.c_str()) != 0) {
+        LOGE << "Failed to execute mount";
+        return STATUS_FAILED;
+    }
+    return STATUS_OK;
+}
+
+Status mountPartition(const std::string& mountPoint) { return runMountCommand("Mounting ", "mount ", mountPoint); }
+
+Status unmountPartition(const std::string& mountPoint) {
+    return runMountCommand("Unmounting ", "umount ", mountPoint);
+}
+
+// ---------------------------------------------------------------------------
+// Firmware-update boot-file target
+
+namespace {
+
+constexpr int kBootFileAttempts = 5;
+constexpr size_t kCompareBlock = 4096;
+
+void logAlreadyUpToDate() { LOGW << "Did not update file as it was already up to date"; }
+
+}  // namespace
+
+FirmwareUpdateBootTarget::FirmwareUpdateBootTarget() : slots_{Slot("BOOT.BIN"), Slot("BOOT0010.BIN")} {}
+
+SlotHandle FirmwareUpdateBootTarget::getSlot(size_t index) {
+    return index < 2 ? SlotHandle::borrow(&slots_[index]) : SlotHandle();
+}
+
+std::string FirmwareUpdateBootTarget::getDescription() const {
+    return "FirmwareUpdateBootTarget " + kBootMountPoint.string();
+}
+
+FirmwareUpdateBootTarget::Slot::Slot(const char* fileName) : destination_(kBootMountPoint / fileName) {}
+
+Status FirmwareUpdateBootTarget::Slot::close() {
+    if (!receive_) return STATUS_INVALID_OPERATION;
+    LOGI << "Closing " << temporaryPath_;
+    receive_.reset();
+    return STATUS_OK;
+}
+
+Status FirmwareUpdateBootTarget::Slot::beginWrite() {
+    if (receive_) {
+        // An interrupted update is thrown away, never resumed.
+        LOGW << "Restarting firmware update!";
+        (void)close();
+    }
+    LOGW << "Beginning update of /boot file " << std::quoted(destination_.string());
+    bytesReceived_ = 0;
+    temporaryPath_ = "/tmp/firmwareXXXXXX";
+    receive_.reset(::mkostemp(temporaryPath_.data(), O_CLOEXEC));
+    if (!receive_) return STATUS_FAILED;
+    LOGW << "Opened " << temporaryPath_ << " for receiving firmware";
+    // The data lives only behind the descriptor from here on, so nothing is
+    // left in /tmp whatever happens later.
+    (void)::unlink(temporaryPath_.c_str());
+    return STATUS_OK;
+}
+
+Status FirmwareUpdateBootTarget::Slot::writeAt(int64_t offset, const uint8_t* data, size_t size) {
+    if (!receive_) {
+        (void)close();
+        return STATUS_INVALID_OPERATION;
+    }
+    const ssize_t written = ::pwrite(receive_.get(), data, size, offset);
+    if (written < 0 && errno != 0) {
+        const int error = errno;
+        (void)close();
+        return static_cast<Status>(error);
+    }
+    if (written < 0 || static_cast<size_t>(written) != size) {
+        (void)close();
+        return STATUS_FAILED;
+    }
+    bytesReceived_ += static_cast<uint32_t>(size);
+    return STATUS_OK;
+}
+
+Status FirmwareUpdateBootTarget::Slot::compareWithDestination() {
+    // Sizes are 32-bit here: the received size is taken modulo 2^32.
+    const uint32_t receivedSize = static_cast<uint32_t>(::lseek(receive_.get(), 0, SEEK_END));
+    std::error_code error;
+    const std::uintmax_t fileSize = fs::file_size(destination_, error);
+    if (error) return STATUS_NOT_FOUND;
+    if (fileSize != receivedSize) return STATUS_FAILED;
+    const UniqueFd file(::open(destination_.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!file) {
+        logOpenFailure(destination_.c_str(), errno);
+        return STATUS_INVALID_OPERATION;
+    }
+
+    (void)::lseek(receive_.get(), 0, SEEK_SET);
+    uint8_t received[kCompareBlock];
+    uint8_t stored[kCompareBlock];
+    Status result = STATUS_OK;
+    for (uint32_t remaining = receivedSize; remaining > 0;) {
+        const size_t wanted = std::min<size_t>(kCompareBlock, remaining);
+        const ssize_t got = ::read(receive_.get(), received, wanted);
+        if (got <= 0) {
+            (void)::read(file.get(), stored, wanted);
+            result = STATUS_OUT_OF_RANGE;
+            break;
+        }
+        if (::read(file.get(), stored, got) < got) {
+            result = STATUS_OUT_OF_RANGE;
+            break;
+        }
+        if (std::memcmp(received, stored, got) != 0) {
+            result = STATUS_FAILED;
+            break;
+        }
+        if (remaining == got) break;
+        remaining -= static_cast<uint32_t>(got);
+    }
+    return result == STATUS_OK ? STATUS_OK : STATUS_FAILED;
+}
+
+Status FirmwareUpdateBootTarget::Slot::copyToDestination(int destination, uint32_t& written) {
+    uint8_t block[kCompareBlock];
+    for (;;) {
+        const ssize_t count = ::read(receive_.get(), block, sizeof block);
+        if (count == 0) return STATUS_OK;
+        if (count < 0) return STATUS_INVALID_OPERATION;
+        const ssize_t stored = ::write(destination, block, count);
+        if (stored < 0) {
+            const int error = errno;
+            LOGE << "cat: write failed: " << error << ": " << std::strerror(error);
+            return STATUS_INVALID_OPERATION;
+        }
+        written += static_cast<uint32_t>(stored);
+        if (stored != count) return STATUS_FAILED;
+    }
+}
+
+Status FirmwareUpdateBootTarget::Slot::writeDestination() {
+    for (int attempt = 1;; ++attempt) {
+        LOGI << "Opening " << std::quoted(destination_.string()) << " for write";
+        Status status = STATUS_FAILED;
+        UniqueFd file = openFd(destination_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, kFileMode);
+        if (!file) {
+            LOGE << "Failed to open BOOT.BIN for writing\n";
+        } else {
+            (void)::lseek(receive_.get(), 0, SEEK_SET);
+            uint32_t written = 0;
+            status = copyToDestination(file.get(), written);
+            LOGI << "Wrote " << written << " bytes";
+            file.reset();
+        }
+        // Read back whatever the attempt did, even a failed open.
+        if (compareWithDestination() == STATUS_OK) {
+            LOGW << "Readback successful for " << std::quoted(destination_.string());
+            return status;
+        }
+        if (attempt == kBootFileAttempts) return STATUS_FAILED;
+    }
+}
+
+Status FirmwareUpdateBootTarget::Slot::finalise() {
+    if (!receive_) return STATUS_NOT_FOUND;
+    LOGE << "TODO: Sanity-check the file";
+    LOGI << std::quoted(destination_.string()) << " update with " << bytesReceived_ << " bytes written";
+    if (bytesReceived_ == 0) {
+        (void)close();
+        return STATUS_FAILED;
+    }
+    if (compareWithDestination() == STATUS_OK) {
+        (void)close();
+        logAlreadyUpToDate();
+        return STATUS_OK;
+    }
+    LOGW << std::quoted(destination_.string()) << " needs updating";
+
+    if (const Status status = remountBootPartition(true)) {
+        (void)close();
+        if (status != STATUS_NOTHING_TO_DO) return status;
+        logAlreadyUpToDate();
+        return STATUS_OK;
+    }
+    const Status status = writeDestination();
+    (void)remountBootPartition(false);  // the update's own status is what matters
+    (void)close();
+    if (status == STATUS_NOTHING_TO_DO) {
+        logAlreadyUpToDate();
+        return STATUS_OK;
+    }
+    return status;
+}
+
+// ---------------------------------------------------------------------------
+// Firmware-update partition target
+
+FirmwareUpdatePartitionTarget::Slot::Slot() : mountPath_("/media/resources"), devicePath_("/dev/mmcblk0p2") {}
+
+Status FirmwareUpdatePartitionTarget::Slot::beginWrite() {
+    const bool restart = device_.valid();
+    if (restart) {
+        LOGW << "Restarting partition update!";
+        device_.reset();
+    }
+    std::error_code error;
+    if (!fs::is_block_file(devicePath_, error)) {
+        LOGE << "Unable to locate block device " << std::quoted(devicePath_.string());
+        return STATUS_NOT_FOUND;
+    }
+    bytesWritten_ = 0;
+    // On a restart the first begin has unmounted it already.
+    const Status unmounted = unmountPartition(mountPath_.string());
+    if (unmounted != STATUS_OK && !restart) {
+        LOGE << "Failed to unmount " << std::quoted(mountPath_.string());
+        return unmounted;
+    }
+    device_ = openFd(devicePath_.c_str(), O_WRONLY | O_CLOEXEC);
+    if (!device_) {
+        LOGE << "Failed to open " << std::quoted(devicePath_.string()) << " for writing";
+        return STATUS_FAILED;
+    }
+    LOGW << "Beginning partition update " << std::quoted(devicePath_.string()) << " at "
+         << std::quoted(mountPath_.string());
+    return STATUS_OK;
+}
+
+Status FirmwareUpdatePartitionTarget::Slot::writeAt(int64_t offset, const uint8_t* data, size_t size) {
+    if (!device_) return STATUS_INVALID_OPERATION;
+    const ssize_t written = ::pwrite(device_.get(), data, size, offset);
+    if (written < 0 && errno != 0) return static_cast<Status>(errno);
+    if (written < 0 || static_cast<size_t>(written) != size) return STATUS_FAILED;
+    bytesWritten_ += static_cast<uint32_t>(size);
+    return STATUS_OK;
+}
+
+Status FirmwareUpdatePartitionTarget::Slot::finalise() {
+    if (!device_) return STATUS_NOT_FOUND;
+    LOGI << "Wrote " << bytesWritten_ << " bytes to " << std::quoted(devicePath_.string());
+    // No separate sync: the last close of a block device writes back its cache.
+    device_.reset();
+    return mountPartition(mountPath_.string());
 }
 
 }  // namespace Storage

@@ -46,7 +46,13 @@ protected:
     std::string inScratch(const std::string& name) const { return (scratch / name).string(); }
 
     // Every run names the scratch store; nothing here may reach the device's.
+    // For command lines that get past option parsing and build the registry.
     ProcessResult run(const std::vector<std::string>& args) const {
+        return e2e::runAccepted(concat({"--base", base.string()}, args));
+    }
+
+    // For command lines that end in option parsing: the output as it came.
+    ProcessResult runUnparsed(const std::vector<std::string>& args) const {
         return e2e::runTool(concat({"--base", base.string()}, args));
     }
 
@@ -108,17 +114,21 @@ TEST(MigrateSettingsTestData, SettingsBlockLayout) {
 using MigrateSettingsExitStatus = ToolRun;
 
 TEST_F(MigrateSettingsExitStatus, HelpIsZeroAndBuildsNoStore) {
-    const ProcessResult result = run({"--target", "settings", "--type", "simple", "--data", "x", "--help"});
+    const ProcessResult result = runUnparsed({"--target", "settings", "--type", "simple", "--data", "x", "--help"});
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(result.out.rfind("Usage: " + e2e::kBinary + " [OPTIONS]\n", 0), 0u) << result.out;
+    // Not even the boot-vector target was built: nothing asked for the flash.
+    EXPECT_EQ(result.err, "");
     EXPECT_FALSE(fs::exists(base));
 }
 
 TEST_F(MigrateSettingsExitStatus, OptionErrorIsOneAndBuildsNoStore) {
     const std::string data = dataFile("block", settingsBlock(16, 16));
-    const ProcessResult result = run({"--target", "settings", "--type", "checked", "--check", "foo", "--data", data});
+    const ProcessResult result =
+        runUnparsed({"--target", "settings", "--type", "checked", "--check", "foo", "--data", data});
     EXPECT_EQ(result.exitStatus, 1);
     EXPECT_EQ(result.out.rfind("Invalid check type 'foo'\nUsage: ", 0), 0u) << result.out;
+    EXPECT_EQ(result.err, "");
     EXPECT_FALSE(fs::exists(base));
 }
 
@@ -374,7 +384,7 @@ TEST_F(MigrateSettingsExitStatus, SuccessfulWriteIsZeroAndSilent) {
 
 using MigrateSettingsLogLevel = ToolRun;
 
-TEST_F(MigrateSettingsLogLevel, VerboseListsTheEightStoresInRegistrationOrder) {
+TEST_F(MigrateSettingsLogLevel, VerboseListsEveryTargetInRegistrationOrder) {
     const std::string data = dataFile("block", settingsBlock(16, 16));
     for (const char* option : {"--verbose", "-v"}) {
         SCOPED_TRACE(option);
@@ -386,6 +396,19 @@ TEST_F(MigrateSettingsLogLevel, VerboseListsTheEightStoresInRegistrationOrder) {
                                             base.string() + "/app/overlays [8]\n",
                                         0),
               0u);
+    const std::string lines = registerLines(base);
+    EXPECT_EQ(std::count(lines.begin(), lines.end(), '\n'), 14);
+    const std::string deviceTargets =
+        "Register kIpiStorageTargetRebootPersistent = DualFileTarget " + base.string() +
+        "/app/rebootPersistent [1]\n"
+        "Register kIpiStorageTargetBootPartition = FileReadTarget /media/boot [0]\n"
+        "Register kIpiStorageTargetResourcePartition = FileReadTarget /media/resources [0]\n"
+        "Register kIpiStorageTargetResourceManufacturingPartition = FileReadTarget /media/static [0]\n"
+        "Register kIpiStorageTargetBootVector = BootVectorTarget [1]\n"
+        "Register kIpiStorageTargetFirmwareUpdateBootFile = FirmwareUpdateBootTarget /media/boot [2]\n"
+        "Register kIpiStorageTargetFirmwareUpdateResourcePartition = FirmwareUpdatePartitionTarget [1]\n";
+    ASSERT_GE(lines.size(), deviceTargets.size());
+    EXPECT_EQ(lines.substr(lines.size() - deviceTargets.size()), deviceTargets);
 }
 
 TEST_F(MigrateSettingsLogLevel, DebugPrintsWhatVerbosePrints) {
@@ -446,9 +469,9 @@ TEST_F(MigrateSettingsPlacement, BaseOptionPlacesTheStores) {
     const Bytes settings = settingsBlock(24, 24);
     const Bytes lut = lutFile(19784);
     // Not the fixture's run(): this one names its own base.
-    expectSilentSuccess(e2e::runTool(
+    expectSilentSuccess(e2e::runAccepted(
         {"--base", x.string(), "--target", "settings", "--type", "checked", "--data", dataFile("s", settings)}));
-    expectSilentSuccess(e2e::runTool({"--target", "lut", "--type", "checked", "--check", "lut", "--index", "3",
+    expectSilentSuccess(e2e::runAccepted({"--target", "lut", "--type", "checked", "--check", "lut", "--index", "3",
                                       "--data", dataFile("l", lut), "-b", x.string()}));
     EXPECT_EQ(storedFiles(x), (Files{"app/luts/3/2/data", "app/luts/3/2/data.chk", "settings/2/data",
                                      "settings/2/data.chk"}));
@@ -458,7 +481,7 @@ TEST_F(MigrateSettingsPlacement, BaseOptionPlacesTheStores) {
     EXPECT_FALSE(fs::exists(x / "app/luts/26"));
     EXPECT_TRUE(fs::is_directory(x / "app/overlays/7/2"));
     EXPECT_FALSE(fs::exists(x / "app/overlays/8"));
-    expectOutcome(e2e::runTool({"--base", x.string(), "--target", "settings", "--query-present", "-v"}), 0,
+    expectOutcome(e2e::runAccepted({"--base", x.string(), "--target", "settings", "--query-present", "-v"}), 0,
                   registerLines(x));
 }
 

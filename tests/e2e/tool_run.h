@@ -19,16 +19,49 @@ using testing_support::ProcessResult;
 
 extern const std::string kBinary;
 
-// Runs the tool with `args` after its own path.
+// Runs the tool with `args` after its own path; the result as it came.
 ProcessResult runTool(std::vector<std::string> args);
+
+// Where a run happens decides what building the registry logs: the
+// boot-vector target reads its record from "/dev/mmcblk0" on every run.
+enum class Host {
+    kSimulatedDevice,  // inside tests/device/run_on_device.sh: a valid record
+    kWithoutDevice,    // no "/dev/mmcblk0": the record cannot be located
+};
+
+// kSimulatedDevice when SIMULATED_DEVICE=1, else kWithoutDevice.
+Host currentHost();
+
+// What the partitioning tool (or the shell, when the tool is missing) says
+// on standard error when there is no "/dev/mmcblk0", one line each.
+extern const std::vector<std::string> kSfdiskComplaints;
+
+// For a run that got past option parsing, so that the registry was built.
+// Without the device: checks that standard output holds exactly one line
+// "lib/storage/storage_target:<line> Failed to parse flash size ''" (when
+// "Register " lines were printed, right after the last file-read target's
+// one) and that standard error holds exactly one of kSfdiskComplaints;
+// returns the result without those two lines. On the device: checks that there is no
+// such line and returns the result unchanged (its standard error is then
+// the tool's own). Mismatches are reported as non-fatal test failures.
+ProcessResult withoutBootVectorFailure(ProcessResult result, Host host = currentHost());
+
+// runTool for a command line that passes option parsing, through
+// withoutBootVectorFailure.
+ProcessResult runAccepted(std::vector<std::string> args);
 
 // " 'a' 'b'" for traces.
 std::string describe(const std::vector<std::string>& args);
 
 std::vector<std::string> concat(std::vector<std::string> head, const std::vector<std::string>& tail);
 
-// The eight "Register " lines that --verbose prints for `base`, in order.
+// The fourteen "Register " lines that --verbose prints for `base`, in
+// order: the eight dual-file stores, then the fixed device targets.
 std::string registerLines(const std::filesystem::path& base);
+
+// The last of the three file-read targets' lines, after which the
+// boot-vector target is built.
+extern const std::string kLastFileReadRegisterLine;
 
 // Every entry below `base` that is not a directory, as sorted relative
 // paths; empty when `base` does not exist.

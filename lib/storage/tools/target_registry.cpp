@@ -1,9 +1,18 @@
 #include "target_registry.h"
 
+#include "lib/storage/boot_vector_target.h"
 #include "lib/storage/dual_file_target.h"
+#include "lib/storage/file_read_target.h"
+#include "lib/storage/firmware_update_boot_target.h"
+#include "lib/storage/firmware_update_partition_target.h"
 #include "lib/util/log.h"
 
 namespace {
+
+struct PartitionRow {
+    StorageTarget id;
+    const char* path;
+};
 
 struct DualFileRow {
     StorageTarget id;
@@ -21,6 +30,13 @@ constexpr DualFileRow kDualFileRows[] = {
     {kIpiStorageTargetUtilSave, "app/utilSave", 1},
     {kIpiStorageTargetApplicationInternal, "app/internal", 1},
     {kIpiStorageTargetRebootPersistent, "app/rebootPersistent", 1},
+};
+
+// Read-only access to the device's partitions, after the dual-file stores.
+constexpr PartitionRow kPartitionRows[] = {
+    {kIpiStorageTargetBootPartition, "/media/boot"},
+    {kIpiStorageTargetResourcePartition, "/media/resources"},
+    {kIpiStorageTargetResourceManufacturingPartition, "/media/static"},
 };
 
 }  // namespace
@@ -58,6 +74,13 @@ void registerTargets(std::filesystem::path base, TargetRegistry& registry) {
     for (const DualFileRow& row : kDualFileRows) {
         registerTarget(registry, row.id, makeDualFileTarget(base / row.location, row.slotCount));
     }
-    // The device targets (partitions, boot vector, firmware update) follow
-    // here, after the stores under the base directory.
+    for (const PartitionRow& row : kPartitionRows) {
+        registerTarget(registry, row.id, std::make_unique<Storage::FileReadTarget>(row.path));
+    }
+    // Reads the boot vector from the flash device on every run.
+    registerTarget(registry, kIpiStorageTargetBootVector, std::make_unique<Storage::BootVectorTarget>());
+    registerTarget(registry, kIpiStorageTargetFirmwareUpdateBootFile,
+                   std::make_unique<Storage::FirmwareUpdateBootTarget>());
+    registerTarget(registry, kIpiStorageTargetFirmwareUpdateResourcePartition,
+                   std::make_unique<Storage::FirmwareUpdatePartitionTarget>());
 }

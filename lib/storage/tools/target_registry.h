@@ -25,5 +25,6 @@ void registerTarget(TargetRegistry& registry, StorageTarget id, std::unique_ptr<
 std::unique_ptr<Storage::Target> makeDualFileTarget(std::filesystem::path&& location, const unsigned& slotCount);
 
 // Builds and registers every target: the dual-file stores below `base`,
-// then the device targets. Building creates the stores' directories.
+// then the partitions, the boot vector and the firmware-update targets.
+// Building creates the stores' directories and reads the boot vector.
 void registerTargets(std::filesystem::path base, TargetRegistry& registry);

@@ -1,0 +1,98 @@
+// One device-target operation per run, for tests that fail its calls
+// through the fault-injection shim. The log goes to standard output at the
+// informational threshold, followed by the results:
+//
+//   device_target_driver boot-vector-write HEX40
+//       "write <status>", then "read <status> <count> <hex>" of the slot
+//   device_target_driver boot-update SLOT FILE
+//       streams FILE in 4096-byte blocks into the boot-file slot:
+//       "begin <status>", "writes <status>", "finalise <status> valid <0|1>"
+#include <algorithm>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <fstream>
+#include <iterator>
+#include <string>
+#include <vector>
+
+#include "lib/storage/boot_vector_target.h"
+#include "lib/storage/firmware_update_boot_target.h"
+#include "lib/util/log.h"
+
+namespace {
+
+using Bytes = std::vector<uint8_t>;
+
+int usage() {
+    std::fprintf(stderr,
+                 "usage: device_target_driver boot-vector-write HEX40\n"
+                 "       device_target_driver boot-update SLOT FILE\n");
+    return 2;
+}
+
+std::string hex(const uint8_t* bytes, size_t size) {
+    std::string text;
+    char digits[3];
+    for (size_t i = 0; i < size; ++i) {
+        std::snprintf(digits, sizeof digits, "%02x", bytes[i]);
+        text += digits;
+    }
+    return text;
+}
+
+bool fromHex(const std::string& text, Bytes& out) {
+    if (text.size() % 2 != 0) return false;
+    for (size_t i = 0; i < text.size(); i += 2) {
+        char* end = nullptr;
+        const std::string pair = text.substr(i, 2);
+        const unsigned long value = std::strtoul(pair.c_str(), &end, 16);
+        if (end != pair.c_str() + 2) return false;
+        out.push_back(static_cast<uint8_t>(value));
+    }
+    return true;
+}
+
+int bootVectorWrite(const std::string& recordHex) {
+    Bytes record;
+    if (!fromHex(recordHex, record)) return usage();
+    Storage::BootVectorTarget target;
+    Storage::TargetSlot& slot = *target.getSlot(0).get();
+    std::printf("write %u\n", slot.write(record.data(), record.size()));
+    uint8_t buffer[20];
+    std::memset(buffer, 0xEE, sizeof buffer);
+    size_t count = 99;
+    const Status status = slot.readSome(buffer, sizeof buffer, 0, count);
+    std::printf("read %u %zu %s\n", status, count, hex(buffer, sizeof buffer).c_str());
+    return 0;
+}
+
+int bootUpdate(const std::string& slotText, const char* file) {
+    std::ifstream in(file, std::ios::binary);
+    if (!in) return usage();
+    const Bytes data((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    Storage::FirmwareUpdateBootTarget target;
+    const Storage::SlotHandle handle = target.getSlot(std::strtoul(slotText.c_str(), nullptr, 10));
+    if (!handle) return usage();
+    Storage::TargetSlot& slot = *handle.get();
+    std::printf("begin %u\n", slot.beginWrite());
+    Status writes = STATUS_OK;
+    for (size_t offset = 0; offset < data.size() && writes == STATUS_OK; offset += 4096) {
+        const size_t size = std::min<size_t>(4096, data.size() - offset);
+        writes = slot.writeAt(static_cast<int64_t>(offset), data.data() + offset, size);
+    }
+    std::printf("writes %u\n", writes);
+    const Status finalised = slot.finalise();
+    std::printf("finalise %u valid %d\n", finalised, slot.isValid() ? 1 : 0);
+    return 0;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    setLogOutput(LOG_OUTPUT_STDOUT);
+    setLogLevel(LOG_PRIORITY_INFO);
+    if (argc == 3 && std::strcmp(argv[1], "boot-vector-write") == 0) return bootVectorWrite(argv[2]);
+    if (argc == 4 && std::strcmp(argv[1], "boot-update") == 0) return bootUpdate(argv[2], argv[3]);
+    return usage();
+}

@@ -1,0 +1,570 @@
+// The firmware-update targets on a host without the device: everything
+// that happens before "/media/boot" or "/dev/mmcblk0p2" is needed. The rest
+// runs on the simulated device (tests/device/targets).
+#include <climits>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <functional>
+#include <map>
+#include <regex>
+#include <string>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <unistd.h>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "child_process.h"
+#include "files.h"
+#include "lib/storage/firmware_update_boot_target.h"
+#include "lib/storage/firmware_update_partition_target.h"
+#include "lib/util/log.h"
+#include "scratch_dir.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using Storage::FirmwareUpdateBootTarget;
+using Storage::FirmwareUpdatePartitionTarget;
+using Storage::TargetSlot;
+using testing_support::ProcessResult;
+using testing_support::readText;
+using testing_support::runInChild;
+using testing_support::ScratchDir;
+using testing_support::writeText;
+
+using Bytes = std::vector<uint8_t>;
+
+// Stand-ins for mount and umount, first on PATH, that record their
+// arguments and exit with FAKE_MOUNT_EXIT (default 0).
+class FakeMountCommands {
+public:
+    FakeMountCommands() {
+        for (const char* name : {"mount", "umount"}) {
+            const fs::path script = dir_ / name;
+            writeText(script,
+                      "#!/bin/sh\n"
+                      "{ printf '%s' \"${0##*/}\"; for a in \"$@\"; do printf ' [%s]' \"$a\"; done; echo; } >>'" +
+                          (dir_ / "record").string() + "'\nexit ${FAKE_MOUNT_EXIT:-0}\n");
+            fs::permissions(script, fs::perms::owner_all);
+        }
+        writeText(dir_ / "record", "");
+    }
+
+    std::string calls() const { return readText(dir_ / "record"); }
+
+    // In a child: the fakes first on PATH, the log on standard output at
+    // `threshold`, then `body`.
+    ProcessResult run(int threshold, const std::function<int()>& body,
+                      const std::map<std::string, std::string>& env = {}) const {
+        return runInChild([&] {
+            const char* path = std::getenv("PATH");
+            setenv("PATH", (dir_.path().string() + ":" + (path != nullptr ? path : "/usr/bin:/bin")).c_str(), 1);
+            for (const auto& [name, value] : env) setenv(name.c_str(), value.c_str(), 1);
+            setLogOutput(LOG_OUTPUT_STDOUT);
+            setLogLevel(threshold);
+            return body();
+        });
+    }
+
+private:
+    ScratchDir dir_;
+};
+
+// Line numbers of lib/storage/storage_target error lines become N, and each
+// distinct temporary file name becomes #1, #2, ... in order of appearance.
+std::string normalised(const std::string& text) {
+    static const std::regex prefix(R"(lib/storage/storage_target:[0-9]+ )");
+    static const std::regex report(R"(\[lib/storage/storage_target:[0-9]+\] )");
+    static const std::regex temporary(R"(/tmp/firmware[A-Za-z0-9]{6})");
+    std::string out = std::regex_replace(text, prefix, "lib/storage/storage_target:N ");
+    out = std::regex_replace(out, report, "[lib/storage/storage_target:N] ");
+    std::vector<std::string> names;
+    std::string result;
+    auto last = out.cbegin();
+    for (std::sregex_iterator it(out.begin(), out.end(), temporary), end; it != end; ++it) {
+        const std::string name = it->str();
+        size_t number = 0;
+        while (number < names.size() && names[number] != name) ++number;
+        if (number == names.size()) names.push_back(name);
+        result.append(last, out.cbegin() + it->position());
+        result += "#" + std::to_string(number + 1);
+        last = out.cbegin() + it->position() + it->length();
+    }
+    result.append(last, out.cend());
+    return result;
+}
+
+// "/tmp/firmware..." descriptors this process holds, as the kernel names
+// them (a removed file carries " (deleted)"), and whether each is
+// close-on-exec.
+void printTemporaryDescriptors() {
+    for (const auto& entry : fs::directory_iterator("/proc/self/fd")) {
+        std::error_code error;
+        const fs::path target = fs::read_symlink(entry.path(), error);
+        if (error || target.string().rfind("/tmp/firmware", 0) != 0) continue;
+        const int fd = std::stoi(entry.path().filename().string());
+        std::printf("fd %s cloexec %d\n", target.c_str(), (fcntl(fd, F_GETFD) & FD_CLOEXEC) != 0 ? 1 : 0);
+    }
+}
+
+Bytes pattern(size_t size, uint8_t seed) {
+    Bytes bytes(size);
+    for (size_t i = 0; i < size; ++i) bytes[i] = static_cast<uint8_t>(seed + i * 11);
+    return bytes;
+}
+
+Status writeAt(TargetSlot& slot, int64_t offset, const Bytes& data) { return slot.writeAt(offset, data.data(), data.size()); }
+
+// ---- the boot-file target ----
+
+TEST(FirmwareUpdateBoot, TwoSlotsOnePerBootFile) {
+    FirmwareUpdateBootTarget target;
+    EXPECT_EQ(target.getSlotCount(), 2u);
+    EXPECT_EQ(target.getDescription(), "FirmwareUpdateBootTarget /media/boot");
+    ASSERT_TRUE(target.getSlot(0));
+    ASSERT_TRUE(target.getSlot(1));
+    EXPECT_FALSE(target.getSlot(0).ownsSlot());
+    EXPECT_NE(target.getSlot(0).get(), target.getSlot(1).get());
+    EXPECT_EQ(target.getSlot(1).get(), target.getSlot(1).get());
+    EXPECT_FALSE(target.getSlot(2));
+    EXPECT_FALSE(target.getSlot(size_t{1} << 32));
+    size_t index = 0;
+    size_t size = 0;
+    EXPECT_EQ(target.addSlot("BOOT.BIN", index, size), STATUS_NOT_IMPLEMENTED);
+    EXPECT_EQ(target.removeSlot(0), STATUS_NOT_IMPLEMENTED);
+    EXPECT_EQ(target.removeAllSlots(), STATUS_NOTHING_TO_DO);
+    EXPECT_EQ(target.getSlotCount(), 2u);
+}
+
+// No update in progress: nothing to finalise, write or close, and nothing
+// said about it.
+TEST(FirmwareUpdateBoot, IdleSlot) {
+    FakeMountCommands fake;
+    const auto result = fake.run(LOG_PRIORITY_DEBUG, [] {
+        FirmwareUpdateBootTarget target;
+        TargetSlot& slot = *target.getSlot(0).get();
+        const Bytes data = pattern(10, 1);
+        uint8_t buffer[10] = {};
+        size_t got = 5;
+        std::printf("exists %d valid %d\n", slot.exists() ? 1 : 0, slot.isValid() ? 1 : 0);
+        std::printf("finalise %u\n", slot.finalise());
+        std::printf("writeAt %u\n", writeAt(slot, 0, data));
+        std::printf("erase %u\n", slot.erase());
+        std::printf("write %u\n", slot.write(data.data(), data.size()));
+        std::printf("read %u\n", slot.read(buffer, sizeof buffer, 0));
+        std::printf("readSome %u\n", slot.readSome(buffer, sizeof buffer, 0, got));
+        std::printf("got %zu\n", got);
+        std::printf("valid %d\n", slot.isValid() ? 1 : 0);
+        return 0;
+    });
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(result.out,
+              "exists 1 valid 0\n"
+              "finalise 2\n"
+              "writeAt 95\n"
+              "erase 95\n"
+              "write 38\n"
+              "read 38\n"
+              "readSome 38\n"
+              "got 5\n"
+              "valid 0\n");
+    EXPECT_EQ(fake.calls(), "");
+}
+
+TEST(FirmwareUpdateBoot, BeginOpensAnUnnamedTemporaryFile) {
+    const auto result = runInChild([] {
+        setLogOutput(LOG_OUTPUT_STDOUT);
+        setLogLevel(LOG_PRIORITY_DEBUG);
+        FirmwareUpdateBootTarget target;
+        TargetSlot& slot = *target.getSlot(0).get();
+        {
+            const Status status = slot.beginWrite();
+            std::printf("begin %u valid %d\n", status, slot.isValid() ? 1 : 0);
+        }
+        printTemporaryDescriptors();
+        return 0;
+    });
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(normalised(result.out),
+              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
+              "Opened #1 for receiving firmware\n"
+              "begin 0 valid 1\n"
+              "fd #1 (deleted) cloexec 1\n");
+}
+
+TEST(FirmwareUpdateBoot, SecondSlotIsBoot0010) {
+    const auto result = runInChild([] {
+        setLogOutput(LOG_OUTPUT_STDOUT);
+        FirmwareUpdateBootTarget target;
+        std::printf("begin %u\n", target.getSlot(1)->beginWrite());
+        std::printf("slot 0 valid %d\n", target.getSlot(0)->isValid() ? 1 : 0);
+        return 0;
+    });
+    EXPECT_EQ(normalised(result.out),
+              "Beginning update of /boot file \"/media/boot/BOOT0010.BIN\"\n"
+              "Opened #1 for receiving firmware\n"
+              "begin 0\n"
+              "slot 0 valid 0\n");
+}
+
+TEST(FirmwareUpdateBoot, NothingBelowWarningPriority) {
+    const auto result = runInChild([] {
+        setLogOutput(LOG_OUTPUT_STDOUT);
+        setLogLevel(LOG_PRIORITY_ERROR);
+        FirmwareUpdateBootTarget target;
+        TargetSlot& slot = *target.getSlot(0).get();
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("erase %u\n", slot.erase());
+        return 0;
+    });
+    EXPECT_EQ(result.out, "begin 0\nbegin 0\nerase 0\n");
+}
+
+TEST(FirmwareUpdateBoot, BeginTwiceRestarts) {
+    const auto result = runInChild([] {
+        setLogOutput(LOG_OUTPUT_STDOUT);
+        setLogLevel(LOG_PRIORITY_INFO);
+        FirmwareUpdateBootTarget target;
+        TargetSlot& slot = *target.getSlot(0).get();
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(100, 1)));
+        {
+            const Status status = slot.beginWrite();
+            std::printf("begin %u valid %d\n", status, slot.isValid() ? 1 : 0);
+        }
+        printTemporaryDescriptors();
+        return 0;
+    });
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(normalised(result.out),
+              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
+              "Opened #1 for receiving firmware\n"
+              "begin 0\n"
+              "writeAt 0\n"
+              "Restarting firmware update!\n"
+              "Closing #1\n"
+              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
+              "Opened #2 for receiving firmware\n"
+              "begin 0 valid 1\n"
+              "fd #2 (deleted) cloexec 1\n");
+}
+
+// The restart's own count starts at 0: nothing received after it means a
+// failed finalise, whatever came before.
+TEST(FirmwareUpdateBoot, RestartForgetsWhatWasReceived) {
+    const auto result = runInChild([] {
+        setLogOutput(LOG_OUTPUT_STDOUT);
+        setLogLevel(LOG_PRIORITY_INFO);
+        FirmwareUpdateBootTarget target;
+        TargetSlot& slot = *target.getSlot(0).get();
+        (void)slot.beginWrite();
+        (void)writeAt(slot, 0, pattern(100, 1));
+        (void)slot.beginWrite();
+        std::printf("--\n");
+        std::printf("finalise %u\n", slot.finalise());
+        return 0;
+    });
+    const std::string out = normalised(result.out);
+    EXPECT_EQ(out.substr(out.find("--\n")),
+              "--\n"
+              "lib/storage/storage_target:N TODO: Sanity-check the file\n"
+              "\"/media/boot/BOOT.BIN\" update with 0 bytes written\n"
+              "Closing #2\n"
+              "finalise 52\n");
+}
+
+TEST(FirmwareUpdateBoot, FinaliseWithNothingReceivedFails) {
+    FakeMountCommands fake;
+    const auto result = fake.run(LOG_PRIORITY_INFO, [] {
+        FirmwareUpdateBootTarget target;
+        TargetSlot& slot = *target.getSlot(0).get();
+        std::printf("begin %u\n", slot.beginWrite());
+        {
+            const Status status = slot.finalise();
+            std::printf("finalise %u valid %d\n", status, slot.isValid() ? 1 : 0);
+        }
+        printTemporaryDescriptors();
+        std::printf("finalise %u\n", slot.finalise());
+        return 0;
+    });
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(normalised(result.out),
+              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
+              "Opened #1 for receiving firmware\n"
+              "begin 0\n"
+              "lib/storage/storage_target:N TODO: Sanity-check the file\n"
+              "\"/media/boot/BOOT.BIN\" update with 0 bytes written\n"
+              "Closing #1\n"
+              "finalise 52 valid 0\n"
+              "finalise 2\n");
+    EXPECT_EQ(fake.calls(), "");
+}
+
+// Empty blocks count nothing either.
+TEST(FirmwareUpdateBoot, EmptyWritesCountNothing) {
+    FakeMountCommands fake;
+    const auto result = fake.run(LOG_PRIORITY_ERROR, [] {
+        FirmwareUpdateBootTarget target;
+        TargetSlot& slot = *target.getSlot(1).get();
+        const Bytes none;
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("writeAt %u\n", writeAt(slot, 0, none));
+        std::printf("writeAt %u\n", writeAt(slot, 4096, none));
+        std::printf("finalise %u\n", slot.finalise());
+        return 0;
+    });
+    EXPECT_EQ(normalised(result.out),
+              "begin 0\n"
+              "writeAt 0\n"
+              "writeAt 0\n"
+              "lib/storage/storage_target:N TODO: Sanity-check the file\n"
+              "finalise 52\n");
+    EXPECT_EQ(fake.calls(), "");
+}
+
+TEST(FirmwareUpdateBoot, EraseAbandonsTheUpdate) {
+    const auto result = runInChild([] {
+        setLogOutput(LOG_OUTPUT_STDOUT);
+        setLogLevel(LOG_PRIORITY_INFO);
+        FirmwareUpdateBootTarget target;
+        TargetSlot& slot = *target.getSlot(1).get();
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
+        {
+            const Status status = slot.erase();
+            std::printf("erase %u valid %d\n", status, slot.isValid() ? 1 : 0);
+        }
+        printTemporaryDescriptors();
+        std::printf("erase %u\n", slot.erase());
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
+        std::printf("finalise %u\n", slot.finalise());
+        return 0;
+    });
+    EXPECT_EQ(normalised(result.out),
+              "Beginning update of /boot file \"/media/boot/BOOT0010.BIN\"\n"
+              "Opened #1 for receiving firmware\n"
+              "begin 0\n"
+              "writeAt 0\n"
+              "Closing #1\n"
+              "erase 0 valid 0\n"
+              "erase 95\n"
+              "writeAt 95\n"
+              "finalise 2\n");
+}
+
+// pwrite refuses a negative offset; the errno comes back and the update is
+// over, so the next block is refused.
+TEST(FirmwareUpdateBoot, StreamedWriteAfterAFailedOneIsRefused) {
+    const auto result = runInChild([] {
+        setLogOutput(LOG_OUTPUT_STDOUT);
+        setLogLevel(LOG_PRIORITY_INFO);
+        FirmwareUpdateBootTarget target;
+        TargetSlot& slot = *target.getSlot(0).get();
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
+        {
+            const Status status = writeAt(slot, -1, pattern(10, 2));
+            std::printf("writeAt %u valid %d\n", status, slot.isValid() ? 1 : 0);
+        }
+        std::printf("writeAt %u\n", writeAt(slot, 10, pattern(10, 3)));
+        std::printf("finalise %u\n", slot.finalise());
+        return 0;
+    });
+    EXPECT_EQ(normalised(result.out),
+              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
+              "Opened #1 for receiving firmware\n"
+              "begin 0\n"
+              "writeAt 0\n"
+              "Closing #1\n"
+              "writeAt 22 valid 0\n"
+              "writeAt 95\n"
+              "finalise 2\n");
+}
+
+// With the file-size limit at 1 MiB, a block across it is written short
+// (STATUS_FAILED) and a block beyond it fails with EFBIG; either ends the
+// update.
+TEST(FirmwareUpdateBoot, ShortOrFailedStreamedWriteEndsTheUpdate) {
+    constexpr rlim_t kLimit = 1 << 20;
+    const auto result = runInChild([] {
+        std::signal(SIGXFSZ, SIG_IGN);
+        const rlimit limit{kLimit, kLimit};
+        if (setrlimit(RLIMIT_FSIZE, &limit) != 0) return 1;
+        setLogOutput(LOG_OUTPUT_STDOUT);
+        setLogLevel(LOG_PRIORITY_INFO);
+        FirmwareUpdateBootTarget target;
+        TargetSlot& slot = *target.getSlot(0).get();
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(4096, 1)));
+        std::printf("writeAt %u\n", writeAt(slot, kLimit - 10, pattern(20, 2)));
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 3)));
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("writeAt %u\n", writeAt(slot, kLimit, pattern(10, 4)));
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 5)));
+        std::printf("finalise %u\n", slot.finalise());
+        return 0;
+    });
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(normalised(result.out),
+              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
+              "Opened #1 for receiving firmware\n"
+              "begin 0\n"
+              "writeAt 0\n"
+              "Closing #1\n"
+              "writeAt 52\n"
+              "writeAt 95\n"
+              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
+              "Opened #2 for receiving firmware\n"
+              "begin 0\n"
+              "Closing #2\n"
+              "writeAt 27\n"
+              "writeAt 95\n"
+              "finalise 2\n");
+}
+
+// Offsets are the caller's business: the count adds up the block sizes. The
+// boot file is missing here, so the update goes on to the read-write
+// remount, whose failure ends it without a read-only remount.
+TEST(FirmwareUpdateBoot, FailedRemountEndsTheUpdate) {
+    if (fs::exists("/media/boot")) GTEST_SKIP() << "this host has a /media/boot";
+    FakeMountCommands fake;
+    const auto result = fake.run(
+        LOG_PRIORITY_INFO,
+        [] {
+            FirmwareUpdateBootTarget target;
+            TargetSlot& slot = *target.getSlot(0).get();
+            std::printf("begin %u\n", slot.beginWrite());
+            std::printf("writeAt %u\n", writeAt(slot, 100, pattern(10, 1)));
+            std::printf("writeAt %u\n", writeAt(slot, 0, pattern(7, 2)));
+            std::printf("writeAt %u\n", writeAt(slot, 100, pattern(13, 3)));
+            {
+                const Status status = slot.finalise();
+                std::printf("finalise %u valid %d\n", status, slot.isValid() ? 1 : 0);
+            }
+            printTemporaryDescriptors();
+            return 0;
+        },
+        {{"FAKE_MOUNT_EXIT", "32"}});
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(normalised(result.out),
+              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
+              "Opened #1 for receiving firmware\n"
+              "begin 0\n"
+              "writeAt 0\n"
+              "writeAt 0\n"
+              "writeAt 0\n"
+              "lib/storage/storage_target:N TODO: Sanity-check the file\n"
+              "\"/media/boot/BOOT.BIN\" update with 30 bytes written\n"
+              "\"/media/boot/BOOT.BIN\" needs updating\n"
+              "Remounting \"/media/boot\" as rw\n"
+              "lib/storage/storage_target:N Failed to execute mount\n"
+              "Closing #1\n"
+              "finalise 52 valid 0\n");
+    EXPECT_EQ(fake.calls(), "mount [-o] [remount,rw] [/media/boot]\n");
+}
+
+// Destroying a slot in the middle of an update closes its temporary file.
+TEST(FirmwareUpdateBoot, DestructionClosesTheTemporaryFile) {
+    const auto result = runInChild([] {
+        setLogOutput(LOG_OUTPUT_STDOUT);
+        setLogLevel(LOG_PRIORITY_ERROR);
+        {
+            FirmwareUpdateBootTarget target;
+            std::printf("begin %u\n", target.getSlot(0)->beginWrite());
+            std::printf("begin %u\n", target.getSlot(1)->beginWrite());
+            printTemporaryDescriptors();
+        }
+        std::printf("after\n");
+        printTemporaryDescriptors();
+        return 0;
+    });
+    EXPECT_EQ(normalised(result.out),
+              "begin 0\n"
+              "begin 0\n"
+              "fd #1 (deleted) cloexec 1\n"
+              "fd #2 (deleted) cloexec 1\n"
+              "after\n");
+}
+
+// ---- the partition target ----
+
+TEST(FirmwareUpdatePartition, OneSlot) {
+    FirmwareUpdatePartitionTarget target;
+    EXPECT_EQ(target.getSlotCount(), 1u);
+    EXPECT_EQ(target.getDescription(), "FirmwareUpdatePartitionTarget");
+    ASSERT_TRUE(target.getSlot(0));
+    EXPECT_FALSE(target.getSlot(0).ownsSlot());
+    EXPECT_EQ(target.getSlot(0).get(), target.getSlot(0).get());
+    EXPECT_FALSE(target.getSlot(1));
+    EXPECT_FALSE(target.getSlot(size_t{1} << 32));
+    size_t index = 0;
+    size_t size = 0;
+    EXPECT_EQ(target.addSlot("x", index, size), STATUS_NOT_IMPLEMENTED);
+    EXPECT_EQ(target.removeSlot(0), STATUS_NOT_IMPLEMENTED);
+    EXPECT_EQ(target.removeAllSlots(), STATUS_NOTHING_TO_DO);
+}
+
+// Without an update: nothing is written, nothing mounted, nothing said.
+TEST(FirmwareUpdatePartition, IdleSlot) {
+    FakeMountCommands fake;
+    const auto result = fake.run(LOG_PRIORITY_DEBUG, [] {
+        FirmwareUpdatePartitionTarget target;
+        TargetSlot& slot = *target.getSlot(0).get();
+        const Bytes data = pattern(4096, 1);
+        uint8_t buffer[10] = {};
+        size_t got = 5;
+        std::printf("exists %d valid %d\n", slot.exists() ? 1 : 0, slot.isValid() ? 1 : 0);
+        std::printf("finalise %u\n", slot.finalise());
+        std::printf("writeAt %u\n", writeAt(slot, 0, data));
+        std::printf("write %u\n", slot.write(data.data(), data.size()));
+        std::printf("read %u\n", slot.read(buffer, sizeof buffer, 0));
+        std::printf("readSome %u\n", slot.readSome(buffer, sizeof buffer, 0, got));
+        std::printf("got %zu\n", got);
+        std::printf("erase %u\n", slot.erase());
+        std::printf("finalise %u\n", slot.finalise());
+        return 0;
+    });
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(result.out,
+              "exists 1 valid 0\n"
+              "finalise 2\n"
+              "writeAt 95\n"
+              "write 38\n"
+              "read 38\n"
+              "readSome 38\n"
+              "got 5\n"
+              "erase 38\n"
+              "finalise 2\n");
+    EXPECT_EQ(fake.calls(), "");
+}
+
+TEST(FirmwareUpdatePartition, BeginWithoutTheBlockDevice) {
+    if (fs::exists("/dev/mmcblk0p2")) GTEST_SKIP() << "this host has a /dev/mmcblk0p2";
+    FakeMountCommands fake;
+    const auto result = fake.run(LOG_PRIORITY_DEBUG, [] {
+        FirmwareUpdatePartitionTarget target;
+        TargetSlot& slot = *target.getSlot(0).get();
+        {
+            const Status status = slot.beginWrite();
+            std::printf("begin %u valid %d\n", status, slot.isValid() ? 1 : 0);
+        }
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
+        std::printf("finalise %u\n", slot.finalise());
+        return 0;
+    });
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(normalised(result.out),
+              "lib/storage/storage_target:N Unable to locate block device \"/dev/mmcblk0p2\"\n"
+              "begin 2 valid 0\n"
+              "writeAt 95\n"
+              "finalise 2\n");
+    // Nothing was unmounted.
+    EXPECT_EQ(fake.calls(), "");
+}
+
+}  // namespace

@@ -33,14 +33,13 @@ using simulated_device::Bytes;
 using simulated_device::MountState;
 using testing_support::ProcessResult;
 using testing_support::runProgram;
+using testing_support::runShell;
 
 constexpr uint64_t kSector = 512;
 constexpr uint64_t kDeviceSectors = 33554432;  // 16 GiB
 constexpr uint64_t kLowestBootVectorSector = 6291456;
 // Inside the third partition in every variant and used by nothing.
 constexpr uint64_t kUnusedOffset = 300ull * 1024 * 1024;
-
-ProcessResult shell(const std::string& command) { return runProgram({"/bin/sh", "-c", command}); }
 
 uint64_t firstNumber(const std::string& text) {
     return std::strtoull(text.c_str(), nullptr, 10);
@@ -82,7 +81,7 @@ protected:
 };
 
 TEST_F(SimulatedDevice, LastFreeAreaIsWhereTheRunnerPutIt) {
-    const ProcessResult result = shell("/usr/sbin/sfdisk -q -n -F /dev/mmcblk0 | tail -1");
+    const ProcessResult result = runShell("/usr/sbin/sfdisk -q -n -F /dev/mmcblk0 | tail -1");
     ASSERT_EQ(result.exitStatus, 0) << result.err;
     if (variantIs({"nofree"})) {
         EXPECT_EQ(result.out, "");
@@ -184,14 +183,14 @@ TEST_F(SimulatedDevice, BootPartitionIsMountedReadOnlyWithTheBootFiles) {
 
 TEST_F(SimulatedDevice, BootPartitionRemountsReadWriteAndBack) {
     ASSERT_EQ(simulated_device::mountState(simulated_device::kBootMount), MountState::kReadOnly);
-    const ProcessResult rw = shell("mount -o remount,rw /media/boot");
+    const ProcessResult rw = runShell("mount -o remount,rw /media/boot");
     ASSERT_EQ(rw.exitStatus, 0) << rw.err;
     EXPECT_EQ(simulated_device::mountState(simulated_device::kBootMount), MountState::kReadWrite);
     testing_support::writeText("/media/boot/probe", "written while read-write\n");
     EXPECT_EQ(testing_support::readText("/media/boot/probe"), "written while read-write\n");
     ASSERT_TRUE(fs::remove("/media/boot/probe"));
 
-    const ProcessResult ro = shell("mount -o remount,ro /media/boot");
+    const ProcessResult ro = runShell("mount -o remount,ro /media/boot");
     ASSERT_EQ(ro.exitStatus, 0) << ro.err;
     EXPECT_EQ(simulated_device::mountState(simulated_device::kBootMount), MountState::kReadOnly);
     EXPECT_EQ(simulated_device::findMount(simulated_device::kBootMount)->source, simulated_device::kBootPartition);
@@ -201,13 +200,13 @@ TEST_F(SimulatedDevice, ResourcePartitionUnmountsAndMountsThroughFstab) {
     ASSERT_EQ(simulated_device::mountState(simulated_device::kResourcesMount), MountState::kReadWrite);
     EXPECT_EQ(testing_support::readText(simulated_device::kResourcesMarker), simulated_device::kResourcesMarkerText);
 
-    const ProcessResult down = shell("umount /media/resources");
+    const ProcessResult down = runShell("umount /media/resources");
     ASSERT_EQ(down.exitStatus, 0) << down.err;
     EXPECT_EQ(simulated_device::mountState(simulated_device::kResourcesMount), MountState::kNotMounted);
     EXPECT_FALSE(fs::exists(simulated_device::kResourcesMarker));
-    EXPECT_NE(shell("umount /media/resources").exitStatus, 0);
+    EXPECT_NE(runShell("umount /media/resources").exitStatus, 0);
 
-    const ProcessResult up = shell("mount /media/resources");
+    const ProcessResult up = runShell("mount /media/resources");
     ASSERT_EQ(up.exitStatus, 0) << up.err;
     const std::optional<simulated_device::MountEntry> resources = simulated_device::findMount(simulated_device::kResourcesMount);
     ASSERT_TRUE(resources.has_value());
@@ -237,7 +236,7 @@ TEST_F(SimulatedDevice, EverydayDeviceNodesWork) {
     char byte = 0;
     EXPECT_TRUE(random.get(byte));
     EXPECT_EQ(fs::read_symlink("/dev/fd"), "/proc/self/fd");
-    const ProcessResult echo = shell("echo through-stdout > /dev/stdout");
+    const ProcessResult echo = runShell("echo through-stdout > /dev/stdout");
     EXPECT_EQ(echo.out, "through-stdout\n");
 }
 

@@ -62,4 +62,6 @@ ProcessResult runProgram(const std::vector<std::string>& argv, const std::map<st
     });
 }
 
+ProcessResult runShell(const std::string& command) { return runProgram({"/bin/sh", "-c", command}); }
+
 }  // namespace testing_support

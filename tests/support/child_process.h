@@ -24,4 +24,7 @@ ProcessResult runInChild(const std::function<int()>& body);
 ProcessResult runProgram(const std::vector<std::string>& argv,
                          const std::map<std::string, std::string>& extraEnv = {});
 
+// Runs `command` with /bin/sh -c; the result as it came.
+ProcessResult runShell(const std::string& command);
+
 }  // namespace testing_support

@@ -24,10 +24,9 @@ using Storage::PartitionWriteAdaptor;
 using Storage::SlotHandle;
 using store_test::Bytes;
 using testing_support::ProcessResult;
+using testing_support::runShell;
 
 const fs::path kStore = "/media/boot/store";
-
-ProcessResult shell(const std::string& command) { return testing_support::runProgram({"/bin/sh", "-c", command}); }
 
 std::string bootState() { return simulated_device::toString(simulated_device::mountState(kBootMount)); }
 
@@ -50,8 +49,8 @@ protected:
     void SetUp() override {
         SKIP_UNLESS_ON_SIMULATED_DEVICE();
         ASSERT_EQ(bootState(), "read-only");
-        const ProcessResult made = shell("mount -o remount,rw /media/boot && rm -rf /media/boot/store && "
-                                         "mkdir /media/boot/store && mount -o remount,ro /media/boot");
+        const ProcessResult made = runShell("mount -o remount,rw /media/boot && rm -rf /media/boot/store && "
+                                            "mkdir /media/boot/store && mount -o remount,ro /media/boot");
         ASSERT_EQ(made.exitStatus, 0) << made.err;
         ASSERT_EQ(bootState(), "read-only");
     }

@@ -19,6 +19,7 @@
 #include "lib/storage/boot_vector_target.h"
 #include "lib/util/log.h"
 #include "simulated_device.h"
+#include "storage_log.h"
 
 namespace {
 
@@ -26,9 +27,9 @@ namespace fs = std::filesystem;
 namespace sd = simulated_device;
 using device_test::Bytes;
 using device_test::hex;
-using device_test::normalised;
 using Storage::BootVectorTarget;
 using Storage::TargetSlot;
+using testing_support::normalisedStorageLog;
 using testing_support::ProcessResult;
 using testing_support::runInChild;
 
@@ -216,7 +217,7 @@ TEST_F(BootVectorOnDevice, InvalidRecordsAreRefused) {
         printRead(slot);
         return 0;
     });
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "built\n"
               "lib/storage/storage_target:N Failed validation of boot vectors\nwrite 52\n"
               "lib/storage/storage_target:N Failed validation of boot vectors\nwrite 52\n"
@@ -247,7 +248,7 @@ TEST_F(BootVectorOnDevice, WrongLengthOrOffset) {
         printRead(slot);
         return 0;
     });
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "built\n"
               "lib/storage/storage_target:N Unexpected length 19\nwrite 22\n"
               "lib/storage/storage_target:N Unexpected length 21\nwrite 22\n"
@@ -288,7 +289,7 @@ TEST_F(BootVectorOnDevice, EveryOtherLengthIsRefused) {
                     "lib/storage/storage_target:N Unexpected length " + n + " or offset 0\n" + n + " read 22\n";
     }
     expected += "untouched 1\nread 0 20 " + hex(original) + "\n";
-    EXPECT_EQ(normalised(result.out), expected);
+    EXPECT_EQ(normalisedStorageLog(result.out), expected);
     EXPECT_EQ(imageAroundRecord() == before, true);
 }
 
@@ -303,7 +304,7 @@ TEST_F(BootVectorOnDevice, WriteWhenTheDeviceCannotBeOpened) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "built\n"
               "libcommon/lib/util/fd:14 Failed to open /dev/mmcblk0: No such file or directory\n"
               "lib/storage/storage_target:N Failed to write to flash: valid=0 written=0\n"
@@ -327,7 +328,7 @@ TEST_F(BootVectorWriteFaults, FailedWrite) {
     const ProcessResult result =
         runDriver(testing_support::faultEnv("write", 1, "errno:EIO", "mmcblk0"), record);
     EXPECT_EQ(result.exitStatus, 0) << result.err;
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "lib/storage/storage_target:N BootVector write failed: 5: Input/output error\n"
               "lib/storage/storage_target:N Failed to write to flash: valid=1 written=-1\n"
               "write 52\n"
@@ -341,7 +342,7 @@ TEST_F(BootVectorWriteFaults, ShortWrite) {
     const Bytes record = sd::makeBootVectorRecord(0x11223344u, 8);
     const ProcessResult result = runDriver(testing_support::faultEnv("write", 1, "short:7", "mmcblk0"), record);
     EXPECT_EQ(result.exitStatus, 0) << result.err;
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "lib/storage/storage_target:N Failed to write to flash: valid=1 written=7\n"
               "write 52\n"
               "read 0 20 " +
@@ -391,7 +392,7 @@ TEST_F(BootVectorLowImage, FreeAreaBelowTheRangeIsRefused) {
     const Bytes before = sd::readImageBytes(sd::bootVectorOffset(), 512);
     const ProcessResult result = withTarget(LOG_PRIORITY_DEBUG, probeUnusable);
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "lib/storage/storage_target:N Boot vector 2048000 not in range 6291456 to 33554432\n" + kUnusableProbe);
     EXPECT_EQ(sd::readImageBytes(sd::bootVectorOffset(), 512), before);
 }
@@ -406,7 +407,8 @@ TEST_F(BootVectorBadRecord, InvalidRecordMakesTheSlotUnusable) {
     ASSERT_FALSE(sd::isValidBootVectorRecord(sd::writtenBootVectorRecord()));
     const ProcessResult result = withTarget(LOG_PRIORITY_DEBUG, probeUnusable);
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out), "lib/storage/storage_target:N Boot vector query failed!\n" + kUnusableProbe);
+    EXPECT_EQ(normalisedStorageLog(result.out),
+              "lib/storage/storage_target:N Boot vector query failed!\n" + kUnusableProbe);
     EXPECT_EQ(sd::readImageBytes(sd::bootVectorOffset(), 512), before);
 }
 
@@ -435,7 +437,8 @@ protected:
 TEST_F(BootVectorNoFreeArea, NothingToParse) {
     const ProcessResult result = withTarget(LOG_PRIORITY_DEBUG, probeUnusable);
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out), "lib/storage/storage_target:N Failed to parse flash size ''\n" + kUnusableProbe);
+    EXPECT_EQ(normalisedStorageLog(result.out),
+              "lib/storage/storage_target:N Failed to parse flash size ''\n" + kUnusableProbe);
 }
 
 }  // namespace

@@ -3,99 +3,27 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
-#include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
 #include <linux/fs.h>
-#include <regex>
 #include <stdexcept>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include "files.h"
-#include "lib/util/log.h"
 #include "simulated_device.h"
 
 namespace device_test {
 
 namespace fs = std::filesystem;
 
-std::string normalised(const std::string& text) {
-    static const std::regex prefix(R"(lib/storage/storage_target:[0-9]+ )");
-    static const std::regex report(R"(\[lib/storage/storage_target:[0-9]+\] )");
-    static const std::regex temporary(R"(/tmp/firmware[A-Za-z0-9]{6})");
-    std::string out = std::regex_replace(text, prefix, "lib/storage/storage_target:N ");
-    out = std::regex_replace(out, report, "[lib/storage/storage_target:N] ");
-    std::vector<std::string> names;
-    std::string result;
-    auto last = out.cbegin();
-    for (std::sregex_iterator it(out.begin(), out.end(), temporary), end; it != end; ++it) {
-        const std::string name = it->str();
-        size_t number = 0;
-        while (number < names.size() && names[number] != name) ++number;
-        if (number == names.size()) names.push_back(name);
-        result.append(last, out.cbegin() + it->position());
-        result += "#" + std::to_string(number + 1);
-        last = out.cbegin() + it->position() + it->length();
-    }
-    result.append(last, out.cend());
-    return result;
-}
-
-ProcessResult shell(const std::string& command) { return testing_support::runProgram({"/bin/sh", "-c", command}); }
-
 void mustRun(const std::string& command) {
-    const ProcessResult result = shell(command);
+    const ProcessResult result = testing_support::runShell(command);
     if (result.exitStatus != 0) {
         throw std::runtime_error("'" + command + "' failed (" + std::to_string(result.exitStatus) +
                                  "): " + result.out + result.err);
     }
-}
-
-MountRecorder::MountRecorder() {
-    for (const char* name : {"mount", "umount"}) {
-        std::string real;
-        for (const char* dir : {"/usr/bin/", "/bin/", "/usr/sbin/", "/sbin/"}) {
-            if (::access((std::string(dir) + name).c_str(), X_OK) == 0) {
-                real = std::string(dir) + name;
-                break;
-            }
-        }
-        if (real.empty()) throw std::runtime_error(std::string("no ") + name + " command");
-        const fs::path script = dir_ / name;
-        testing_support::writeText(
-            script, "#!/bin/sh\n"
-                    "{ printf '%s' \"${0##*/}\"; for a in \"$@\"; do printf ' [%s]' \"$a\"; done; echo; } >>'" +
-                        (dir_ / "record").string() +
-                        "'\n"
-                        "[ -z \"$FAKE_MOUNT_EXIT\" ] || exit \"$FAKE_MOUNT_EXIT\"\n"
-                        "exec " +
-                        real + " \"$@\"\n");
-        fs::permissions(script, fs::perms::owner_all);
-    }
-    clear();
-}
-
-std::string MountRecorder::calls() const { return testing_support::readText(dir_ / "record"); }
-
-void MountRecorder::clear() const { testing_support::writeText(dir_ / "record", ""); }
-
-std::string MountRecorder::path() const {
-    const char* path = std::getenv("PATH");
-    return dir_.path().string() + ":" + (path != nullptr ? path : "/usr/sbin:/usr/bin:/sbin:/bin");
-}
-
-ProcessResult runLogged(const MountRecorder& recorder, int threshold, const std::function<int()>& body,
-                        const std::map<std::string, std::string>& env) {
-    const std::string path = recorder.path();
-    return testing_support::runInChild([&] {
-        setenv("PATH", path.c_str(), 1);
-        for (const auto& [name, value] : env) setenv(name.c_str(), value.c_str(), 1);
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(threshold);
-        return body();
-    });
 }
 
 std::vector<std::string> temporaryFirmwareFiles() {
@@ -145,7 +73,7 @@ void changeBootPartition(const std::function<void()>& change) {
     try {
         change();
     } catch (...) {
-        (void)shell("mount -o remount,ro /media/boot");
+        (void)testing_support::runShell("mount -o remount,ro /media/boot");
         throw;
     }
     mustRun("mount -o remount,ro /media/boot");

@@ -24,6 +24,7 @@
 #include "lib/util/log.h"
 #include "scratch_dir.h"
 #include "simulated_device.h"
+#include "storage_log.h"
 
 namespace {
 
@@ -32,11 +33,10 @@ namespace sd = simulated_device;
 using device_test::Bytes;
 using device_test::fileBytes;
 using device_test::MountRecorder;
-using device_test::normalised;
 using device_test::pattern;
-using device_test::runLogged;
 using Storage::FirmwareUpdateBootTarget;
 using Storage::TargetSlot;
+using testing_support::normalisedStorageLog;
 using testing_support::ProcessResult;
 
 constexpr const char* kRemountRw = "mount [-o] [remount,rw] [/media/boot]\n";
@@ -121,8 +121,8 @@ protected:
     // threshold, with the recorder in front of mount.
     ProcessResult update(size_t slotIndex, const Bytes& data, size_t block = 4096,
                          const std::map<std::string, std::string>& env = {}) {
-        return runLogged(
-            recorder, LOG_PRIORITY_INFO,
+        return recorder.run(
+            LOG_PRIORITY_INFO,
             [&] {
                 FirmwareUpdateBootTarget target;
                 return transfer(*target.getSlot(slotIndex).get(), data, block);
@@ -145,9 +145,9 @@ TEST_F(FirmwareUpdateBootOnDevice, IdenticalDataLeavesTheFileSystemUntouched) {
 
     const ProcessResult first = update(0, boot, 1000);
     EXPECT_EQ(first.exitStatus, 0);
-    EXPECT_EQ(normalised(first.out), receivedLines("BOOT.BIN", 10000) + kUpToDateLines);
+    EXPECT_EQ(normalisedStorageLog(first.out), receivedLines("BOOT.BIN", 10000) + kUpToDateLines);
     const ProcessResult second = update(1, boot0010, 4096);
-    EXPECT_EQ(normalised(second.out), receivedLines("BOOT0010.BIN", 12000) + kUpToDateLines);
+    EXPECT_EQ(normalisedStorageLog(second.out), receivedLines("BOOT0010.BIN", 12000) + kUpToDateLines);
 
     EXPECT_EQ(recorder.calls(), "");
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
@@ -172,7 +172,7 @@ TEST_F(FirmwareUpdateBootOnDevice, SizeIsTakenModulo2To32) {
     const Bytes imageBefore = bootPartitionImage();
     recorder.clear();
 
-    const ProcessResult result = runLogged(recorder, LOG_PRIORITY_INFO, [&] {
+    const ProcessResult result = recorder.run(LOG_PRIORITY_INFO, [&] {
         FirmwareUpdateBootTarget target;
         TargetSlot& slot = *target.getSlot(0).get();
         std::printf("begin %u\n", slot.beginWrite());
@@ -185,7 +185,7 @@ TEST_F(FirmwareUpdateBootOnDevice, SizeIsTakenModulo2To32) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out), receivedLines("BOOT.BIN", 20) + kUpToDateLines);
+    EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 20) + kUpToDateLines);
     EXPECT_EQ(recorder.calls(), "");
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")), ten);
     EXPECT_EQ(bootPartitionImage() == imageBefore, true) << "the boot partition changed";
@@ -197,7 +197,7 @@ TEST_F(FirmwareUpdateBootOnDevice, DifferentDataIsWrittenAndReadBack) {
     const Bytes data = pattern(300001, 3);
     const ProcessResult result = update(0, data, 65536);
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out), receivedLines("BOOT.BIN", 300001) + rewrittenLines("BOOT.BIN", 300001));
+    EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 300001) + rewrittenLines("BOOT.BIN", 300001));
     EXPECT_EQ(recorder.calls(), std::string(kRemountRw) + kRemountRo);
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")) == data, true);
@@ -212,7 +212,7 @@ TEST_F(FirmwareUpdateBootOnDevice, DifferentDataIsWrittenAndReadBack) {
 TEST_F(FirmwareUpdateBootOnDevice, ShorterDataReplacesTheWholeFile) {
     const Bytes data = pattern(3, 8);
     const ProcessResult result = update(1, data);
-    EXPECT_EQ(normalised(result.out), receivedLines("BOOT0010.BIN", 3) + rewrittenLines("BOOT0010.BIN", 3));
+    EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT0010.BIN", 3) + rewrittenLines("BOOT0010.BIN", 3));
     EXPECT_EQ(fileBytes(bootFile("BOOT0010.BIN")), data);
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")), fileBytes(sd::originalBootFile("BOOT.BIN")));
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
@@ -223,7 +223,7 @@ TEST_F(FirmwareUpdateBootOnDevice, ShorterDataReplacesTheWholeFile) {
 TEST_F(FirmwareUpdateBootOnDevice, TemporaryFileIsNeverLeftInTmp) {
     const std::vector<std::string> before = device_test::temporaryFirmwareFiles();
     const Bytes data = pattern(5000, 6);
-    const ProcessResult result = runLogged(recorder, LOG_PRIORITY_INFO, [&] {
+    const ProcessResult result = recorder.run(LOG_PRIORITY_INFO, [&] {
         auto show = [&](const char* when) {
             const bool same = device_test::temporaryFirmwareFiles() == before;
             std::printf("%s: tmp %s\n%s", when, same ? "unchanged" : "CHANGED",
@@ -242,7 +242,7 @@ TEST_F(FirmwareUpdateBootOnDevice, TemporaryFileIsNeverLeftInTmp) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
               "Opened #1 for receiving firmware\n"
               "begin 0\n"
@@ -271,13 +271,14 @@ TEST_F(FirmwareUpdateBootOnDevice, MissingDestinationIsCreatedUnderTheUmask) {
         device_test::changeBootPartition([] { fs::remove(bootFile("BOOT0010.BIN")); });
         recorder.clear();
         const Bytes data = pattern(777, static_cast<uint8_t>(mask));
-        const ProcessResult result = runLogged(recorder, LOG_PRIORITY_INFO, [&] {
+        const ProcessResult result = recorder.run(LOG_PRIORITY_INFO, [&] {
             ::umask(mask);
             FirmwareUpdateBootTarget target;
             return transfer(*target.getSlot(1).get(), data, 4096);
         });
         EXPECT_EQ(result.exitStatus, 0);
-        EXPECT_EQ(normalised(result.out), receivedLines("BOOT0010.BIN", 777) + rewrittenLines("BOOT0010.BIN", 777));
+        EXPECT_EQ(normalisedStorageLog(result.out),
+                  receivedLines("BOOT0010.BIN", 777) + rewrittenLines("BOOT0010.BIN", 777));
         EXPECT_EQ(recorder.calls(), std::string(kRemountRw) + kRemountRo);
         ASSERT_TRUE(fs::is_regular_file(bootFile("BOOT0010.BIN")));
         struct stat st {};
@@ -291,7 +292,7 @@ TEST_F(FirmwareUpdateBootOnDevice, MissingDestinationIsCreatedUnderTheUmask) {
 // ---- updates that do not complete ----
 
 TEST_F(FirmwareUpdateBootOnDevice, FinaliseWithoutBegin) {
-    const ProcessResult result = runLogged(recorder, LOG_PRIORITY_DEBUG, [] {
+    const ProcessResult result = recorder.run(LOG_PRIORITY_DEBUG, [] {
         FirmwareUpdateBootTarget target;
         std::printf("finalise %u\n", target.getSlot(0)->finalise());
         std::printf("finalise %u\n", target.getSlot(1)->finalise());
@@ -304,7 +305,7 @@ TEST_F(FirmwareUpdateBootOnDevice, FinaliseWithoutBegin) {
 
 TEST_F(FirmwareUpdateBootOnDevice, NothingReceivedFailsAndCloses) {
     const ProcessResult result = update(0, Bytes{});
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
               "Opened #1 for receiving firmware\n"
               "begin 0\n"
@@ -321,7 +322,7 @@ TEST_F(FirmwareUpdateBootOnDevice, NothingReceivedFailsAndCloses) {
 // bytes count and are compared.
 TEST_F(FirmwareUpdateBootOnDevice, BeginTwiceRestarts) {
     const Bytes boot = fileBytes(sd::originalBootFile("BOOT.BIN"));
-    const ProcessResult result = runLogged(recorder, LOG_PRIORITY_INFO, [&] {
+    const ProcessResult result = recorder.run(LOG_PRIORITY_INFO, [&] {
         FirmwareUpdateBootTarget target;
         TargetSlot& slot = *target.getSlot(0).get();
         const Bytes junk = pattern(500, 1);
@@ -329,7 +330,7 @@ TEST_F(FirmwareUpdateBootOnDevice, BeginTwiceRestarts) {
         std::printf("writeAt %u\n", slot.writeAt(0, junk.data(), junk.size()));
         return transfer(slot, boot, 4096);
     });
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
               "Opened #1 for receiving firmware\n"
               "begin 0\n"
@@ -352,7 +353,7 @@ TEST_F(FirmwareUpdateBootOnDevice, BeginTwiceRestarts) {
 // and no read-only remount follows.
 TEST_F(FirmwareUpdateBootOnDevice, FailedRemountEndsTheUpdate) {
     const ProcessResult result = update(0, pattern(100, 2), 4096, {{"FAKE_MOUNT_EXIT", "32"}});
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               receivedLines("BOOT.BIN", 100) +
                   "\"/media/boot/BOOT.BIN\" needs updating\n"
                   "Remounting \"/media/boot\" as rw\n"
@@ -370,7 +371,7 @@ TEST_F(FirmwareUpdateBootOnDevice, FailedRemountEndsTheUpdate) {
 TEST_F(FirmwareUpdateBootOnDevice, FiveFailedReadBacks) {
     device_test::changeBootPartition([] { device_test::setImmutable(bootFile("BOOT0010.BIN"), true); });
     recorder.clear();
-    const ProcessResult result = runLogged(recorder, LOG_PRIORITY_INFO, [] {
+    const ProcessResult result = recorder.run(LOG_PRIORITY_INFO, [] {
         FirmwareUpdateBootTarget target;
         TargetSlot& slot = *target.getSlot(1).get();
         transfer(slot, pattern(1000, 5), 4096);
@@ -384,7 +385,7 @@ TEST_F(FirmwareUpdateBootOnDevice, FiveFailedReadBacks) {
             "libcommon/lib/util/fd:14 Failed to open /media/boot/BOOT0010.BIN: Operation not permitted\n"
             "lib/storage/storage_target:N Failed to open BOOT.BIN for writing\n";
     }
-    EXPECT_EQ(normalised(result.out), receivedLines("BOOT0010.BIN", 1000) +
+    EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT0010.BIN", 1000) +
                                           "\"/media/boot/BOOT0010.BIN\" needs updating\n"
                                           "Remounting \"/media/boot\" as rw\n" +
                                           attempts +
@@ -403,7 +404,7 @@ class FirmwareUpdateBootFaults : public FirmwareUpdateBootOnDevice {
 protected:
     ProcessResult runDriver(testing_support::Environment env, const Bytes& data) {
         testing_support::writeBytes(dir / "data", data);
-        env["PATH"] = recorder.path();
+        env["PATH"] = recorder.searchPath();
         return testing_support::runProgram({DEVICE_TARGET_DRIVER, "boot-update", "0", (dir / "data").string()}, env);
     }
 
@@ -416,7 +417,7 @@ TEST_F(FirmwareUpdateBootFaults, ShortCopyIsRetried) {
     const Bytes data = pattern(9000, 7);
     const ProcessResult result = runDriver(testing_support::faultEnv("write", 1, "short:100", "BOOT.BIN"), data);
     EXPECT_EQ(result.exitStatus, 0) << result.err;
-    EXPECT_EQ(normalised(result.out), receivedLines("BOOT.BIN", 9000) +
+    EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 9000) +
                                           "\"/media/boot/BOOT.BIN\" needs updating\n"
                                           "Remounting \"/media/boot\" as rw\n"
                                           "Opening \"/media/boot/BOOT.BIN\" for write\n"
@@ -438,7 +439,7 @@ TEST_F(FirmwareUpdateBootFaults, FailedCopyIsReportedAndRetried) {
     const Bytes data = pattern(9000, 9);
     const ProcessResult result = runDriver(testing_support::faultEnv("write", 2, "errno:EIO", "BOOT.BIN"), data);
     EXPECT_EQ(result.exitStatus, 0) << result.err;
-    EXPECT_EQ(normalised(result.out), receivedLines("BOOT.BIN", 9000) +
+    EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 9000) +
                                           "\"/media/boot/BOOT.BIN\" needs updating\n"
                                           "Remounting \"/media/boot\" as rw\n"
                                           "Opening \"/media/boot/BOOT.BIN\" for write\n"
@@ -459,7 +460,7 @@ TEST_F(FirmwareUpdateBootFaults, DriverWithoutFaults) {
     const Bytes data = pattern(4097, 10);
     const ProcessResult result = runDriver(testing_support::preloadEnv(), data);
     EXPECT_EQ(result.exitStatus, 0) << result.err;
-    EXPECT_EQ(normalised(result.out), receivedLines("BOOT.BIN", 4097) + rewrittenLines("BOOT.BIN", 4097));
+    EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 4097) + rewrittenLines("BOOT.BIN", 4097));
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")), data);
 }
 

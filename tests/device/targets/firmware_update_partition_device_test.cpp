@@ -22,6 +22,7 @@
 #include "lib/util/log.h"
 #include "scratch_dir.h"
 #include "simulated_device.h"
+#include "storage_log.h"
 
 namespace {
 
@@ -29,11 +30,10 @@ namespace fs = std::filesystem;
 namespace sd = simulated_device;
 using device_test::Bytes;
 using device_test::MountRecorder;
-using device_test::normalised;
 using device_test::pattern;
-using device_test::runLogged;
 using Storage::FirmwareUpdatePartitionTarget;
 using Storage::TargetSlot;
+using testing_support::normalisedStorageLog;
 using testing_support::ProcessResult;
 
 constexpr const char* kUnmount = "umount [/media/resources]\n";
@@ -82,7 +82,7 @@ protected:
     }
 
     ProcessResult run(int threshold, const std::function<int(TargetSlot&)>& body) {
-        return runLogged(recorder, threshold, [&] {
+        return recorder.run(threshold, [&] {
             FirmwareUpdatePartitionTarget target;
             return body(*target.getSlot(0).get());
         });
@@ -148,7 +148,7 @@ TEST_F(FirmwareUpdatePartitionOnDevice, TwoBlocksThenTheMountResult) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out), kBegun +
+    EXPECT_EQ(normalisedStorageLog(result.out), kBegun +
                                           "begin 0\n"
                                           "writeAt 0\n"
                                           "writeAt 0\n"
@@ -179,7 +179,7 @@ TEST_F(FirmwareUpdatePartitionOnDevice, BeginTwiceRestarts) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out), kBegun +
+    EXPECT_EQ(normalisedStorageLog(result.out), kBegun +
                                           "begin 0\n"
                                           "writeAt 0\n"
                                           "writeAt 0\n"
@@ -223,7 +223,7 @@ TEST_F(FirmwareUpdatePartitionOnDevice, DevicePathThatIsNoBlockDevice) {
             std::printf("begin %u valid %d\n", begun, slot.isValid() ? 1 : 0);
             return 0;
         });
-        EXPECT_EQ(normalised(result.out),
+        EXPECT_EQ(normalisedStorageLog(result.out),
                   "lib/storage/storage_target:N Unable to locate block device \"/dev/mmcblk0p2\"\n"
                   "begin 2 valid 0\n");
         EXPECT_EQ(recorder.calls(), "");
@@ -241,7 +241,7 @@ TEST_F(FirmwareUpdatePartitionOnDevice, FirstBeginStopsWhenTheUnmountFails) {
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
         return 0;
     });
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Unmounting \"/media/resources\"\n"
               "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\n"
               "lib/storage/storage_target:N Failed to unmount \"/media/resources\"\n"
@@ -260,7 +260,7 @@ TEST_F(FirmwareUpdatePartitionOnDevice, DeviceThatCannotBeOpened) {
         std::printf("begin %u valid %d\n", begun, slot.isValid() ? 1 : 0);
         return 0;
     });
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Unmounting \"/media/resources\"\n"
               "libcommon/lib/util/fd:14 Failed to open /dev/mmcblk0p2: No such device or address\n"
               "lib/storage/storage_target:N Failed to open \"/dev/mmcblk0p2\" for writing\n"
@@ -283,7 +283,7 @@ TEST_F(FirmwareUpdatePartitionOnDevice, FailedBlockWritesKeepTheUpdate) {
         std::printf("finalise %u\n", slot.finalise());
         return 0;
     });
-    EXPECT_EQ(normalised(result.out), kBegun +
+    EXPECT_EQ(normalisedStorageLog(result.out), kBegun +
                                           "begin 0\n"
                                           "writeAt 52\n"
                                           "valid 1\n"
@@ -299,11 +299,11 @@ TEST_F(FirmwareUpdatePartitionOnDevice, FailedBlockWritesKeepTheUpdate) {
 
 // The real mount with a mount point that the device's fstab does not know.
 TEST_F(FirmwareUpdatePartitionOnDevice, MountOfAMountPointUnknownToTheMountTable) {
-    const ProcessResult result = runLogged(recorder, LOG_PRIORITY_WARNING, [] {
+    const ProcessResult result = recorder.run(LOG_PRIORITY_WARNING, [] {
         std::printf("status %u\n", Storage::mountPartition(sd::kStaticDir));
         return 0;
     });
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Mounting \"/media/static\"\n"
               "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\n"
               "status 52\n");

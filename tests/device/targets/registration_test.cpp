@@ -15,12 +15,13 @@
 #include "files.h"
 #include "scratch_dir.h"
 #include "simulated_device.h"
+#include "storage_log.h"
 
 namespace {
 
 namespace fs = std::filesystem;
 namespace sd = simulated_device;
-using device_test::normalised;
+using testing_support::normalisedStorageLog;
 using testing_support::ProcessResult;
 
 ProcessResult runTool(std::vector<std::string> args) {
@@ -106,7 +107,7 @@ TEST_F(RegistrationOnDevice, EveryRunReadsTheBootVector) {
         runTool({"--base", base().string(), "--target", "settings", "--query-present", "--verbose"});
     sd::writeImageBytes(sd::bootVectorOffset(), original);
     EXPECT_EQ(result.exitStatus, 10);
-    EXPECT_EQ(normalised(result.out), dualFileLines(base()) + kFileReadLines +
+    EXPECT_EQ(normalisedStorageLog(result.out), dualFileLines(base()) + kFileReadLines +
                                           "lib/storage/storage_target:N Boot vector query failed!\n" +
                                           kDeviceTargetLines);
 
@@ -140,7 +141,7 @@ protected:
 TEST_F(RegistrationWithoutDevice, BootVectorFailureIsLoggedOnce) {
     const ProcessResult result = runTool({"--base", base().string(), "--target", "settings", "--query-present"});
     EXPECT_EQ(result.exitStatus, 10);
-    EXPECT_EQ(normalised(result.out), kParseFailure);
+    EXPECT_EQ(normalisedStorageLog(result.out), kParseFailure);
     expectOneComplaint(result.err);
 }
 
@@ -148,7 +149,8 @@ TEST_F(RegistrationWithoutDevice, VerboseRegistrationIsComplete) {
     const ProcessResult result =
         runTool({"--base", base().string(), "--target", "settings", "--query-present", "--verbose"});
     EXPECT_EQ(result.exitStatus, 10);
-    EXPECT_EQ(normalised(result.out), dualFileLines(base()) + kFileReadLines + kParseFailure + kDeviceTargetLines);
+    EXPECT_EQ(normalisedStorageLog(result.out),
+              dualFileLines(base()) + kFileReadLines + kParseFailure + kDeviceTargetLines);
     expectOneComplaint(result.err);
 }
 
@@ -156,12 +158,12 @@ TEST_F(RegistrationWithoutDevice, DualFileStoresStillWork) {
     const ProcessResult migrated = runTool({"--base", base().string(), "--target", "settings", "--type", "simple",
                                             "--data", (dir / "data").string()});
     EXPECT_EQ(migrated.exitStatus, 0);
-    EXPECT_EQ(normalised(migrated.out), kParseFailure);
+    EXPECT_EQ(normalisedStorageLog(migrated.out), kParseFailure);
     expectOneComplaint(migrated.err);
 
     const ProcessResult present = runTool({"--base", base().string(), "--target", "settings", "--query-present"});
     EXPECT_EQ(present.exitStatus, 0);
-    EXPECT_EQ(normalised(present.out), kParseFailure);
+    EXPECT_EQ(normalisedStorageLog(present.out), kParseFailure);
 }
 
 // ---- anywhere ----

@@ -7,7 +7,6 @@
 #include <filesystem>
 #include <ostream>
 #include <random>
-#include <regex>
 #include <string>
 #include <vector>
 
@@ -18,13 +17,17 @@
 #include "scratch_dir.h"
 #include "lib/storage/boot_vector_target.h"
 #include "lib/util/log.h"
+#include "storage_log.h"
+#include "store_files.h"
 
 namespace {
 
 using Storage::BootVectorTarget;
 using Storage::SectorParse;
 using Record = std::vector<uint8_t>;
+using store_test::hex;
 using testing_support::runInChild;
+using testing_support::withoutStorageLineNumbers;
 
 // ---- the record format, computed here without the library ----
 
@@ -62,16 +65,6 @@ Record recordWithValue(uint32_t value, uint8_t seed) {
     record[3] = static_cast<uint8_t>(value);
     for (size_t i = 4; i < 18; ++i) record[i] = static_cast<uint8_t>(seed * 31 + i * 13);
     return sealed(record);
-}
-
-std::string hex(const Record& bytes) {
-    std::string text;
-    char digits[3];
-    for (const uint8_t byte : bytes) {
-        std::snprintf(digits, sizeof digits, "%02x", byte);
-        text += digits;
-    }
-    return text;
 }
 
 // ---- locating: the partitioning tool's last line ----
@@ -257,12 +250,6 @@ TEST(BootVectorRecord, AgreesWithTheReferenceOnRandomRecords) {
 
 // ---- the target on a host that has no "/dev/mmcblk0" ----
 
-// The construction failure, with the line number taken out.
-std::string withoutLineNumbers(const std::string& text) {
-    static const std::regex prefix(R"((lib/storage/storage_target):[0-9]+ )");
-    return std::regex_replace(text, prefix, "$1:N ");
-}
-
 class BootVectorWithoutDevice : public ::testing::Test {
 protected:
     void SetUp() override {
@@ -280,7 +267,8 @@ TEST_F(BootVectorWithoutDevice, ConstructionLogsOneParseFailure) {
     });
     EXPECT_EQ(result.exitStatus, 0);
     // Nothing on the partitioning tool's standard output.
-    EXPECT_EQ(withoutLineNumbers(result.out), "lib/storage/storage_target:N Failed to parse flash size ''\nbuilt\n")
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
+              "lib/storage/storage_target:N Failed to parse flash size ''\nbuilt\n")
         << result.out;
 }
 
@@ -316,7 +304,7 @@ TEST_F(BootVectorWithoutDevice, SlotIsUnusable) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    const std::string out = withoutLineNumbers(result.out);
+    const std::string out = withoutStorageLineNumbers(result.out);
     const size_t separator = out.find("---\n");
     ASSERT_NE(separator, std::string::npos) << out;
     EXPECT_EQ(out.substr(separator + 4),
@@ -386,7 +374,7 @@ TEST_P(BootVectorLocateWithoutDevice, Row) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(withoutLineNumbers(result.out), std::string(row.log) + "valid 0\n");
+    EXPECT_EQ(withoutStorageLineNumbers(result.out), std::string(row.log) + "valid 0\n");
 }
 
 INSTANTIATE_TEST_SUITE_P(

@@ -29,6 +29,8 @@ using store_test::describeTree;
 using store_test::expectedCheckFile;
 using store_test::hex;
 using store_test::holding;
+using store_test::kPast;
+using store_test::kSecond;
 using store_test::patternBytes;
 using store_test::SlotContent;
 using testing_support::Environment;
@@ -37,10 +39,6 @@ using testing_support::faultEnv;
 using testing_support::ProcessResult;
 using testing_support::readFaultCount;
 using testing_support::ScratchDir;
-
-constexpr int64_t kSecond = 1000000000;
-// 2020-01-01T00:00:00.5Z.
-constexpr int64_t kPast = 1577836800 * kSecond + kSecond / 2;
 
 std::string stateLine(const SlotContent& content) {
     return "state: exists=" + std::to_string(content.exists ? 1 : 0) + " valid=" + std::to_string(content.valid ? 1 : 0) +

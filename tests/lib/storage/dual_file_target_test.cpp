@@ -39,6 +39,8 @@ using store_test::describeTree;
 using store_test::expectedCheckFile;
 using store_test::hex;
 using store_test::holding;
+using store_test::kPast;
+using store_test::kSecond;
 using store_test::mtimeNs;
 using store_test::nothingStored;
 using store_test::patternBytes;
@@ -49,10 +51,7 @@ using testing_support::runInChild;
 using testing_support::ScratchDir;
 using testing_support::writeBytes;
 
-constexpr int64_t kSecond = 1000000000;
 constexpr int64_t kTwoSeconds = 2 * kSecond;
-// A fixed, clearly past instant: 2020-01-01T00:00:00.5Z.
-constexpr int64_t kPast = 1577836800 * kSecond + kSecond / 2;
 
 class DualFileStore : public ::testing::Test {
 protected:

@@ -5,10 +5,8 @@
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
+#include <fcntl.h>
 #include <filesystem>
-#include <functional>
-#include <map>
-#include <regex>
 #include <string>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -18,11 +16,11 @@
 #include <gtest/gtest.h>
 
 #include "child_process.h"
-#include "files.h"
+#include "fake_mount_commands.h"
 #include "lib/storage/firmware_update_boot_target.h"
 #include "lib/storage/firmware_update_partition_target.h"
 #include "lib/util/log.h"
-#include "scratch_dir.h"
+#include "storage_log.h"
 
 namespace {
 
@@ -30,73 +28,11 @@ namespace fs = std::filesystem;
 using Storage::FirmwareUpdateBootTarget;
 using Storage::FirmwareUpdatePartitionTarget;
 using Storage::TargetSlot;
-using testing_support::ProcessResult;
-using testing_support::readText;
+using testing_support::FakeMountCommands;
+using testing_support::normalisedStorageLog;
 using testing_support::runInChild;
-using testing_support::ScratchDir;
-using testing_support::writeText;
 
 using Bytes = std::vector<uint8_t>;
-
-// Stand-ins for mount and umount, first on PATH, that record their
-// arguments and exit with FAKE_MOUNT_EXIT (default 0).
-class FakeMountCommands {
-public:
-    FakeMountCommands() {
-        for (const char* name : {"mount", "umount"}) {
-            const fs::path script = dir_ / name;
-            writeText(script,
-                      "#!/bin/sh\n"
-                      "{ printf '%s' \"${0##*/}\"; for a in \"$@\"; do printf ' [%s]' \"$a\"; done; echo; } >>'" +
-                          (dir_ / "record").string() + "'\nexit ${FAKE_MOUNT_EXIT:-0}\n");
-            fs::permissions(script, fs::perms::owner_all);
-        }
-        writeText(dir_ / "record", "");
-    }
-
-    std::string calls() const { return readText(dir_ / "record"); }
-
-    // In a child: the fakes first on PATH, the log on standard output at
-    // `threshold`, then `body`.
-    ProcessResult run(int threshold, const std::function<int()>& body,
-                      const std::map<std::string, std::string>& env = {}) const {
-        return runInChild([&] {
-            const char* path = std::getenv("PATH");
-            setenv("PATH", (dir_.path().string() + ":" + (path != nullptr ? path : "/usr/bin:/bin")).c_str(), 1);
-            for (const auto& [name, value] : env) setenv(name.c_str(), value.c_str(), 1);
-            setLogOutput(LOG_OUTPUT_STDOUT);
-            setLogLevel(threshold);
-            return body();
-        });
-    }
-
-private:
-    ScratchDir dir_;
-};
-
-// Line numbers of lib/storage/storage_target error lines become N, and each
-// distinct temporary file name becomes #1, #2, ... in order of appearance.
-std::string normalised(const std::string& text) {
-    static const std::regex prefix(R"(lib/storage/storage_target:[0-9]+ )");
-    static const std::regex report(R"(\[lib/storage/storage_target:[0-9]+\] )");
-    static const std::regex temporary(R"(/tmp/firmware[A-Za-z0-9]{6})");
-    std::string out = std::regex_replace(text, prefix, "lib/storage/storage_target:N ");
-    out = std::regex_replace(out, report, "[lib/storage/storage_target:N] ");
-    std::vector<std::string> names;
-    std::string result;
-    auto last = out.cbegin();
-    for (std::sregex_iterator it(out.begin(), out.end(), temporary), end; it != end; ++it) {
-        const std::string name = it->str();
-        size_t number = 0;
-        while (number < names.size() && names[number] != name) ++number;
-        if (number == names.size()) names.push_back(name);
-        result.append(last, out.cbegin() + it->position());
-        result += "#" + std::to_string(number + 1);
-        last = out.cbegin() + it->position() + it->length();
-    }
-    result.append(last, out.cend());
-    return result;
-}
 
 // "/tmp/firmware..." descriptors this process holds, as the kernel names
 // them (a removed file carries " (deleted)"), and whether each is
@@ -189,7 +125,7 @@ TEST(FirmwareUpdateBoot, BeginOpensAnUnnamedTemporaryFile) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
               "Opened #1 for receiving firmware\n"
               "begin 0 valid 1\n"
@@ -204,7 +140,7 @@ TEST(FirmwareUpdateBoot, SecondSlotIsBoot0010) {
         std::printf("slot 0 valid %d\n", target.getSlot(0)->isValid() ? 1 : 0);
         return 0;
     });
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Beginning update of /boot file \"/media/boot/BOOT0010.BIN\"\n"
               "Opened #1 for receiving firmware\n"
               "begin 0\n"
@@ -241,7 +177,7 @@ TEST(FirmwareUpdateBoot, BeginTwiceRestarts) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
               "Opened #1 for receiving firmware\n"
               "begin 0\n"
@@ -269,7 +205,7 @@ TEST(FirmwareUpdateBoot, RestartForgetsWhatWasReceived) {
         std::printf("finalise %u\n", slot.finalise());
         return 0;
     });
-    const std::string out = normalised(result.out);
+    const std::string out = normalisedStorageLog(result.out);
     EXPECT_EQ(out.substr(out.find("--\n")),
               "--\n"
               "lib/storage/storage_target:N TODO: Sanity-check the file\n"
@@ -293,7 +229,7 @@ TEST(FirmwareUpdateBoot, FinaliseWithNothingReceivedFails) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
               "Opened #1 for receiving firmware\n"
               "begin 0\n"
@@ -318,7 +254,7 @@ TEST(FirmwareUpdateBoot, EmptyWritesCountNothing) {
         std::printf("finalise %u\n", slot.finalise());
         return 0;
     });
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "begin 0\n"
               "writeAt 0\n"
               "writeAt 0\n"
@@ -345,7 +281,7 @@ TEST(FirmwareUpdateBoot, EraseAbandonsTheUpdate) {
         std::printf("finalise %u\n", slot.finalise());
         return 0;
     });
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Beginning update of /boot file \"/media/boot/BOOT0010.BIN\"\n"
               "Opened #1 for receiving firmware\n"
               "begin 0\n"
@@ -375,7 +311,7 @@ TEST(FirmwareUpdateBoot, StreamedWriteAfterAFailedOneIsRefused) {
         std::printf("finalise %u\n", slot.finalise());
         return 0;
     });
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
               "Opened #1 for receiving firmware\n"
               "begin 0\n"
@@ -410,7 +346,7 @@ TEST(FirmwareUpdateBoot, ShortOrFailedStreamedWriteEndsTheUpdate) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
               "Opened #1 for receiving firmware\n"
               "begin 0\n"
@@ -451,7 +387,7 @@ TEST(FirmwareUpdateBoot, FailedRemountEndsTheUpdate) {
         },
         {{"FAKE_MOUNT_EXIT", "32"}});
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
               "Opened #1 for receiving firmware\n"
               "begin 0\n"
@@ -483,7 +419,7 @@ TEST(FirmwareUpdateBoot, DestructionClosesTheTemporaryFile) {
         printTemporaryDescriptors();
         return 0;
     });
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "begin 0\n"
               "begin 0\n"
               "fd #1 (deleted) cloexec 1\n"
@@ -558,7 +494,7 @@ TEST(FirmwareUpdatePartition, BeginWithoutTheBlockDevice) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalised(result.out),
+    EXPECT_EQ(normalisedStorageLog(result.out),
               "lib/storage/storage_target:N Unable to locate block device \"/dev/mmcblk0p2\"\n"
               "begin 2 valid 0\n"
               "writeAt 95\n"

@@ -3,87 +3,22 @@
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
-#include <functional>
-#include <map>
-#include <regex>
-#include <string>
-#include <sys/stat.h>
 
 #include <gtest/gtest.h>
 
 #include "child_process.h"
-#include "files.h"
+#include "fake_mount_commands.h"
 #include "lib/util/log.h"
 #include "scratch_dir.h"
+#include "storage_log.h"
 
 namespace {
 
 namespace fs = std::filesystem;
-using testing_support::ProcessResult;
-using testing_support::readText;
+using testing_support::FakeMountCommands;
 using testing_support::runInChild;
 using testing_support::ScratchDir;
-using testing_support::writeText;
-
-// Stand-ins for the system's mount and umount, found first on PATH. Each
-// call appends its name and every argument in brackets to the record file.
-// FAKE_MOUNT_EXIT sets the exit status; FAKE_MOUNT_KILL=1 ends the calling
-// shell and the command by SIGKILL (the shell, when there is one between,
-// so that the command's runner sees a signal); FAKE_MOUNT_STDOUT and
-// FAKE_MOUNT_STDERR are printed on the two streams.
-class FakeMountCommands {
-public:
-    FakeMountCommands() {
-        for (const char* name : {"mount", "umount"}) {
-            const fs::path script = dir_ / name;
-            writeText(script,
-                      "#!/bin/sh\n"
-                      "{ printf '%s' \"${0##*/}\"; for a in \"$@\"; do printf ' [%s]' \"$a\"; done; echo; } >>'" +
-                          record().string() +
-                          "'\n"
-                          "[ -z \"$FAKE_MOUNT_STDOUT\" ] || echo \"$FAKE_MOUNT_STDOUT\"\n"
-                          "[ -z \"$FAKE_MOUNT_STDERR\" ] || echo \"$FAKE_MOUNT_STDERR\" >&2\n"
-                          "if [ \"$FAKE_MOUNT_KILL\" = 1 ]; then\n"
-                          "  read -r parent </proc/$PPID/comm\n"
-                          "  case \"$parent\" in sh|dash|bash) kill -KILL $PPID ;; esac\n"
-                          "  kill -KILL $$\n"
-                          "fi\n"
-                          "exit ${FAKE_MOUNT_EXIT:-0}\n");
-            fs::permissions(script, fs::perms::owner_all);
-        }
-        writeText(record(), "");
-    }
-
-    const fs::path& directory() const { return dir_.path(); }
-    fs::path record() const { return dir_ / "record"; }
-    std::string calls() const { return readText(record()); }
-
-    // In a child: the fakes first on PATH, the log on standard output at
-    // `threshold`, then `body`.
-    ProcessResult run(int threshold, const std::function<int()>& body,
-                      const std::map<std::string, std::string>& env = {}) const {
-        return runInChild([&] {
-            const char* path = std::getenv("PATH");
-            setenv("PATH", (directory().string() + ":" + (path != nullptr ? path : "/usr/bin:/bin")).c_str(), 1);
-            for (const auto& [name, value] : env) setenv(name.c_str(), value.c_str(), 1);
-            setLogOutput(LOG_OUTPUT_STDOUT);
-            setLogLevel(threshold);
-            return body();
-        });
-    }
-
-private:
-    ScratchDir dir_;
-};
-
-// Error lines of lib/storage/storage_target with their line numbers taken
-// out, in both forms: the "<source>:<line> " prefix and the status report.
-std::string withoutLineNumbers(const std::string& text) {
-    static const std::regex prefix(R"(lib/storage/storage_target:[0-9]+ )");
-    static const std::regex report(R"(\[lib/storage/storage_target:[0-9]+\] )");
-    return std::regex_replace(std::regex_replace(text, prefix, "lib/storage/storage_target:N "), report,
-                              "[lib/storage/storage_target:N] ");
-}
+using testing_support::withoutStorageLineNumbers;
 
 int printStatus(Status status) {
     std::printf("status %u\n", status);
@@ -123,7 +58,7 @@ TEST(RemountBootPartition, FailingMountIsFailed) {
     const auto result = fake.run(
         LOG_PRIORITY_WARNING, [] { return printStatus(Storage::remountBootPartition(true)); },
         {{"FAKE_MOUNT_EXIT", "32"}});
-    EXPECT_EQ(withoutLineNumbers(result.out),
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "Remounting \"/media/boot\" as rw\n"
               "lib/storage/storage_target:N Failed to execute mount\n"
               "status 52\n");
@@ -135,7 +70,8 @@ TEST(RemountBootPartition, FailureStillLoggedAtErrorPriority) {
     const auto result = fake.run(
         LOG_PRIORITY_ERROR, [] { return printStatus(Storage::remountBootPartition(false)); },
         {{"FAKE_MOUNT_EXIT", "1"}});
-    EXPECT_EQ(withoutLineNumbers(result.out), "lib/storage/storage_target:N Failed to execute mount\nstatus 52\n");
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
+              "lib/storage/storage_target:N Failed to execute mount\nstatus 52\n");
 }
 
 TEST(RemountBootPartition, NothingLoggedAtCriticalPriority) {
@@ -152,7 +88,8 @@ TEST(RemountBootPartition, KilledMountIsFailed) {
     const auto result = fake.run(
         LOG_PRIORITY_ERROR, [] { return printStatus(Storage::remountBootPartition(true)); },
         {{"FAKE_MOUNT_KILL", "1"}});
-    EXPECT_EQ(withoutLineNumbers(result.out), "lib/storage/storage_target:N Failed to execute mount\nstatus 52\n");
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
+              "lib/storage/storage_target:N Failed to execute mount\nstatus 52\n");
     EXPECT_EQ(fake.calls(), "mount [-o] [remount,rw] [/media/boot]\n");
 }
 
@@ -163,7 +100,7 @@ TEST(RemountBootPartition, MissingMountCommandIsFailed) {
         setLogOutput(LOG_OUTPUT_STDOUT);
         return printStatus(Storage::remountBootPartition(true));
     });
-    EXPECT_EQ(withoutLineNumbers(result.out),
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "Remounting \"/media/boot\" as rw\nlib/storage/storage_target:N Failed to execute mount\nstatus 52\n");
 }
 
@@ -193,7 +130,7 @@ TEST(MountPartition, FailingMountIsReported) {
     const auto result = fake.run(
         LOG_PRIORITY_WARNING, [] { return printStatus(Storage::mountPartition("/media/resources")); },
         {{"FAKE_MOUNT_EXIT", "32"}});
-    EXPECT_EQ(withoutLineNumbers(result.out),
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "Mounting \"/media/resources\"\n"
               "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\n"
               "status 52\n");
@@ -204,7 +141,8 @@ TEST(MountPartition, FailureStillReportedAtErrorPriority) {
     const auto result = fake.run(
         LOG_PRIORITY_ERROR, [] { return printStatus(Storage::mountPartition("/media/resources")); },
         {{"FAKE_MOUNT_EXIT", "1"}});
-    EXPECT_EQ(withoutLineNumbers(result.out), "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n");
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
+              "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n");
 }
 
 TEST(MountPartition, NoReportAtCriticalPriority) {
@@ -221,7 +159,7 @@ TEST(MountPartition, KilledMountIsNotFound) {
         LOG_PRIORITY_WARNING, [] { return printStatus(Storage::mountPartition("/media/resources")); },
         {{"FAKE_MOUNT_KILL", "1"}});
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(withoutLineNumbers(result.out),
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "Mounting \"/media/resources\"\n"
               "[lib/storage/storage_target:N] err_code = 2 (STATUS_NOT_FOUND)\n"
               "status 2\n");
@@ -235,7 +173,7 @@ TEST(MountPartition, MissingMountCommandIsFailed) {
         setLogOutput(LOG_OUTPUT_STDOUT);
         return printStatus(Storage::mountPartition("/media/resources"));
     });
-    EXPECT_EQ(withoutLineNumbers(result.out),
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "Mounting \"/media/resources\"\n[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n");
 }
 
@@ -286,7 +224,7 @@ TEST(UnmountPartition, FailingUmountIsReported) {
     const auto result = fake.run(
         LOG_PRIORITY_WARNING, [] { return printStatus(Storage::unmountPartition("/media/resources")); },
         {{"FAKE_MOUNT_EXIT", "32"}});
-    EXPECT_EQ(withoutLineNumbers(result.out),
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "Unmounting \"/media/resources\"\n"
               "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\n"
               "status 52\n");
@@ -298,7 +236,8 @@ TEST(UnmountPartition, FailureStillReportedAtErrorPriority) {
     const auto result = fake.run(
         LOG_PRIORITY_ERROR, [] { return printStatus(Storage::unmountPartition("/media/resources")); },
         {{"FAKE_MOUNT_EXIT", "1"}});
-    EXPECT_EQ(withoutLineNumbers(result.out), "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n");
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
+              "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n");
 }
 
 TEST(UnmountPartition, KilledUmountIsNotFound) {
@@ -306,7 +245,7 @@ TEST(UnmountPartition, KilledUmountIsNotFound) {
     const auto result = fake.run(
         LOG_PRIORITY_WARNING, [] { return printStatus(Storage::unmountPartition("/media/resources")); },
         {{"FAKE_MOUNT_KILL", "1"}});
-    EXPECT_EQ(withoutLineNumbers(result.out),
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "Unmounting \"/media/resources\"\n"
               "[lib/storage/storage_target:N] err_code = 2 (STATUS_NOT_FOUND)\n"
               "status 2\n");

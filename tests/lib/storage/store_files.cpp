@@ -12,12 +12,6 @@
 namespace store_test {
 namespace fs = std::filesystem;
 
-namespace {
-
-constexpr int64_t kNsPerSecond = 1000000000;
-
-}  // namespace
-
 Bytes bytesOf(const std::string& text) { return Bytes(text.begin(), text.end()); }
 
 Bytes patternBytes(size_t count, uint32_t seed) {
@@ -63,15 +57,15 @@ Bytes absentCheckFile() { return Bytes(8, 0xFF); }
 int64_t mtimeNs(const fs::path& path) {
     struct stat status {};
     if (::stat(path.c_str(), &status) != 0) throw std::runtime_error("cannot stat " + path.string());
-    return status.st_mtim.tv_sec * kNsPerSecond + status.st_mtim.tv_nsec;
+    return status.st_mtim.tv_sec * kSecond + status.st_mtim.tv_nsec;
 }
 
 void setMtimeNs(const fs::path& path, int64_t ns) {
     struct timespec times[2];
     times[0].tv_sec = 0;
     times[0].tv_nsec = UTIME_OMIT;
-    times[1].tv_sec = ns / kNsPerSecond;
-    times[1].tv_nsec = ns % kNsPerSecond;
+    times[1].tv_sec = ns / kSecond;
+    times[1].tv_nsec = ns % kSecond;
     if (::utimensat(AT_FDCWD, path.c_str(), times, 0) != 0) {
         throw std::runtime_error("cannot set the time of " + path.string());
     }
@@ -80,7 +74,7 @@ void setMtimeNs(const fs::path& path, int64_t ns) {
 int64_t nowNs() {
     struct timespec now {};
     clock_gettime(CLOCK_REALTIME, &now);
-    return now.tv_sec * kNsPerSecond + now.tv_nsec;
+    return now.tv_sec * kSecond + now.tv_nsec;
 }
 
 int64_t touchNow(const fs::path& path) {

@@ -16,6 +16,11 @@ namespace store_test {
 
 using testing_support::Bytes;
 
+// One second in nanoseconds, the unit of file times here.
+constexpr int64_t kSecond = 1000000000;
+// A fixed, clearly past instant: 2020-01-01T00:00:00.5Z.
+constexpr int64_t kPast = 1577836800 * kSecond + kSecond / 2;
+
 Bytes bytesOf(const std::string& text);
 // `count` bytes of a fixed pseudo-random pattern chosen by `seed`.
 Bytes patternBytes(size_t count, uint32_t seed);

@@ -25,6 +25,7 @@
 #include <gtest/gtest.h>
 
 #include "child_process.h"
+#include "fake_mount_commands.h"
 #include "files.h"
 #include "lib/storage/dual_file_target.h"
 #include "lib/util/log.h"
@@ -324,12 +325,7 @@ protected:
 
     // Log lines go to the child's standard output; `threshold` as given.
     ProcessResult run(const std::function<void()>& body, int threshold = LOG_PRIORITY_WARNING) {
-        return testing_support::runInChild([&] {
-            const char* path = std::getenv("PATH");
-            const std::string searchPath = binDir.string() + ":" + (path != nullptr ? path : "/usr/bin:/bin");
-            setenv("PATH", searchPath.c_str(), 1);
-            setLogOutput(LOG_OUTPUT_STDOUT);
-            setLogLevel(threshold);
+        return testing_support::runWithCommandsFirst(binDir, threshold, [&] {
             body();
             return 0;
         });

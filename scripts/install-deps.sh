@@ -1,13 +1,20 @@
 #!/usr/bin/env bash
 # Installs the Debian packages that the build needs, when missing.
-# `install-deps.sh tests`: also what the tests need (the simulated device is
-# partitioned with sfdisk and formatted with mkfs.ext4).
+#   install-deps.sh tests   also what the tests need (the simulated device is
+#                           partitioned with sfdisk and formatted with mkfs.ext4)
+#   install-deps.sh cross   also the ARM64 cross compiler, the emulator that
+#                           runs its programs, and GoogleTest's sources to
+#                           build for ARM64
 set -euo pipefail
 
 packages=(cmake ninja-build g++ libgtest-dev)
-if [ "${1:-}" = tests ]; then
-  packages+=(fdisk e2fsprogs)
-fi
+for group in "$@"; do
+  case "$group" in
+    tests) packages+=(fdisk e2fsprogs) ;;
+    cross) packages+=(g++-aarch64-linux-gnu qemu-user googletest file) ;;
+    *) echo "unknown package group: $group" >&2; exit 2 ;;
+  esac
+done
 
 missing=()
 for package in "${packages[@]}"; do

@@ -482,7 +482,7 @@ TEST_F(SimulatedDeviceLifecycle, TerminatedRunnerTearsDown) {
 }
 
 TEST_F(SimulatedDeviceLifecycle, KilledRunIsClearedByTheNextRun) {
-    if (runProgram({"/bin/sh", "-c", "command -v setpriv"}).exitStatus != 0) {
+    if (runShell("command -v setpriv").exitStatus != 0) {
         GTEST_SKIP() << "without setpriv the command outlives a killed runner";
     }
     const fs::path ready = work_ / "ready";

@@ -3,6 +3,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <fcntl.h>
+#include <sstream>
 #include <stdexcept>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -51,17 +52,40 @@ ProcessResult runInChild(const std::function<int()>& body) {
     });
 }
 
-ProcessResult runProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& extraEnv) {
+const std::vector<std::string>& programEmulator() {
+    static const std::vector<std::string> words = [] {
+        std::vector<std::string> result;
+#ifdef PROGRAM_EMULATOR
+        std::istringstream text(PROGRAM_EMULATOR);
+        for (std::string word; text >> word;) result.push_back(word);
+#endif
+        return result;
+    }();
+    return words;
+}
+
+namespace {
+
+ProcessResult execute(const std::vector<std::string>& command, const std::map<std::string, std::string>& extraEnv) {
     return runCaptured([&] {
         for (const auto& [name, value] : extraEnv) setenv(name.c_str(), value.c_str(), 1);
         std::vector<char*> args;
-        for (const auto& arg : argv) args.push_back(const_cast<char*>(arg.c_str()));
+        for (const auto& arg : command) args.push_back(const_cast<char*>(arg.c_str()));
         args.push_back(nullptr);
         execv(args[0], args.data());
         _exit(127);
     });
 }
 
-ProcessResult runShell(const std::string& command) { return runProgram({"/bin/sh", "-c", command}); }
+}  // namespace
+
+ProcessResult runProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& extraEnv) {
+    std::vector<std::string> command = programEmulator();
+    command.insert(command.end(), argv.begin(), argv.end());
+    return execute(command, extraEnv);
+}
+
+// The host's own shell: never through the emulator.
+ProcessResult runShell(const std::string& command) { return execute({"/bin/sh", "-c", command}, {}); }
 
 }  // namespace testing_support

@@ -20,7 +20,12 @@ struct ProcessResult {
 // changes process-wide state (log output mode, umask) or that must crash.
 ProcessResult runInChild(const std::function<int()>& body);
 
-// Runs a program (argv[0] is its path) with extra environment variables.
+// The words that runProgram puts before every program: the emulator of a
+// cross build (qemu-aarch64 and its options), else none.
+const std::vector<std::string>& programEmulator();
+
+// Runs a program (argv[0] is its path) with extra environment variables,
+// through programEmulator().
 ProcessResult runProgram(const std::vector<std::string>& argv,
                          const std::map<std::string, std::string>& extraEnv = {});
 

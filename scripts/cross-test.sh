@@ -1,0 +1,44 @@
+#!/usr/bin/env bash
+# Builds everything for the device (ARM64) with Debian's cross compiler and
+# runs the tests under qemu-aarch64, then builds the fully static tool and
+# reports its stripped size. The ARM64 tool's --help is compared with the
+# native build's (made here when missing).
+set -euo pipefail
+cd "$(dirname "$0")/.."
+scripts/install-deps.sh cross
+
+native=build/default/lib/storage/tools/migrate_settings
+if [ ! -x "$native" ]; then
+  cmake --preset default >/dev/null
+  cmake --build --preset default --target migrate_settings
+fi
+
+# "ELF 64-bit LSB ..., ARM aarch64, ..." for every preset's tool.
+check_arm64() {
+  local description
+  description=$(file -L "$1")
+  echo "$description"
+  case $description in
+    *", ARM aarch64, "*) ;;
+    *) echo "not an ARM64 program: $1" >&2; return 1 ;;
+  esac
+}
+
+echo "=== preset: aarch64"
+cmake --preset aarch64 >/dev/null
+cmake --build --preset aarch64
+check_arm64 build/aarch64/lib/storage/tools/migrate_settings
+REQUIRE_NATIVE_TOOL=1 ctest --preset aarch64
+
+echo "=== preset: aarch64-static"
+cmake --preset aarch64-static >/dev/null
+cmake --build --preset aarch64-static
+prefix=$(mktemp -d /tmp/migrate-settings-static.XXXXXX)
+trap 'rm -rf "$prefix"' EXIT
+cmake --install build/aarch64-static --prefix "$prefix" --strip >/dev/null
+tool=$prefix/bin/migrate_settings
+check_arm64 "$tool"
+file -L "$tool" | grep -q ', statically linked, ' || { echo "not statically linked: $tool" >&2; exit 1; }
+# No sysroot: a static program needs none of the target's libraries.
+REQUIRE_NATIVE_TOOL=1 tests/packaging/help_matches_native.sh "$native" qemu-aarch64 "$tool"
+echo "static ARM64 migrate_settings, stripped: $(stat -c %s "$tool") bytes"

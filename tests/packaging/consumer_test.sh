@@ -1,0 +1,49 @@
+#!/usr/bin/env bash
+# cmake --install of the build tree into a scratch prefix installs exactly
+# the tool, its manual page, the two libraries, their public headers and
+# the package configuration; tests/consumer then configures and builds
+# against that prefix with find_package and runs.
+# usage: consumer_test.sh SETTINGS   (a shell file written by CMakeLists.txt)
+set -euo pipefail
+# build_dir source_dir generator build_type bindir libdir includedir mandir
+# cache_settings cross emulator=(...)
+source "$1"
+
+scratch=$(mktemp -d /tmp/consumer-test.XXXXXX)
+trap 'rm -rf "$scratch"' EXIT
+prefix=$scratch/prefix
+
+cmake --install "$build_dir" --prefix "$prefix" >"$scratch/install.log" || {
+  cat "$scratch/install.log"
+  exit 1
+}
+
+package=$libdir/cmake/migrate_settings
+{
+  printf '%s\n' "$bindir/migrate_settings" "$mandir/man1/migrate_settings.1" \
+    "$libdir/libcommon.a" "$libdir/libstorage.a" \
+    "$package/migrate_settings-config.cmake" "$package/migrate_settings-config-version.cmake" \
+    "$package/migrate_settings-targets.cmake" "$package/migrate_settings-targets-$(tr '[:upper:]' '[:lower:]' <<<"${build_type:-noconfig}").cmake"
+  (cd "$source_dir/libcommon" && find lib/util -name '*.h') | sed "s|^|$includedir/|"
+  (cd "$source_dir" && find lib/storage -maxdepth 1 -name '*.h') | sed "s|^|$includedir/|"
+} | sort >"$scratch/expected"
+(cd "$prefix" && find . -type f -printf '%P\n' | sort) >"$scratch/installed"
+if ! diff -u "$scratch/expected" "$scratch/installed"; then
+  echo "installed files differ from the expected ones (- expected, + installed)"
+  exit 1
+fi
+
+package_args=(-DCMAKE_PREFIX_PATH="$prefix")
+# A cross build looks for packages only below the target's sysroot.
+[ "$cross" = 1 ] && package_args=(-Dmigrate_settings_DIR="$prefix/$package")
+cmake -C "$cache_settings" -G "$generator" -S "$source_dir/tests/consumer" -B "$scratch/build" \
+  "${package_args[@]}" >"$scratch/configure.log" 2>&1 || {
+  cat "$scratch/configure.log"
+  exit 1
+}
+cmake --build "$scratch/build"
+
+"${emulator[@]}" "$scratch/build/storage_consumer" "$scratch/store" >"$scratch/output"
+printf '%s\n' "DualFileTarget $scratch/store with 2 slots" 'slot 0: empty' \
+  'slot 1: "settings for another program" crc32 b8eb8420' >"$scratch/expected_output"
+diff -u "$scratch/expected_output" "$scratch/output"

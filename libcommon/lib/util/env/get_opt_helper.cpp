@@ -14,7 +14,7 @@ namespace {
 // isprint is undefined beyond unsigned char, and ids go far above it.
 bool isShortId(int id) { return id >= 0 && id <= UCHAR_MAX && std::isprint(id); }
 
-bool hasLongName(const GetOptHelper::OptionSpec& spec) { return spec.name != nullptr && spec.name[0] != '\0'; }
+bool hasLongName(const GetOptHelper::OptionSpec& row) { return row.name != nullptr && row.name[0] != '\0'; }
 
 bool isRegistered(GetOptHelper::OptionKind kind) {
     return kind == GetOptHelper::OptionKind::Plain || kind == GetOptHelper::OptionKind::Choice ||
@@ -23,27 +23,27 @@ bool isRegistered(GetOptHelper::OptionKind kind) {
 
 bool isBlank(char c) { return std::isblank(static_cast<unsigned char>(c)); }
 
-std::vector<GetOptHelper::OptionSpec> copyTable(const GetOptHelper::OptionSpec* specs, size_t count) {
+std::vector<GetOptHelper::OptionSpec> copyTable(const GetOptHelper::OptionSpec* rows, size_t count) {
     std::vector<GetOptHelper::OptionSpec> table;
-    // Checked before specs + count is formed, which would overflow first.
+    // Checked before rows + count is formed, which would overflow first.
     if (count > table.max_size()) throw std::length_error("cannot create std::vector larger than max_size()");
-    table.assign(specs, specs + count);
+    table.assign(rows, rows + count);
     return table;
 }
 
 }  // namespace
 
-GetOptHelper::GetOptHelper(const OptionSpec* specs, size_t count) : options(copyTable(specs, count)) {
+GetOptHelper::GetOptHelper(const OptionSpec* rows, size_t count) : options(copyTable(rows, count)) {
     longOptions.reserve(count + 1);
     shortOptions.reserve(2 * count + 1);
-    for (const OptionSpec& spec : options) {
-        if (!isRegistered(spec.kind)) continue;
+    for (const OptionSpec& row : options) {
+        if (!isRegistered(row.kind)) continue;
         // Flag rows are stored by parse, not by getopt_long, so its flag
         // member stays null.
-        if (hasLongName(spec)) longOptions.push_back({spec.name, spec.hasArg, nullptr, spec.id});
-        if (isShortId(spec.id)) {
-            shortOptions.push_back(static_cast<char>(spec.id));
-            if (spec.hasArg != 0) shortOptions.push_back(':');
+        if (hasLongName(row)) longOptions.push_back({row.name, row.hasArg, nullptr, row.id});
+        if (isShortId(row.id)) {
+            shortOptions.push_back(static_cast<char>(row.id));
+            if (row.hasArg != 0) shortOptions.push_back(':');
         }
     }
     longOptions.push_back({nullptr, 0, nullptr, 0});
@@ -52,8 +52,8 @@ GetOptHelper::GetOptHelper(const OptionSpec* specs, size_t count) : options(copy
 GetOptHelper::~GetOptHelper() = default;
 
 const GetOptHelper::OptionSpec* GetOptHelper::findRow(int id) const {
-    for (const OptionSpec& spec : options) {
-        if (spec.id == id) return &spec;
+    for (const OptionSpec& row : options) {
+        if (row.id == id) return &row;
     }
     return nullptr;
 }
@@ -61,20 +61,20 @@ const GetOptHelper::OptionSpec* GetOptHelper::findRow(int id) const {
 Status GetOptHelper::parse(int argc, char** argv) {
     for (;;) {
         const int ch = getopt_long(argc, argv, shortOptions.c_str(), longOptions.data(), nullptr);
-        const OptionSpec* spec = findRow(ch);
-        if (spec != nullptr && spec->kind == OptionKind::Choice) {
+        const OptionSpec* row = findRow(ch);
+        if (row != nullptr && row->kind == OptionKind::Choice) {
             if (optarg == nullptr) throw std::logic_error("choice option without an argument");
-            const auto value = spec->values.find(optarg);
-            const Status r = value != spec->values.end() ? handleChoice(ch, optarg, value->second)
+            const auto value = row->values.find(optarg);
+            const Status r = value != row->values.end() ? handleChoice(ch, optarg, value->second)
                                                          : invalidChoice(ch, optarg);
             if (r != STATUS_OK) return r;
             continue;
         }
-        if (spec != nullptr && spec->kind == OptionKind::Flag) {
-            if (spec->flag != nullptr) *spec->flag = 1;
+        if (row != nullptr && row->kind == OptionKind::Flag) {
+            if (row->flag != nullptr) *row->flag = 1;
             continue;
         }
-        if (spec != nullptr && spec->kind != OptionKind::Plain) continue;
+        if (row != nullptr && row->kind != OptionKind::Plain) continue;
         // Plain rows, '?' from getopt_long's own error reports, and -1.
         const Status r = handleOption(ch, optarg);
         if (r != STATUS_OK) return r;
@@ -86,9 +86,9 @@ Status GetOptHelper::parse(int argc, char** argv) {
 Status GetOptHelper::handleChoice(int, const char*, int) { return STATUS_NOT_IMPLEMENTED; }
 
 Status GetOptHelper::invalidChoice(int id, const char* arg) {
-    const OptionSpec* spec = findRow(id);
-    if (spec != nullptr && hasLongName(*spec)) {
-        LOGE << "Invalid value for --" << spec->name << ": '" << arg << "'";
+    const OptionSpec* row = findRow(id);
+    if (row != nullptr && hasLongName(*row)) {
+        LOGE << "Invalid value for --" << row->name << ": '" << arg << "'";
     } else {
         LOGE << "Invalid value for -" << id << ": '" << arg << "'";
     }
@@ -96,48 +96,48 @@ Status GetOptHelper::invalidChoice(int id, const char* arg) {
 }
 
 const GetOptHelper::OptionSpec* GetOptHelper::optFor(char c) const {
-    const OptionSpec* spec = findRow(static_cast<unsigned char>(c));
-    if (spec == nullptr) LOGE << "Unable to find optFor '" << c << "'";
-    return spec;
+    const OptionSpec* row = findRow(static_cast<unsigned char>(c));
+    if (row == nullptr) LOGE << "Unable to find optFor '" << c << "'";
+    return row;
 }
 
 std::string GetOptHelper::usageText(unsigned helpColumn, unsigned width) const {
     std::ostringstream out;
-    for (const OptionSpec& spec : options) {
-        if (spec.kind == OptionKind::Text) {
-            if (spec.help != nullptr) out << spec.help;
+    for (const OptionSpec& row : options) {
+        if (row.kind == OptionKind::Text) {
+            if (row.help != nullptr) out << row.help;
             continue;
         }
-        if (!isRegistered(spec.kind)) continue;
+        if (!isRegistered(row.kind)) continue;
 
         unsigned col = 0;
-        const bool shortId = isShortId(spec.id);
-        if (hasLongName(spec)) {
-            const unsigned nameLength = static_cast<unsigned>(std::char_traits<char>::length(spec.name));
+        const bool shortId = isShortId(row.id);
+        if (hasLongName(row)) {
+            const unsigned nameLength = static_cast<unsigned>(std::char_traits<char>::length(row.name));
             if (shortId) {
-                out << "  -" << static_cast<char>(spec.id) << ", --" << spec.name;
+                out << "  -" << static_cast<char>(row.id) << ", --" << row.name;
                 col = 8 + nameLength;
             } else {
-                out << "  --" << spec.name;
+                out << "  --" << row.name;
                 col = 4 + nameLength;
             }
-            if (spec.hasArg != 0) {
+            if (row.hasArg != 0) {
                 out << "=arg";
                 col += 4;
             }
         } else if (shortId) {
-            out << "  -" << static_cast<char>(spec.id);
+            out << "  -" << static_cast<char>(row.id);
             col = 4;
-            if (spec.hasArg != 0) {
+            if (row.hasArg != 0) {
                 out << " arg";
                 col = 8;
             }
         }
 
-        writeWrapped(out, spec.help, col, helpColumn, width);
+        writeWrapped(out, row.help, col, helpColumn, width);
 
-        if (spec.defaultValue != nullptr && spec.defaultValue[0] != '\0') {
-            out << std::string(helpColumn, ' ') << "default: " << spec.defaultValue << '\n';
+        if (row.defaultValue != nullptr && row.defaultValue[0] != '\0') {
+            out << std::string(helpColumn, ' ') << "default: " << row.defaultValue << '\n';
         }
     }
     return out.str();

@@ -65,7 +65,7 @@ public:
     // Copies the table (values maps included) and builds shortOptions and
     // longOptions. Throws std::length_error ("cannot create std::vector
     // larger than max_size()") when count cannot be held.
-    GetOptHelper(const OptionSpec* specs, size_t count);
+    GetOptHelper(const OptionSpec* rows, size_t count);
     virtual ~GetOptHelper();
 
     GetOptHelper(const GetOptHelper&) = delete;

@@ -21,26 +21,26 @@ namespace {
 
 using testing_support::ProcessResult;
 using testing_support::runInChild;
-using Spec = GetOptHelper::OptionSpec;
+using Row = GetOptHelper::OptionSpec;
 using Kind = GetOptHelper::OptionKind;
 
 const Kind kUnknownKind = static_cast<Kind>(9);
 
-Spec row(int32_t id, const char* name, int32_t hasArg, Kind kind, const char* help = "",
+Row row(int32_t id, const char* name, int32_t hasArg, Kind kind, const char* help = "",
          const char* defaultValue = "") {
-    return Spec{id, name, defaultValue, hasArg, help, kind, {}, nullptr};
+    return Row{id, name, defaultValue, hasArg, help, kind, {}, nullptr};
 }
 
-Spec choiceRow(int32_t id, const char* name, std::map<std::string, int32_t> values, int32_t hasArg = 1) {
-    Spec spec = row(id, name, hasArg, Kind::Choice);
-    spec.values = std::move(values);
-    return spec;
+Row choiceRow(int32_t id, const char* name, std::map<std::string, int32_t> values, int32_t hasArg = 1) {
+    Row entry = row(id, name, hasArg, Kind::Choice);
+    entry.values = std::move(values);
+    return entry;
 }
 
-Spec flagRow(int32_t id, const char* name, uint8_t* flag, int32_t hasArg = 0) {
-    Spec spec = row(id, name, hasArg, Kind::Flag);
-    spec.flag = flag;
-    return spec;
+Row flagRow(int32_t id, const char* name, uint8_t* flag, int32_t hasArg = 0) {
+    Row entry = row(id, name, hasArg, Kind::Flag);
+    entry.flag = flag;
+    return entry;
 }
 
 // A mutable argv with its terminating null, as getopt_long permutes it.
@@ -66,8 +66,8 @@ std::string show(const char* text) { return text != nullptr ? std::string(text) 
 // Records every plain option and the call of finish; choices go to the base.
 class RecordingHelper : public GetOptHelper {
 public:
-    explicit RecordingHelper(const std::vector<Spec>& specs) : GetOptHelper(specs.data(), specs.size()) {}
-    RecordingHelper(const Spec* specs, size_t count) : GetOptHelper(specs, count) {}
+    explicit RecordingHelper(const std::vector<Row>& table) : GetOptHelper(table.data(), table.size()) {}
+    RecordingHelper(const Row* table, size_t count) : GetOptHelper(table, count) {}
 
     using GetOptHelper::longOptions;
     using GetOptHelper::options;
@@ -125,12 +125,12 @@ protected:
 
 // Runs a parse in a child with the log on standard output; the child prints
 // the recorded events after the log and exits with the parse's status.
-ProcessResult parseInChild(const std::vector<Spec>& specs, const std::vector<std::string>& args,
+ProcessResult parseInChild(const std::vector<Row>& table, const std::vector<std::string>& args,
                            int logLevel = LOG_PRIORITY_WARNING) {
     return runInChild([&] {
         setLogOutput(LOG_OUTPUT_STDOUT);
         setLogLevel(logLevel);
-        RecordingHelper helper(specs);
+        RecordingHelper helper(table);
         const Status status = helper.parseArgs(args);
         std::fputs(helper.eventText().c_str(), stdout);
         return static_cast<int>(status);
@@ -147,7 +147,7 @@ const std::string kHelpIndent(26, ' ');
 // Building the getopt tables
 
 TEST(GetOptHelperTables, EmptyTableHasEmptyShortOptionsAndOnlyTheTerminator) {
-    RecordingHelper helper(std::vector<Spec>{});
+    RecordingHelper helper(std::vector<Row>{});
     EXPECT_EQ(helper.shortOptions, "");
     ASSERT_EQ(helper.longOptions.size(), 1u);
     EXPECT_EQ(helper.longOptions[0].name, nullptr);
@@ -158,7 +158,7 @@ TEST(GetOptHelperTables, EmptyTableHasEmptyShortOptionsAndOnlyTheTerminator) {
 }
 
 TEST(GetOptHelperTables, EmptyTableParseCallsEndOfOptionsThenFinishWithAllArguments) {
-    RecordingHelper helper(std::vector<Spec>{});
+    RecordingHelper helper(std::vector<Row>{});
     helper.finishResult = 77;
     EXPECT_EQ(helper.parseArgs({"prog", "one", "two"}), 77u);
     EXPECT_EQ(helper.eventText(), "option -1 <null>\nfinish one two\n");
@@ -166,7 +166,7 @@ TEST(GetOptHelperTables, EmptyTableParseCallsEndOfOptionsThenFinishWithAllArgume
 
 TEST(GetOptHelperTables, ShortOptionStringTakesPrintableIdsOfRegisteredRows) {
     uint8_t seen = 0;
-    const std::vector<Spec> specs = {
+    const std::vector<Row> table = {
         row('a', "alpha", 0, Kind::Plain),
         row('b', nullptr, 1, Kind::Plain),
         row('c', "gamma", 2, Kind::Plain),  // optional argument: one ':' only
@@ -178,13 +178,13 @@ TEST(GetOptHelperTables, ShortOptionStringTakesPrintableIdsOfRegisteredRows) {
         row(7, "bell", 0, Kind::Plain),
         row(200, "high", 1, Kind::Plain),
     };
-    RecordingHelper helper(specs);
+    RecordingHelper helper(table);
     EXPECT_EQ(helper.shortOptions, "ab:c:de:");
 }
 
 TEST(GetOptHelperTables, LongOptionsHoldNamedRegisteredRowsWithNullFlagAndEndWithTerminator) {
     uint8_t seen = 0;
-    const std::vector<Spec> specs = {
+    const std::vector<Row> table = {
         row('a', "alpha", 0, Kind::Plain),
         row('b', nullptr, 1, Kind::Plain),
         row('c', "gamma", 2, Kind::Plain),
@@ -196,15 +196,15 @@ TEST(GetOptHelperTables, LongOptionsHoldNamedRegisteredRowsWithNullFlagAndEndWit
         row(7, "bell", 0, Kind::Plain),
         row(200, "high", 1, Kind::Plain),
     };
-    RecordingHelper helper(specs);
+    RecordingHelper helper(table);
     struct Expected {
         const char* name;
         int hasArg;
         int val;
     };
     const std::vector<Expected> expected = {
-        {specs[0].name, 0, 'a'},    {specs[2].name, 2, 'c'}, {specs[3].name, 1, 1000},
-        {specs[4].name, 0, 'd'},    {specs[8].name, 0, 7},   {specs[9].name, 1, 200},
+        {table[0].name, 0, 'a'},    {table[2].name, 2, 'c'}, {table[3].name, 1, 1000},
+        {table[4].name, 0, 'd'},    {table[8].name, 0, 7},   {table[9].name, 1, 200},
     };
     ASSERT_EQ(helper.longOptions.size(), expected.size() + 1);
     for (size_t i = 0; i < expected.size(); ++i) {
@@ -222,22 +222,22 @@ TEST(GetOptHelperTables, LongOptionsHoldNamedRegisteredRowsWithNullFlagAndEndWit
 }
 
 TEST(GetOptHelperTables, TableIsCopiedDeeply) {
-    std::vector<Spec> specs = {choiceRow(1000, "type", {{"simple", 0}})};
-    ChoiceRecorder helper(specs);
-    specs[0].values.clear();
-    specs[0].values["other"] = 5;
+    std::vector<Row> table = {choiceRow(1000, "type", {{"simple", 0}})};
+    ChoiceRecorder helper(table);
+    table[0].values.clear();
+    table[0].values["other"] = 5;
     ASSERT_EQ(helper.options.size(), 1u);
-    EXPECT_NE(&helper.options[0], &specs[0]);
-    EXPECT_EQ(helper.options[0].name, specs[0].name);
+    EXPECT_NE(&helper.options[0], &table[0]);
+    EXPECT_EQ(helper.options[0].name, table[0].name);
     EXPECT_EQ(helper.options[0].values, (std::map<std::string, int32_t>{{"simple", 0}}));
     EXPECT_EQ(helper.parseArgs({"prog", "--type", "simple", "--type", "other"}), STATUS_OK);
     EXPECT_EQ(helper.eventText(), "choice 1000 simple 0\ninvalid 1000 other\noption -1 <null>\nfinish\n");
 }
 
 TEST(GetOptHelperTables, AbsurdCountThrowsLengthError) {
-    const Spec spec = row('a', "alpha", 0, Kind::Plain);
+    const Row entry = row('a', "alpha", 0, Kind::Plain);
     try {
-        RecordingHelper helper(&spec, SIZE_MAX);
+        RecordingHelper helper(&entry, SIZE_MAX);
         FAIL() << "no exception";
     } catch (const std::length_error& error) {
         EXPECT_STREQ(error.what(), "cannot create std::vector larger than max_size()");
@@ -247,7 +247,7 @@ TEST(GetOptHelperTables, AbsurdCountThrowsLengthError) {
 // ---------------------------------------------------------------------------
 // Parsing and dispatch
 
-const std::vector<Spec> kPlainSpecs = {
+const std::vector<Row> kPlainSpecs = {
     row('a', "alpha", 0, Kind::Plain),
     row('b', "bee", 1, Kind::Plain),
 };
@@ -339,7 +339,7 @@ TEST(GetOptHelperParse, QuestionMarkResultEndsTheParse) {
     EXPECT_EQ(result.out, "option 63 <null>\n");
 }
 
-const std::vector<Spec> kChoiceSpecs = {
+const std::vector<Row> kChoiceSpecs = {
     row('a', "alpha", 0, Kind::Plain),
     choiceRow(1000, "type", {{"simple", 0}, {"checked", 1}, {"redundant", 2}}),
     choiceRow('k', nullptr, {{"lut", 11}}),
@@ -397,12 +397,12 @@ TEST(GetOptHelperParse, BaseInvalidChoiceLogsTheLongNameAndFails) {
 }
 
 TEST(GetOptHelperParse, BaseInvalidChoiceWithoutLongNameLogsTheIdInDecimal) {
-    const std::vector<Spec> nullName = {choiceRow('x', nullptr, {{"a", 1}})};
+    const std::vector<Row> nullName = {choiceRow('x', nullptr, {{"a", 1}})};
     const ProcessResult shortOnly = parseInChild(nullName, {"prog", "-x", "bogus"});
     EXPECT_EQ(shortOnly.exitStatus, static_cast<int>(STATUS_INVALID_PARAMETER));
     EXPECT_TRUE(isErrorLine(shortOnly.out, "Invalid value for -120: 'bogus'")) << shortOnly.out;
 
-    const std::vector<Spec> emptyName = {choiceRow('y', "", {{"a", 1}})};
+    const std::vector<Row> emptyName = {choiceRow('y', "", {{"a", 1}})};
     const ProcessResult empty = parseInChild(emptyName, {"prog", "-y", "b"});
     EXPECT_EQ(empty.exitStatus, static_cast<int>(STATUS_INVALID_PARAMETER));
     EXPECT_TRUE(isErrorLine(empty.out, "Invalid value for -121: 'b'")) << empty.out;
@@ -415,11 +415,11 @@ TEST(GetOptHelperParse, BaseInvalidChoiceIsSilentBelowErrorThreshold) {
 }
 
 TEST(GetOptHelperParse, ChoiceWithoutArgumentThrowsLogicError) {
-    const std::vector<Spec> noArg = {choiceRow(1000, "kind", {{"a", 1}}, 0)};
+    const std::vector<Row> noArg = {choiceRow(1000, "kind", {{"a", 1}}, 0)};
     ChoiceRecorder withoutArg(noArg);
     EXPECT_THROW((void)withoutArg.parseArgs({"prog", "--kind"}), std::logic_error);
 
-    const std::vector<Spec> optionalArg = {choiceRow(1000, "kind", {{"a", 1}}, 2)};
+    const std::vector<Row> optionalArg = {choiceRow(1000, "kind", {{"a", 1}}, 2)};
     ChoiceRecorder optional(optionalArg);
     EXPECT_THROW((void)optional.parseArgs({"prog", "--kind"}), std::logic_error);
 }
@@ -427,15 +427,15 @@ TEST(GetOptHelperParse, ChoiceWithoutArgumentThrowsLogicError) {
 TEST(GetOptHelperParse, FlagRowStoresOneAndCallsNoHandler) {
     uint8_t flag = 0;
     uint8_t other = 0;
-    const std::vector<Spec> specs = {flagRow('f', "flag", &flag), flagRow(1000, "other", &other, 1)};
-    ChoiceRecorder helper(specs);
+    const std::vector<Row> table = {flagRow('f', "flag", &flag), flagRow(1000, "other", &other, 1)};
+    ChoiceRecorder helper(table);
     EXPECT_EQ(helper.parseArgs({"prog", "-f", "pos"}), STATUS_OK);
     EXPECT_EQ(flag, 1);
     EXPECT_EQ(other, 0);
     EXPECT_EQ(helper.eventText(), "option -1 <null>\nfinish pos\n");
 
     flag = 0;
-    ChoiceRecorder longForm(specs);
+    ChoiceRecorder longForm(table);
     EXPECT_EQ(longForm.parseArgs({"prog", "--flag", "--other", "value"}), STATUS_OK);
     EXPECT_EQ(flag, 1);
     EXPECT_EQ(other, 1);
@@ -443,16 +443,16 @@ TEST(GetOptHelperParse, FlagRowStoresOneAndCallsNoHandler) {
 }
 
 TEST(GetOptHelperParse, FlagRowWithNullFlagIsAcceptedWithoutEffect) {
-    const std::vector<Spec> specs = {flagRow('f', "flag", nullptr), row('a', "alpha", 0, Kind::Plain)};
-    ChoiceRecorder helper(specs);
+    const std::vector<Row> table = {flagRow('f', "flag", nullptr), row('a', "alpha", 0, Kind::Plain)};
+    ChoiceRecorder helper(table);
     EXPECT_EQ(helper.parseArgs({"prog", "-f", "--flag", "-a"}), STATUS_OK);
     EXPECT_EQ(helper.eventText(), "option 97 <null>\noption -1 <null>\nfinish\n");
 }
 
 TEST(GetOptHelperParse, TextAndUnknownKindRowsAreNotOptions) {
-    const std::vector<Spec> specs = {row('t', "text", 0, Kind::Text, "Heading\n"),
+    const std::vector<Row> table = {row('t', "text", 0, Kind::Text, "Heading\n"),
                                      row('u', "unknown", 0, kUnknownKind)};
-    const ProcessResult result = parseInChild(specs, {"prog", "-t", "--unknown"});
+    const ProcessResult result = parseInChild(table, {"prog", "-t", "--unknown"});
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(result.out, "option 63 <null>\noption 63 <null>\noption -1 <null>\nfinish\n");
     EXPECT_NE(result.err.find("'t'"), std::string::npos) << result.err;
@@ -462,9 +462,9 @@ TEST(GetOptHelperParse, TextAndUnknownKindRowsAreNotOptions) {
 TEST(GetOptHelperParse, FirstRowWithTheIdDecidesTheKind) {
     // 'a' is registered by its Plain row but the Text row comes first, so
     // the option is ignored; 'b' is Plain first and reaches handleOption.
-    const std::vector<Spec> specs = {row('a', "", 0, Kind::Text, "Heading\n"), row('a', "alpha", 0, Kind::Plain),
+    const std::vector<Row> table = {row('a', "", 0, Kind::Text, "Heading\n"), row('a', "alpha", 0, Kind::Plain),
                                      row('b', "bee", 0, Kind::Plain), row('b', "", 0, kUnknownKind)};
-    RecordingHelper helper(specs);
+    RecordingHelper helper(table);
     EXPECT_EQ(helper.parseArgs({"prog", "-a", "--alpha", "-b"}), STATUS_OK);
     EXPECT_EQ(helper.eventText(), "option 98 <null>\noption -1 <null>\nfinish\n");
 }
@@ -473,14 +473,14 @@ TEST(GetOptHelperParse, FirstRowWithTheIdDecidesTheKind) {
 // optFor
 
 TEST(GetOptHelperOptFor, FindsTheFirstRowWithTheCharacterAsId) {
-    const std::vector<Spec> specs = {row('b', "base", 1, Kind::Plain, "first", "/var/x"),
+    const std::vector<Row> table = {row('b', "base", 1, Kind::Plain, "first", "/var/x"),
                                      row('b', "other", 1, Kind::Plain, "second", "/y"),
                                      row(232, "high", 0, Kind::Plain)};
-    RecordingHelper helper(specs);
-    const Spec* found = helper.optFor('b');
+    RecordingHelper helper(table);
+    const Row* found = helper.optFor('b');
     ASSERT_NE(found, nullptr);
     EXPECT_EQ(found, &helper.options[0]);
-    EXPECT_EQ(found->defaultValue, specs[0].defaultValue);
+    EXPECT_EQ(found->defaultValue, table[0].defaultValue);
     EXPECT_STREQ(found->defaultValue, "/var/x");
 
     // The character is taken as unsigned.
@@ -488,10 +488,10 @@ TEST(GetOptHelperOptFor, FindsTheFirstRowWithTheCharacterAsId) {
 }
 
 TEST(GetOptHelperOptFor, MissingCharacterLogsAndReturnsNull) {
-    const std::vector<Spec> specs = {row('b', "base", 1, Kind::Plain)};
+    const std::vector<Row> table = {row('b', "base", 1, Kind::Plain)};
     const ProcessResult result = runInChild([&] {
         setLogOutput(LOG_OUTPUT_STDOUT);
-        RecordingHelper helper(specs);
+        RecordingHelper helper(table);
         return helper.optFor('z') == nullptr ? 0 : 1;
     });
     EXPECT_EQ(result.exitStatus, 0);
@@ -499,10 +499,10 @@ TEST(GetOptHelperOptFor, MissingCharacterLogsAndReturnsNull) {
 }
 
 TEST(GetOptHelperOptFor, IdsAbove255AreNeverFound) {
-    const std::vector<Spec> specs = {row(1000, "type", 1, Kind::Plain), row(256 + 'b', "wide", 1, Kind::Plain)};
+    const std::vector<Row> table = {row(1000, "type", 1, Kind::Plain), row(256 + 'b', "wide", 1, Kind::Plain)};
     const ProcessResult result = runInChild([&] {
         setLogOutput(LOG_OUTPUT_STDOUT);
-        RecordingHelper helper(specs);
+        RecordingHelper helper(table);
         const bool none = helper.optFor(static_cast<char>(1000 & 0xFF)) == nullptr && helper.optFor('b') == nullptr;
         return none ? 0 : 1;
     });
@@ -516,8 +516,8 @@ TEST(GetOptHelperOptFor, IdsAbove255AreNeverFound) {
 // ---------------------------------------------------------------------------
 // Usage text
 
-std::string usageOf(const std::vector<Spec>& specs, unsigned helpColumn = 26, unsigned width = 80) {
-    RecordingHelper helper(specs);
+std::string usageOf(const std::vector<Row>& table, unsigned helpColumn = 26, unsigned width = 80) {
+    RecordingHelper helper(table);
     return helper.usageText(helpColumn, width);
 }
 
@@ -525,7 +525,7 @@ TEST(GetOptHelperUsage, EmptyTableGivesEmptyText) { EXPECT_EQ(usageOf({}), ""); 
 
 TEST(GetOptHelperUsage, OptionPartForms) {
     uint8_t flag = 0;
-    const std::vector<Spec> specs = {
+    const std::vector<Row> table = {
         row('a', "alpha", 0, Kind::Plain, "Alpha help."),
         choiceRow('b', "beta", {}),
         row(1000, "gamma", 1, Kind::Plain, "Gamma help."),
@@ -536,7 +536,7 @@ TEST(GetOptHelperUsage, OptionPartForms) {
         row('g', nullptr, 2, Kind::Plain, "Optional."),
         row('h', "eta", 2, Kind::Plain, "Optional long."),
     };
-    EXPECT_EQ(usageOf(specs),
+    EXPECT_EQ(usageOf(table),
               "  -a, --alpha             Alpha help.\n"
               "  -b, --beta=arg\n"  // empty help: no padding
               "  --gamma=arg             Gamma help.\n"
@@ -549,7 +549,7 @@ TEST(GetOptHelperUsage, OptionPartForms) {
 }
 
 TEST(GetOptHelperUsage, TextRowsAreCopiedVerbatimAndUnknownKindsShowNothing) {
-    const std::vector<Spec> specs = {
+    const std::vector<Row> table = {
         row(0, nullptr, 0, Kind::Text, "Options:\n"),
         row('a', "alpha", 0, Kind::Plain, "Alpha help."),
         row('t', "text", 1, Kind::Text, "  no newline ", "ignored default"),
@@ -557,20 +557,20 @@ TEST(GetOptHelperUsage, TextRowsAreCopiedVerbatimAndUnknownKindsShowNothing) {
         row('b', "", 0, Kind::Plain, "B."),
         row(0, nullptr, 0, Kind::Text, ""),
     };
-    EXPECT_EQ(usageOf(specs),
+    EXPECT_EQ(usageOf(table),
               "Options:\n"
               "  -a, --alpha             Alpha help.\n"
               "  no newline   -b                      B.\n");
 }
 
 TEST(GetOptHelperUsage, OptionPartOf24StaysOnTheLineAnd25MovesHelpToTheNextLine) {
-    const std::vector<Spec> specs = {
+    const std::vector<Row> table = {
         row('a', "sixteen-chars-ab", 0, Kind::Plain, "Fits."),          // col 24
         row('b', "seventeen-chars-a", 0, Kind::Plain, "Next line."),    // col 25
         row(1000, "seventeen-chars-b", 1, Kind::Plain, "Long only."),  // col 25
         row(1001, "a-name-of-thirty-characters-xx", 0, Kind::Plain, "Far."),
     };
-    EXPECT_EQ(usageOf(specs),
+    EXPECT_EQ(usageOf(table),
               "  -a, --sixteen-chars-ab  Fits.\n"
               "  -b, --seventeen-chars-a\n" +
                   kHelpIndent + "Next line.\n" +
@@ -579,20 +579,20 @@ TEST(GetOptHelperUsage, OptionPartOf24StaysOnTheLineAnd25MovesHelpToTheNextLine)
 }
 
 TEST(GetOptHelperUsage, LongOptionPartWithEmptyHelpGivesAnEmptyLine) {
-    const std::vector<Spec> specs = {row('b', "seventeen-chars-a", 0, Kind::Plain, ""),
+    const std::vector<Row> table = {row('b', "seventeen-chars-a", 0, Kind::Plain, ""),
                                      row('a', "alpha", 0, Kind::Plain, "")};
-    EXPECT_EQ(usageOf(specs), "  -b, --seventeen-chars-a\n\n  -a, --alpha\n");
+    EXPECT_EQ(usageOf(table), "  -b, --seventeen-chars-a\n\n  -a, --alpha\n");
 }
 
 TEST(GetOptHelperUsage, DefaultLines) {
-    const std::vector<Spec> specs = {
+    const std::vector<Row> table = {
         row('a', "alpha", 1, Kind::Plain, "Alpha help.", "/var/x"),
         row('b', "beta", 0, Kind::Plain, "Beta help.", ""),
         row('c', nullptr, 0, Kind::Plain, "", "7"),
         row('d', "seventeen-chars-a", 0, Kind::Plain, "", "long"),
         choiceRow(1000, "check", {{"settings", 0}}),
     };
-    std::vector<Spec> withChoiceDefault = specs;
+    std::vector<Row> withChoiceDefault = table;
     withChoiceDefault[4].defaultValue = "settings";
     withChoiceDefault[4].help = "Check.";
     EXPECT_EQ(usageOf(withChoiceDefault),
@@ -604,8 +604,8 @@ TEST(GetOptHelperUsage, DefaultLines) {
 }
 
 std::string wrapped(const std::string& help, unsigned helpColumn = 26, unsigned width = 80) {
-    const std::vector<Spec> specs = {row('a', "alpha", 0, Kind::Plain, help.c_str())};
-    return usageOf(specs, helpColumn, width);
+    const std::vector<Row> table = {row('a', "alpha", 0, Kind::Plain, help.c_str())};
+    return usageOf(table, helpColumn, width);
 }
 
 const std::string kFirst = "  -a, --alpha             ";
@@ -660,9 +660,9 @@ TEST(GetOptHelperUsage, TrailingBlanksAtABreakAreSkippedToTheEnd) {
 
 TEST(GetOptHelperUsage, HelpColumnAndWidthAreParameters) {
     // avail = 30 - (10 + 1) = 19
-    const std::vector<Spec> specs = {row('a', "al", 0, Kind::Plain, "one two three four five six", "x"),
+    const std::vector<Row> table = {row('a', "al", 0, Kind::Plain, "one two three four five six", "x"),
                                      row('b', nullptr, 0, Kind::Plain, "short")};
-    EXPECT_EQ(usageOf(specs, 10, 30),
+    EXPECT_EQ(usageOf(table, 10, 30),
               "  -a, --al\n"
               "          one two three four\n"
               "          five six\n"

@@ -5,6 +5,7 @@
 #   install-deps.sh cross   also the ARM64 cross compiler, the emulator that
 #                           runs its programs, and GoogleTest's sources to
 #                           build for ARM64
+#   install-deps.sh fuzz    also clang and its libFuzzer runtime
 set -euo pipefail
 
 packages=(cmake ninja-build g++ libgtest-dev)
@@ -12,6 +13,7 @@ for group in "$@"; do
   case "$group" in
     tests) packages+=(fdisk e2fsprogs) ;;
     cross) packages+=(g++-aarch64-linux-gnu qemu-user googletest file) ;;
+    fuzz) packages+=(clang libclang-rt-14-dev) ;;
     *) echo "unknown package group: $group" >&2; exit 2 ;;
   esac
 done

@@ -1,7 +1,9 @@
 #!/usr/bin/env bash
 # Installs the Debian packages that the build needs, when missing.
 #   install-deps.sh tests   also what the tests need (the simulated device is
-#                           partitioned with sfdisk and formatted with mkfs.ext4)
+#                           partitioned with sfdisk and formatted with mkfs.ext4;
+#                           the crash exploration compares its records with
+#                           strace)
 #   install-deps.sh cross   also the ARM64 cross compiler, the emulator that
 #                           runs its programs, and GoogleTest's sources to
 #                           build for ARM64
@@ -11,7 +13,7 @@ set -euo pipefail
 packages=(cmake ninja-build g++ libgtest-dev)
 for group in "$@"; do
   case "$group" in
-    tests) packages+=(fdisk e2fsprogs) ;;
+    tests) packages+=(fdisk e2fsprogs strace) ;;
     cross) packages+=(g++-aarch64-linux-gnu qemu-user googletest file) ;;
     fuzz) packages+=(clang libclang-rt-14-dev) ;;
     *) echo "unknown package group: $group" >&2; exit 2 ;;

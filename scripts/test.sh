@@ -10,4 +10,6 @@ for preset in default asan; do
   cmake --preset "$preset" >/dev/null
   cmake --build --preset "$preset"
   ctest --preset "$preset"
+  # The power-cut exploration's and the soak's totals, from the log of the run above.
+  grep -h -e "crash exploration totals" -e "broken writer:" -e "soak: [0-9]* runs" "build/$preset/Testing/Temporary/LastTest.log" || true
 done

@@ -33,6 +33,19 @@ Environment faultCountEnv(const std::string& call, const std::string& countFile,
     return env;
 }
 
+Environment recordEnv(const std::string& recordFile, const std::string& pathSubstr, std::optional<int64_t> fakeTime,
+                      Environment base) {
+    const auto filter = base.find("FAULT_PATH_SUBSTR");
+    if (filter != base.end() && filter->second != pathSubstr) {
+        throw std::invalid_argument("recordEnv: the base environment filters on " + filter->second + ", not on " +
+                                    pathSubstr);
+    }
+    if (!pathSubstr.empty()) base["FAULT_PATH_SUBSTR"] = pathSubstr;
+    if (!recordFile.empty()) base["FAULT_RECORD"] = recordFile;
+    if (fakeTime) base["FAULT_MTIME"] = std::to_string(*fakeTime);
+    return base;
+}
+
 unsigned long readFaultCount(const std::filesystem::path& countFile) {
     const std::string text = readText(countFile);
     const bool wellFormed = text.size() >= 2 && text.size() <= 21 && text.back() == '\n' &&

@@ -2,8 +2,10 @@
 // and what they do are described at the top of fault_injection_shim.c.
 #pragma once
 
+#include <cstdint>
 #include <filesystem>
 #include <map>
+#include <optional>
 #include <string>
 
 namespace testing_support {
@@ -30,6 +32,15 @@ Environment faultEnv(const std::string& call, unsigned long nth, const std::stri
 // Only counts the calls matching `call` into `countFile` (absolute).
 Environment faultCountEnv(const std::string& call, const std::string& countFile,
                           const std::string& pathSubstr = "");
+
+// Adds recording to `base` (preloadEnv(), faultEnv(...), ...): every
+// successful mutating call on a path containing `pathSubstr` (any path when
+// empty) is appended to `recordFile` (absolute; none when empty), and with
+// `fakeTime` files the calls create, truncate or write get that time.
+// Throws std::invalid_argument when `base` already filters on another
+// path, since the shim has one filter for counting and recording.
+Environment recordEnv(const std::string& recordFile, const std::string& pathSubstr = "",
+                      std::optional<int64_t> fakeTime = std::nullopt, Environment base = preloadEnv());
 
 // The number the shim wrote to a count file. Throws std::runtime_error when
 // the file is missing or does not hold one decimal number and a newline.

@@ -1,8 +1,9 @@
 /*
  * LD_PRELOAD shim that fails or ends the process at the Nth matching file
  * system call, so tests can reach failure paths and simulate power cuts
- * without any test code in the product. Configured by environment variables,
- * read once; without FAULT_CALL it only forwards.
+ * without any test code in the product, and that records what the calls
+ * changed. Configured by environment variables, read once; without any of
+ * them it only forwards.
  *
  *   FAULT_CALL         what to count: a call family, an exact function name,
  *                      or "mutating".
@@ -35,28 +36,70 @@
  *                        short:BYTES  write and pwrite transfer at most
  *                          BYTES; any other call is made unchanged
  *   FAULT_PATH_SUBSTR  only calls whose file's path contains this text are
- *                      counted. Path arguments are matched as given (a
- *                      relative path after an *at call's directory is also
- *                      matched joined to that directory's path); a call
- *                      that takes only a descriptor is matched on the path
- *                      the kernel shows for it in /proc/self/fd. rename
- *                      matches on either name.
+ *                      counted, recorded and given the fake time. Path
+ *                      arguments are matched as given (a relative path
+ *                      after an *at call's directory is also matched joined
+ *                      to that directory's path); a call that takes only a
+ *                      descriptor is matched on the path the kernel shows
+ *                      for it in /proc/self/fd. rename matches on either
+ *                      name.
  *   FAULT_COUNT_FILE   receives the number of matching calls seen, in
  *                      decimal with a newline: 0 at load, then rewritten
  *                      after every matching call (before a crash too), so
  *                      it is right however the process ends. Give an
  *                      absolute path.
+ *   FAULT_RECORD       absolute path of a record that gets one line
+ *                      appended, with one write, after every successful
+ *                      call above that changed something: opens that
+ *                      created or truncated a file, writes to regular
+ *                      files, and every other call but the reading opens.
+ *                      syncfs passes any FAULT_PATH_SUBSTR. A call the
+ *                      shim fails or crashes on is not made, so not
+ *                      recorded. Fields are separated by one space; PATH
+ *                      is absolute (relative names joined to the working
+ *                      or the *at directory, descriptors named by
+ *                      /proc/self/fd) with '%', ' ' and '\n' written %25,
+ *                      %20, %0A; INO is the inode; MTIME the file's
+ *                      modification time after the call, SEC.NNNNNNNNN;
+ *                      HEX the bytes written, "-" for none.
+ *                        create PATH INO MTIME       a new regular file
+ *                        truncate PATH INO SIZE MTIME
+ *                        write PATH INO OFFSET HEX MTIME
+ *                                                    regular files only;
+ *                          OFFSET is where the bytes went (the end for
+ *                          O_APPEND); sendfile and copy_file_range are
+ *                          writes of the bytes read back from the
+ *                          destination, else the source, else HEX is "?"
+ *                        unlink PATH INO
+ *                        rmdir PATH
+ *                        mkdir PATH
+ *                        rename FROM TO INO REPLACED  REPLACED is the inode
+ *                                                    TO named before, or 0
+ *                        utimens PATH INO MTIME
+ *                        fsync PATH INO              fsync and fdatasync
+ *                        syncfs
+ *                        chmod PATH INO
+ *                      Writes through stdio streams are made inside glibc
+ *                      and are not seen. Works without FAULT_CALL.
+ *   FAULT_MTIME        SECONDS, a fake clock, optionally negative: right
+ *                      after a successful call creates, truncates or
+ *                      writes a regular file, its modification and access
+ *                      times are set to SECONDS.000000000 (before the call
+ *                      is recorded). The program's own utimensat and
+ *                      futimens are left as they are. Works without
+ *                      FAULT_CALL.
  *
  * The shim acts only in the process that loaded it: it removes the FAULT_*
  * variables from the environment at load, so programs that process starts
  * run unaffected, and a forked child passes every call through. A bad
  * setting ends the process at load with status 98 and a message on
- * standard error.
+ * standard error, and so does a record line that cannot be written later.
  *
- * The shim neither allocates nor uses stdio, and its own I/O goes through
- * raw system calls: it may run inside the start-up of any process, before
- * the program's allocator or its sanitizer runtime is ready, and its own
- * calls are never counted.
+ * The shim neither allocates (record lines are built in anonymous mappings)
+ * nor uses stdio, and its own I/O goes through raw system calls: it may run
+ * inside the start-up of any process, before the program's allocator or its
+ * sanitizer runtime is ready, and its own calls are never counted or
+ * recorded.
  */
 #define _GNU_SOURCE
 #undef _FORTIFY_SOURCE
@@ -77,6 +120,8 @@
 #include <sys/types.h>
 #include <sys/uio.h>
 #include <unistd.h>
+
+#include "fault_record_line.h"
 
 #define EXPORT __attribute__((visibility("default")))
 
@@ -161,6 +206,7 @@ enum Verdict { VERDICT_PROCEED, VERDICT_FAIL, VERDICT_SHORT };
 
 static struct {
     int active;
+    int counting; /* FAULT_CALL is set */
     int allMutating;
     int family;           /* -1: match by function name */
     const char* function; /* static name from kFunctions */
@@ -172,6 +218,10 @@ static struct {
     char pathSubstr[PATH_MAX];
     int hasCountFile;
     char countFile[PATH_MAX];
+    int hasRecord;
+    char record[PATH_MAX];
+    int hasClock;
+    time_t clock;
     pid_t pid;
 } config;
 
@@ -308,27 +358,52 @@ static const char* setting(const char* name) {
     return value != NULL && *value != '\0' ? value : NULL;
 }
 
+static void parseClock(const char* value) {
+    const int negative = value[0] == '-';
+    unsigned long seconds = 0;
+    if (!parseUnsigned(value + negative, &seconds) || seconds > (unsigned long)LONG_MAX) {
+        configError("FAULT_MTIME", value, "expected whole seconds");
+    }
+    config.clock = negative ? -(time_t)seconds : (time_t)seconds;
+    config.hasClock = 1;
+}
+
+static void parseRecord(const char* value) {
+    if (value[0] != '/') configError("FAULT_RECORD", value, "not an absolute path");
+    if (!copyValue(config.record, sizeof config.record, value)) configError("FAULT_RECORD", NULL, "too long");
+    const long fd = syscall(SYS_openat, AT_FDCWD, value, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0666);
+    if (fd < 0) configError("FAULT_RECORD", value, "cannot be written");
+    syscall(SYS_close, fd);
+    config.hasRecord = 1;
+}
+
 static void loadConfig(void) {
     const char* call = setting("FAULT_CALL");
     const char* nth = setting("FAULT_NTH");
     const char* action = setting("FAULT_ACTION");
     const char* pathSubstr = setting("FAULT_PATH_SUBSTR");
     const char* countFile = setting("FAULT_COUNT_FILE");
+    const char* record = setting("FAULT_RECORD");
+    const char* clock = setting("FAULT_MTIME");
 
-    if (call == NULL) {
-        if (nth != NULL || action != NULL || pathSubstr != NULL || countFile != NULL) {
-            configError("FAULT_CALL", NULL, "missing, but other FAULT_ variables are set");
-        }
-        return;
+    if (call == NULL && (nth != NULL || action != NULL || countFile != NULL ||
+                         (pathSubstr != NULL && record == NULL && clock == NULL))) {
+        configError("FAULT_CALL", NULL, "missing, but other FAULT_ variables are set");
     }
-    config.family = -1;
-    parseCall(call);
+    if (call == NULL && record == NULL && clock == NULL) return;
+    if (call != NULL) {
+        config.counting = 1;
+        config.family = -1;
+        parseCall(call);
+    }
     if (nth != NULL && (!parseUnsigned(nth, &config.nth) || config.nth == 0)) {
         configError("FAULT_NTH", nth, "expected a number from 1");
     }
     if (nth != NULL && action == NULL) configError("FAULT_ACTION", NULL, "missing, but FAULT_NTH is set");
     if (nth == NULL && action != NULL) configError("FAULT_NTH", NULL, "missing, but FAULT_ACTION is set");
     if (action != NULL) parseAction(action);
+    if (record != NULL) parseRecord(record);
+    if (clock != NULL) parseClock(clock);
     if (pathSubstr != NULL) {
         if (!copyValue(config.pathSubstr, sizeof config.pathSubstr, pathSubstr)) {
             configError("FAULT_PATH_SUBSTR", NULL, "too long");
@@ -351,6 +426,8 @@ static void loadConfig(void) {
     unsetenv("FAULT_ACTION");
     unsetenv("FAULT_PATH_SUBSTR");
     unsetenv("FAULT_COUNT_FILE");
+    unsetenv("FAULT_RECORD");
+    unsetenv("FAULT_MTIME");
 }
 
 /* True when calls are to be inspected. Loads the configuration on first
@@ -433,7 +510,8 @@ static int callMatches(const char* function, enum Family family, int mutating) {
  * VERDICT_FAIL, which sets it. */
 static enum Verdict decide(const char* function, enum Family family, int mutating, struct Target target) {
     const int saved = errno;
-    if (!enabled() || !callMatches(function, family, mutating) || (config.hasPathSubstr && !targetMatches(&target))) {
+    if (!enabled() || !config.counting || !callMatches(function, family, mutating) ||
+        (config.hasPathSubstr && !targetMatches(&target))) {
         errno = saved;
         return VERDICT_PROCEED;
     }
@@ -479,6 +557,282 @@ static size_t shortened(size_t count) {
     return count < config.shortLength ? count : config.shortLength;
 }
 
+/* ---- recording and the fake clock ---- */
+
+/* An absolute name: a directory's path, '/', a name of up to PATH_MAX. */
+#define NAME_CAPACITY (2 * PATH_MAX + 2)
+
+__attribute__((noreturn)) static void recordFailed(const char* problem) {
+    configError("FAULT_RECORD", config.record, problem);
+}
+
+/* Whether the call's effect is to be recorded or given the fake time. A
+ * NULL target passes any path filter. Keeps errno. */
+static int watching(const struct Target* target) {
+    const int saved = errno;
+    const int watched = enabled() && (config.hasRecord || config.hasClock) &&
+                        (target == NULL || !config.hasPathSubstr || targetMatches(target));
+    errno = saved;
+    return watched;
+}
+
+/* stat of the file a target names (its descriptor when it has no path),
+ * following a last symbolic link unless `noFollow`. */
+static int statTarget(const struct Target* target, int noFollow, struct stat* status) {
+    if (target->path == NULL) return syscall(SYS_fstat, target->fd, status) == 0;
+    return syscall(SYS_newfstatat, target->dirfd, target->path, status, noFollow ? AT_SYMLINK_NOFOLLOW : 0) == 0;
+}
+
+/* The target's absolute name; ends the process when there is none. */
+static void nameOf(const struct Target* target, char* out) {
+    if (target->path == NULL) {
+        if (descriptorPath(target->fd, out, NAME_CAPACITY) == 0) recordFailed("a descriptor without a path");
+        return;
+    }
+    if (target->path[0] == '/') {
+        if (!copyValue(out, NAME_CAPACITY, target->path)) recordFailed("a path too long");
+        return;
+    }
+    size_t length = 0;
+    if (target->dirfd == AT_FDCWD) {
+        const long size = syscall(SYS_getcwd, out, PATH_MAX);
+        length = size > 0 ? (size_t)size - 1 : 0;
+    } else {
+        length = descriptorPath(target->dirfd, out, PATH_MAX);
+    }
+    if (length == 0) recordFailed("no directory path to join a relative name to");
+    if (target->path[0] == '\0') return;
+    if (out[length - 1] != '/') out[length++] = '/';
+    if (!copyValue(out + length, NAME_CAPACITY - length, target->path)) recordFailed("a path too long");
+}
+
+static void appendLine(struct RecordLine* line) {
+    if (!recordLineAppend(line, config.record)) recordFailed("cannot be appended to");
+}
+
+static void beginLine(struct RecordLine* line, const char* kind, size_t pathBytes, size_t dataBytes) {
+    if (!recordLineBegin(line, kind, pathBytes, dataBytes)) recordFailed("no memory for a line");
+}
+
+/* "KIND PATH INO", with "MTIME" when `withTime`: calls that change no
+ * data. */
+static void recordNamed(const char* kind, const struct Target* target, int noFollow, int withTime) {
+    if (!config.hasRecord) return;
+    const int saved = errno;
+    char name[NAME_CAPACITY];
+    nameOf(target, name);
+    struct stat status = {0};
+    (void)statTarget(target, noFollow, &status); /* the call just succeeded on it */
+    struct RecordLine line;
+    beginLine(&line, kind, strlen(name), 0);
+    recordLinePath(&line, name);
+    recordLineUnsigned(&line, status.st_ino);
+    if (withTime) recordLineTime(&line, &status.st_mtim);
+    appendLine(&line);
+    errno = saved;
+}
+
+/* Gives a regular file the fake time and returns its stat after that; 0
+ * for anything else. */
+static int changedRegularFile(const struct Target* target, struct stat* status) {
+    if (!statTarget(target, 0, status) || !S_ISREG(status->st_mode)) return 0;
+    if (!config.hasClock) return 1;
+    const struct timespec times[2] = {{config.clock, 0}, {config.clock, 0}};
+    const long done = target->path == NULL ? syscall(SYS_utimensat, target->fd, NULL, times, 0)
+                                           : syscall(SYS_utimensat, target->dirfd, target->path, times, 0);
+    if (done != 0) configError("FAULT_MTIME", NULL, "cannot set a file's time");
+    return statTarget(target, 0, status);
+}
+
+/* An open that can create or truncate: whether to look at it after the
+ * call, and whether its name existed before. */
+static int openChanges(int flags) {
+    return (flags & (O_CREAT | O_TRUNC)) != 0 && (flags & O_TMPFILE) != O_TMPFILE;
+}
+
+static int watchOpen(const struct Target* target, int flags, int* existed) {
+    if (!openChanges(flags) || !watching(target)) return 0;
+    const int saved = errno;
+    struct stat status;
+    *existed = statTarget(target, 1, &status);
+    errno = saved;
+    return 1;
+}
+
+static void afterOpen(const struct Target* named, int fd, int flags, int existed) {
+    if (existed && (flags & O_TRUNC) == 0) return;
+    const int saved = errno;
+    const struct Target opened = FD_TARGET(fd);
+    struct stat status;
+    if (changedRegularFile(&opened, &status) && config.hasRecord) {
+        char name[NAME_CAPACITY];
+        nameOf(named, name);
+        struct RecordLine line;
+        beginLine(&line, existed ? "truncate" : "create", strlen(name), 0);
+        recordLinePath(&line, name);
+        recordLineUnsigned(&line, status.st_ino);
+        if (existed) recordLineUnsigned(&line, 0);
+        recordLineTime(&line, &status.st_mtim);
+        appendLine(&line);
+    }
+    errno = saved;
+}
+
+/* Where `done` bytes just written through `fd` went: `offset` when the
+ * call named one (-1: it wrote at the file position), the old end of file
+ * under O_APPEND. */
+static off_t writtenAt(int fd, off_t offset, size_t done, const struct stat* after) {
+    if (syscall(SYS_fcntl, fd, F_GETFL) & O_APPEND) return after->st_size - (off_t)done;
+    if (offset >= 0) return offset;
+    return (off_t)syscall(SYS_lseek, fd, 0, SEEK_CUR) - (off_t)done;
+}
+
+static void recordWrite(const char* name, const struct stat* status, off_t offset, const struct iovec* buffers,
+                        int bufferCount, size_t done, int known) {
+    struct RecordLine line;
+    beginLine(&line, "write", strlen(name), known ? done : 0);
+    recordLinePath(&line, name);
+    recordLineUnsigned(&line, status->st_ino);
+    recordLineSigned(&line, offset);
+    if (known) {
+        recordLineHex(&line, buffers, bufferCount, done);
+    } else {
+        recordLineUnknown(&line);
+    }
+    recordLineTime(&line, &status->st_mtim);
+    appendLine(&line);
+}
+
+static void afterWrite(int fd, off_t offset, const struct iovec* buffers, int bufferCount, ssize_t done) {
+    const int saved = errno;
+    const struct Target written = FD_TARGET(fd);
+    struct stat status;
+    if (changedRegularFile(&written, &status) && config.hasRecord) {
+        char name[NAME_CAPACITY];
+        nameOf(&written, name);
+        recordWrite(name, &status, writtenAt(fd, offset, (size_t)done, &status), buffers, bufferCount, (size_t)done,
+                    1);
+    }
+    errno = saved;
+}
+
+static int readAll(int fd, unsigned char* buffer, size_t count, off_t offset) {
+    while (count > 0) {
+        const long got = syscall(SYS_pread64, fd, buffer, count, offset);
+        if (got < 0 && errno == EINTR) continue;
+        if (got <= 0) return 0;
+        buffer += got;
+        count -= (size_t)got;
+        offset += got;
+    }
+    return 1;
+}
+
+/* sendfile and copy_file_range: the copied bytes are read back, from the
+ * destination when it is open for reading, else from the source. Offsets
+ * are those before the call, -1 for the file position. */
+static void afterCopy(int outFd, off_t outOffset, int inFd, off_t inOffset, ssize_t done) {
+    const int saved = errno;
+    const struct Target written = FD_TARGET(outFd);
+    struct stat status;
+    if (changedRegularFile(&written, &status) && config.hasRecord) {
+        const size_t count = (size_t)done;
+        if (inOffset < 0) inOffset = (off_t)syscall(SYS_lseek, inFd, 0, SEEK_CUR) - (off_t)count;
+        outOffset = writtenAt(outFd, outOffset, count, &status);
+        unsigned char* bytes = recordMap(count);
+        if (bytes == NULL) recordFailed("no memory for copied bytes");
+        const int known = readAll(outFd, bytes, count, outOffset) || readAll(inFd, bytes, count, inOffset);
+        const struct iovec buffer = {bytes, count};
+        char name[NAME_CAPACITY];
+        nameOf(&written, name);
+        recordWrite(name, &status, outOffset, &buffer, 1, count, known);
+        recordUnmap(bytes, count);
+    }
+    errno = saved;
+}
+
+static void afterTruncate(const struct Target* target, off_t length) {
+    const int saved = errno;
+    struct stat status;
+    if (changedRegularFile(target, &status) && config.hasRecord) {
+        char name[NAME_CAPACITY];
+        nameOf(target, name);
+        struct RecordLine line;
+        beginLine(&line, "truncate", strlen(name), 0);
+        recordLinePath(&line, name);
+        recordLineUnsigned(&line, status.st_ino);
+        recordLineSigned(&line, length);
+        recordLineTime(&line, &status.st_mtim);
+        appendLine(&line);
+    }
+    errno = saved;
+}
+
+/* What a name held before a call removes or replaces it; st_ino 0 when
+ * nothing. */
+static struct stat entryBefore(const struct Target* target) {
+    const int saved = errno;
+    struct stat status = {0};
+    if (!statTarget(target, 1, &status)) status.st_ino = 0;
+    errno = saved;
+    return status;
+}
+
+/* unlink and rmdir fail on the other kind, so the kind of what was there
+ * tells which one succeeded. */
+static void afterRemoval(const struct Target* target, const struct stat* before) {
+    if (!config.hasRecord) return;
+    const int saved = errno;
+    const int directory = before->st_ino != 0 && S_ISDIR(before->st_mode);
+    char name[NAME_CAPACITY];
+    nameOf(target, name);
+    struct RecordLine line;
+    beginLine(&line, directory ? "rmdir" : "unlink", strlen(name), 0);
+    recordLinePath(&line, name);
+    if (!directory) recordLineUnsigned(&line, before->st_ino);
+    appendLine(&line);
+    errno = saved;
+}
+
+static void afterRename(const struct Target* target, ino_t moved, ino_t replaced) {
+    if (!config.hasRecord) return;
+    const int saved = errno;
+    const struct Target to = AT_TARGET(target->dirfd2, target->path2);
+    char from[NAME_CAPACITY];
+    char toName[NAME_CAPACITY];
+    nameOf(target, from);
+    nameOf(&to, toName);
+    struct RecordLine line;
+    beginLine(&line, "rename", strlen(from) + strlen(toName), 0);
+    recordLinePath(&line, from);
+    recordLinePath(&line, toName);
+    recordLineUnsigned(&line, moved);
+    recordLineUnsigned(&line, replaced);
+    appendLine(&line);
+    errno = saved;
+}
+
+static void afterMkdir(const struct Target* target) {
+    if (!config.hasRecord) return;
+    const int saved = errno;
+    char name[NAME_CAPACITY];
+    nameOf(target, name);
+    struct RecordLine line;
+    beginLine(&line, "mkdir", strlen(name), 0);
+    recordLinePath(&line, name);
+    appendLine(&line);
+    errno = saved;
+}
+
+static void afterSyncfs(void) {
+    if (!config.hasRecord) return;
+    struct RecordLine line;
+    const int saved = errno;
+    beginLine(&line, "syncfs", 0, 0);
+    appendLine(&line);
+    errno = saved;
+}
+
 /* ---- open ---- */
 
 typedef int (*OpenFn)(const char*, int, ...);
@@ -490,14 +844,24 @@ typedef FILE* (*FopenFn)(const char*, const char*);
 
 static int forwardOpen(void** slot, const char* symbol, const char* path, int flags, mode_t mode) {
     const OpenFn real = (OpenFn)next(slot, symbol);
-    if (decide("open", FAMILY_OPEN, openMutates(flags), PATH_TARGET(path)) == VERDICT_FAIL) return -1;
-    return real(path, flags, mode);
+    const struct Target target = PATH_TARGET(path);
+    if (decide("open", FAMILY_OPEN, openMutates(flags), target) == VERDICT_FAIL) return -1;
+    int existed = 0;
+    const int watched = watchOpen(&target, flags, &existed);
+    const int fd = real(path, flags, mode);
+    if (fd >= 0 && watched) afterOpen(&target, fd, flags, existed);
+    return fd;
 }
 
 static int forwardOpenat(void** slot, const char* symbol, int dirfd, const char* path, int flags, mode_t mode) {
     const OpenatFn real = (OpenatFn)next(slot, symbol);
-    if (decide("openat", FAMILY_OPEN, openMutates(flags), AT_TARGET(dirfd, path)) == VERDICT_FAIL) return -1;
-    return real(dirfd, path, flags, mode);
+    const struct Target target = AT_TARGET(dirfd, path);
+    if (decide("openat", FAMILY_OPEN, openMutates(flags), target) == VERDICT_FAIL) return -1;
+    int existed = 0;
+    const int watched = watchOpen(&target, flags, &existed);
+    const int fd = real(dirfd, path, flags, mode);
+    if (fd >= 0 && watched) afterOpen(&target, fd, flags, existed);
+    return fd;
 }
 
 EXPORT int open(const char* path, int flags, ...) {
@@ -544,14 +908,24 @@ int __openat64_2(int dirfd, const char* path, int flags);
 
 static int forwardOpen2(void** slot, const char* symbol, const char* path, int flags) {
     const Open2Fn real = (Open2Fn)next(slot, symbol);
-    if (decide("open", FAMILY_OPEN, openMutates(flags), PATH_TARGET(path)) == VERDICT_FAIL) return -1;
-    return real(path, flags);
+    const struct Target target = PATH_TARGET(path);
+    if (decide("open", FAMILY_OPEN, openMutates(flags), target) == VERDICT_FAIL) return -1;
+    int existed = 0;
+    const int watched = watchOpen(&target, flags, &existed);
+    const int fd = real(path, flags);
+    if (fd >= 0 && watched) afterOpen(&target, fd, flags, existed);
+    return fd;
 }
 
 static int forwardOpenat2(void** slot, const char* symbol, int dirfd, const char* path, int flags) {
     const Openat2Fn real = (Openat2Fn)next(slot, symbol);
-    if (decide("openat", FAMILY_OPEN, openMutates(flags), AT_TARGET(dirfd, path)) == VERDICT_FAIL) return -1;
-    return real(dirfd, path, flags);
+    const struct Target target = AT_TARGET(dirfd, path);
+    if (decide("openat", FAMILY_OPEN, openMutates(flags), target) == VERDICT_FAIL) return -1;
+    int existed = 0;
+    const int watched = watchOpen(&target, flags, &existed);
+    const int fd = real(dirfd, path, flags);
+    if (fd >= 0 && watched) afterOpen(&target, fd, flags, existed);
+    return fd;
 }
 
 EXPORT int __open_2(const char* path, int flags) {
@@ -576,8 +950,14 @@ EXPORT int __openat64_2(int dirfd, const char* path, int flags) {
 
 static int forwardCreat(void** slot, const char* symbol, const char* path, mode_t mode) {
     const CreatFn real = (CreatFn)next(slot, symbol);
-    if (decide("creat", FAMILY_OPEN, 1, PATH_TARGET(path)) == VERDICT_FAIL) return -1;
-    return real(path, mode);
+    const struct Target target = PATH_TARGET(path);
+    if (decide("creat", FAMILY_OPEN, 1, target) == VERDICT_FAIL) return -1;
+    const int flags = O_WRONLY | O_CREAT | O_TRUNC;
+    int existed = 0;
+    const int watched = watchOpen(&target, flags, &existed);
+    const int fd = real(path, mode);
+    if (fd >= 0 && watched) afterOpen(&target, fd, flags, existed);
+    return fd;
 }
 
 EXPORT int creat(const char* path, mode_t mode) {
@@ -593,8 +973,14 @@ EXPORT int creat64(const char* path, mode_t mode) {
 /* glibc's stdio opens through internal calls the shim cannot see. */
 static FILE* forwardFopen(void** slot, const char* symbol, const char* path, const char* mode) {
     const FopenFn real = (FopenFn)next(slot, symbol);
-    if (decide("fopen", FAMILY_OPEN, strpbrk(mode, "wa+") != NULL, PATH_TARGET(path)) == VERDICT_FAIL) return NULL;
-    return real(path, mode);
+    const struct Target target = PATH_TARGET(path);
+    if (decide("fopen", FAMILY_OPEN, strpbrk(mode, "wa+") != NULL, target) == VERDICT_FAIL) return NULL;
+    const int flags = mode[0] == 'w' ? O_CREAT | O_TRUNC : mode[0] == 'a' ? O_CREAT : 0;
+    int existed = 0;
+    const int watched = watchOpen(&target, flags, &existed);
+    FILE* stream = real(path, mode);
+    if (stream != NULL && watched) afterOpen(&target, fileno(stream), flags, existed);
+    return stream;
 }
 
 EXPORT FILE* fopen(const char* path, const char* mode) {
@@ -612,96 +998,113 @@ EXPORT FILE* fopen64(const char* path, const char* mode) {
 typedef ssize_t (*WriteFn)(int, const void*, size_t);
 typedef ssize_t (*WritevFn)(int, const struct iovec*, int);
 typedef ssize_t (*PwriteFn)(int, const void*, size_t, off_t);
-typedef ssize_t (*Pwrite64Fn)(int, const void*, size_t, off64_t);
 typedef ssize_t (*PwritevFn)(int, const struct iovec*, int, off_t);
-typedef ssize_t (*Pwritev64Fn)(int, const struct iovec*, int, off64_t);
 typedef ssize_t (*SendfileFn)(int, int, off_t*, size_t);
-typedef ssize_t (*Sendfile64Fn)(int, int, off64_t*, size_t);
 typedef ssize_t (*CopyFileRangeFn)(int, loff_t*, int, loff_t*, size_t, unsigned int);
 
-EXPORT ssize_t write(int fd, const void* data, size_t count) {
-    static void* slot;
-    const WriteFn real = (WriteFn)next(&slot, "write");
-    switch (decide("write", FAMILY_WRITE, 1, FD_TARGET(fd))) {
+/* The 64-bit variants share the plain functions' forwarding. */
+_Static_assert(sizeof(off_t) == sizeof(off64_t), "off_t must be 64 bits");
+
+/* write, and pwrite when `positioned`. */
+static ssize_t forwardWrite(void** slot, const char* symbol, int positioned, int fd, const void* data, size_t count,
+                            off_t offset) {
+    void* const real = next(slot, symbol);
+    const struct Target target = FD_TARGET(fd);
+    const enum Family family = positioned ? FAMILY_PWRITE : FAMILY_WRITE;
+    switch (decide(positioned ? "pwrite" : "write", family, 1, target)) {
         case VERDICT_FAIL:
             return -1;
         case VERDICT_SHORT:
-            return real(fd, data, shortened(count));
+            count = shortened(count);
+            break;
         case VERDICT_PROCEED:
             break;
     }
-    return real(fd, data, count);
+    const int watched = watching(&target);
+    const ssize_t done = positioned ? ((PwriteFn)real)(fd, data, count, offset) : ((WriteFn)real)(fd, data, count);
+    const struct iovec buffer = {(void*)data, count};
+    if (done >= 0 && watched) afterWrite(fd, positioned ? offset : -1, &buffer, 1, done);
+    return done;
 }
 
-EXPORT ssize_t writev(int fd, const struct iovec* vector, int count) {
+EXPORT ssize_t write(int fd, const void* data, size_t count) {
     static void* slot;
-    const WritevFn real = (WritevFn)next(&slot, "writev");
-    if (decide("writev", FAMILY_WRITE, 1, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
-    return real(fd, vector, count);
+    return forwardWrite(&slot, "write", 0, fd, data, count, 0);
 }
 
 EXPORT ssize_t pwrite(int fd, const void* data, size_t count, off_t offset) {
     static void* slot;
-    const PwriteFn real = (PwriteFn)next(&slot, "pwrite");
-    switch (decide("pwrite", FAMILY_PWRITE, 1, FD_TARGET(fd))) {
-        case VERDICT_FAIL:
-            return -1;
-        case VERDICT_SHORT:
-            return real(fd, data, shortened(count), offset);
-        case VERDICT_PROCEED:
-            break;
-    }
-    return real(fd, data, count, offset);
+    return forwardWrite(&slot, "pwrite", 1, fd, data, count, offset);
 }
 
 EXPORT ssize_t pwrite64(int fd, const void* data, size_t count, off64_t offset) {
     static void* slot;
-    const Pwrite64Fn real = (Pwrite64Fn)next(&slot, "pwrite64");
-    switch (decide("pwrite", FAMILY_PWRITE, 1, FD_TARGET(fd))) {
-        case VERDICT_FAIL:
-            return -1;
-        case VERDICT_SHORT:
-            return real(fd, data, shortened(count), offset);
-        case VERDICT_PROCEED:
-            break;
-    }
-    return real(fd, data, count, offset);
+    return forwardWrite(&slot, "pwrite64", 1, fd, data, count, offset);
+}
+
+/* writev, and pwritev when `positioned`. */
+static ssize_t forwardWritev(void** slot, const char* symbol, int positioned, int fd, const struct iovec* vector,
+                             int count, off_t offset) {
+    void* const real = next(slot, symbol);
+    const struct Target target = FD_TARGET(fd);
+    const enum Family family = positioned ? FAMILY_PWRITE : FAMILY_WRITE;
+    if (decide(positioned ? "pwritev" : "writev", family, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const ssize_t done =
+        positioned ? ((PwritevFn)real)(fd, vector, count, offset) : ((WritevFn)real)(fd, vector, count);
+    if (done >= 0 && watched) afterWrite(fd, positioned ? offset : -1, vector, count, done);
+    return done;
+}
+
+EXPORT ssize_t writev(int fd, const struct iovec* vector, int count) {
+    static void* slot;
+    return forwardWritev(&slot, "writev", 0, fd, vector, count, 0);
 }
 
 EXPORT ssize_t pwritev(int fd, const struct iovec* vector, int count, off_t offset) {
     static void* slot;
-    const PwritevFn real = (PwritevFn)next(&slot, "pwritev");
-    if (decide("pwritev", FAMILY_PWRITE, 1, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
-    return real(fd, vector, count, offset);
+    return forwardWritev(&slot, "pwritev", 1, fd, vector, count, offset);
 }
 
 EXPORT ssize_t pwritev64(int fd, const struct iovec* vector, int count, off64_t offset) {
     static void* slot;
-    const Pwritev64Fn real = (Pwritev64Fn)next(&slot, "pwritev64");
-    if (decide("pwritev", FAMILY_PWRITE, 1, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
-    return real(fd, vector, count, offset);
+    return forwardWritev(&slot, "pwritev64", 1, fd, vector, count, offset);
+}
+
+/* sendfile and sendfile64 take the same arguments where off_t is 64 bits. */
+static ssize_t forwardSendfile(void** slot, const char* symbol, int outFd, int inFd, off_t* offset, size_t count) {
+    const SendfileFn real = (SendfileFn)next(slot, symbol);
+    const struct Target target = FD_TARGET(outFd);
+    if (decide("sendfile", FAMILY_COPY, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const off_t inOffset = offset != NULL ? *offset : -1;
+    const ssize_t done = real(outFd, inFd, offset, count);
+    if (done >= 0 && watched) afterCopy(outFd, -1, inFd, inOffset, done);
+    return done;
 }
 
 EXPORT ssize_t sendfile(int outFd, int inFd, off_t* offset, size_t count) {
     static void* slot;
-    const SendfileFn real = (SendfileFn)next(&slot, "sendfile");
-    if (decide("sendfile", FAMILY_COPY, 1, FD_TARGET(outFd)) == VERDICT_FAIL) return -1;
-    return real(outFd, inFd, offset, count);
+    return forwardSendfile(&slot, "sendfile", outFd, inFd, offset, count);
 }
 
 EXPORT ssize_t sendfile64(int outFd, int inFd, off64_t* offset, size_t count) {
     static void* slot;
-    const Sendfile64Fn real = (Sendfile64Fn)next(&slot, "sendfile64");
-    if (decide("sendfile", FAMILY_COPY, 1, FD_TARGET(outFd)) == VERDICT_FAIL) return -1;
-    return real(outFd, inFd, offset, count);
+    return forwardSendfile(&slot, "sendfile64", outFd, inFd, offset, count);
 }
 
 EXPORT ssize_t copy_file_range(int inFd, loff_t* inOffset, int outFd, loff_t* outOffset, size_t count,
                                unsigned int flags) {
     static void* slot;
     const CopyFileRangeFn real = (CopyFileRangeFn)next(&slot, "copy_file_range");
-    if (decide("copy_file_range", FAMILY_COPY, 1, FD_TARGET(outFd)) == VERDICT_FAIL) return -1;
-    return real(inFd, inOffset, outFd, outOffset, count, flags);
+    const struct Target target = FD_TARGET(outFd);
+    if (decide("copy_file_range", FAMILY_COPY, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const off_t inStart = inOffset != NULL ? *inOffset : -1;
+    const off_t outStart = outOffset != NULL ? *outOffset : -1;
+    const ssize_t done = real(inFd, inOffset, outFd, outOffset, count, flags);
+    if (done >= 0 && watched) afterCopy(outFd, outStart, inFd, inStart, done);
+    return done;
 }
 
 /* ---- rename and removal ---- */
@@ -712,12 +1115,25 @@ typedef int (*Renameat2Fn)(int, const char*, int, const char*, unsigned int);
 typedef int (*PathFn)(const char*);
 typedef int (*UnlinkatFn)(int, const char*, int);
 
+/* Whether the rename is watched; then what both names held before it. */
+static int watchRename(const struct Target* target, struct stat* from, struct stat* to) {
+    if (!watching(target)) return 0;
+    const struct Target toTarget = AT_TARGET(target->dirfd2, target->path2);
+    *from = entryBefore(target);
+    *to = entryBefore(&toTarget);
+    return 1;
+}
+
 EXPORT int rename(const char* from, const char* to) {
     static void* slot;
     const RenameFn real = (RenameFn)next(&slot, "rename");
     const struct Target target = {AT_FDCWD, from, AT_FDCWD, to, -1};
     if (decide("rename", FAMILY_RENAME, 1, target) == VERDICT_FAIL) return -1;
-    return real(from, to);
+    struct stat moved, replaced;
+    const int watched = watchRename(&target, &moved, &replaced);
+    const int result = real(from, to);
+    if (result == 0 && watched) afterRename(&target, moved.st_ino, replaced.st_ino);
+    return result;
 }
 
 EXPORT int renameat(int fromDir, const char* from, int toDir, const char* to) {
@@ -725,7 +1141,11 @@ EXPORT int renameat(int fromDir, const char* from, int toDir, const char* to) {
     const RenameatFn real = (RenameatFn)next(&slot, "renameat");
     const struct Target target = {fromDir, from, toDir, to, -1};
     if (decide("renameat", FAMILY_RENAME, 1, target) == VERDICT_FAIL) return -1;
-    return real(fromDir, from, toDir, to);
+    struct stat moved, replaced;
+    const int watched = watchRename(&target, &moved, &replaced);
+    const int result = real(fromDir, from, toDir, to);
+    if (result == 0 && watched) afterRename(&target, moved.st_ino, replaced.st_ino);
+    return result;
 }
 
 EXPORT int renameat2(int fromDir, const char* from, int toDir, const char* to, unsigned int flags) {
@@ -733,44 +1153,57 @@ EXPORT int renameat2(int fromDir, const char* from, int toDir, const char* to, u
     const Renameat2Fn real = (Renameat2Fn)next(&slot, "renameat2");
     const struct Target target = {fromDir, from, toDir, to, -1};
     if (decide("renameat2", FAMILY_RENAME, 1, target) == VERDICT_FAIL) return -1;
-    return real(fromDir, from, toDir, to, flags);
+    struct stat moved, replaced;
+    const int watched = watchRename(&target, &moved, &replaced);
+    const int result = real(fromDir, from, toDir, to, flags);
+    if (result == 0 && watched) afterRename(&target, moved.st_ino, replaced.st_ino);
+    return result;
 }
 
-static int forwardPathCall(void** slot, const char* symbol, enum Family family, const char* path) {
+/* unlink, remove and rmdir. */
+static int forwardRemoval(void** slot, const char* symbol, const char* path) {
     const PathFn real = (PathFn)next(slot, symbol);
-    if (decide(symbol, family, 1, PATH_TARGET(path)) == VERDICT_FAIL) return -1;
-    return real(path);
+    const struct Target target = PATH_TARGET(path);
+    if (decide(symbol, FAMILY_UNLINK, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const struct stat before = watched ? entryBefore(&target) : (struct stat){0};
+    const int result = real(path);
+    if (result == 0 && watched) afterRemoval(&target, &before);
+    return result;
 }
 
 EXPORT int unlink(const char* path) {
     static void* slot;
-    return forwardPathCall(&slot, "unlink", FAMILY_UNLINK, path);
+    return forwardRemoval(&slot, "unlink", path);
 }
 
 /* remove() reaches unlink or rmdir inside glibc, so it is counted once. */
 EXPORT int remove(const char* path) {
     static void* slot;
-    return forwardPathCall(&slot, "remove", FAMILY_UNLINK, path);
+    return forwardRemoval(&slot, "remove", path);
 }
 
 EXPORT int rmdir(const char* path) {
     static void* slot;
-    return forwardPathCall(&slot, "rmdir", FAMILY_UNLINK, path);
+    return forwardRemoval(&slot, "rmdir", path);
 }
 
 EXPORT int unlinkat(int dirfd, const char* path, int flags) {
     static void* slot;
     const UnlinkatFn real = (UnlinkatFn)next(&slot, "unlinkat");
-    if (decide("unlinkat", FAMILY_UNLINK, 1, AT_TARGET(dirfd, path)) == VERDICT_FAIL) return -1;
-    return real(dirfd, path, flags);
+    const struct Target target = AT_TARGET(dirfd, path);
+    if (decide("unlinkat", FAMILY_UNLINK, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const struct stat before = watched ? entryBefore(&target) : (struct stat){0};
+    const int result = real(dirfd, path, flags);
+    if (result == 0 && watched) afterRemoval(&target, &before);
+    return result;
 }
 
 /* ---- size, times, syncing, directories, modes ---- */
 
 typedef int (*FtruncateFn)(int, off_t);
-typedef int (*Ftruncate64Fn)(int, off64_t);
 typedef int (*TruncateFn)(const char*, off_t);
-typedef int (*Truncate64Fn)(const char*, off64_t);
 typedef int (*UtimensatFn)(int, const char*, const struct timespec*, int);
 typedef int (*FutimensFn)(int, const struct timespec*);
 typedef int (*FdFn)(int);
@@ -779,100 +1212,150 @@ typedef int (*FdModeFn)(int, mode_t);
 typedef int (*AtModeFn)(int, const char*, mode_t);
 typedef int (*FchmodatFn)(int, const char*, mode_t, int);
 
+static int forwardFtruncate(void** slot, const char* symbol, int fd, off_t length) {
+    const FtruncateFn real = (FtruncateFn)next(slot, symbol);
+    const struct Target target = FD_TARGET(fd);
+    if (decide("ftruncate", FAMILY_TRUNCATE, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const int result = real(fd, length);
+    if (result == 0 && watched) afterTruncate(&target, length);
+    return result;
+}
+
 EXPORT int ftruncate(int fd, off_t length) {
     static void* slot;
-    const FtruncateFn real = (FtruncateFn)next(&slot, "ftruncate");
-    if (decide("ftruncate", FAMILY_TRUNCATE, 1, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
-    return real(fd, length);
+    return forwardFtruncate(&slot, "ftruncate", fd, length);
 }
 
 EXPORT int ftruncate64(int fd, off64_t length) {
     static void* slot;
-    const Ftruncate64Fn real = (Ftruncate64Fn)next(&slot, "ftruncate64");
-    if (decide("ftruncate", FAMILY_TRUNCATE, 1, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
-    return real(fd, length);
+    return forwardFtruncate(&slot, "ftruncate64", fd, length);
+}
+
+static int forwardTruncate(void** slot, const char* symbol, const char* path, off_t length) {
+    const TruncateFn real = (TruncateFn)next(slot, symbol);
+    const struct Target target = PATH_TARGET(path);
+    if (decide("truncate", FAMILY_TRUNCATE, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const int result = real(path, length);
+    if (result == 0 && watched) afterTruncate(&target, length);
+    return result;
 }
 
 EXPORT int truncate(const char* path, off_t length) {
     static void* slot;
-    const TruncateFn real = (TruncateFn)next(&slot, "truncate");
-    if (decide("truncate", FAMILY_TRUNCATE, 1, PATH_TARGET(path)) == VERDICT_FAIL) return -1;
-    return real(path, length);
+    return forwardTruncate(&slot, "truncate", path, length);
 }
 
 EXPORT int truncate64(const char* path, off64_t length) {
     static void* slot;
-    const Truncate64Fn real = (Truncate64Fn)next(&slot, "truncate64");
-    if (decide("truncate", FAMILY_TRUNCATE, 1, PATH_TARGET(path)) == VERDICT_FAIL) return -1;
-    return real(path, length);
+    return forwardTruncate(&slot, "truncate64", path, length);
 }
 
 EXPORT int utimensat(int dirfd, const char* path, const struct timespec times[2], int flags) {
     static void* slot;
     const UtimensatFn real = (UtimensatFn)next(&slot, "utimensat");
-    if (decide("utimensat", FAMILY_UTIMENS, 1, AT_TARGET(dirfd, path)) == VERDICT_FAIL) return -1;
-    return real(dirfd, path, times, flags);
+    const struct Target target = AT_TARGET(dirfd, path);
+    if (decide("utimensat", FAMILY_UTIMENS, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const int result = real(dirfd, path, times, flags);
+    if (result == 0 && watched) recordNamed("utimens", &target, flags & AT_SYMLINK_NOFOLLOW, 1);
+    return result;
 }
 
 EXPORT int futimens(int fd, const struct timespec times[2]) {
     static void* slot;
     const FutimensFn real = (FutimensFn)next(&slot, "futimens");
-    if (decide("futimens", FAMILY_UTIMENS, 1, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
-    return real(fd, times);
-}
-
-static int forwardFdCall(void** slot, const char* symbol, enum Family family, int fd) {
-    const FdFn real = (FdFn)next(slot, symbol);
-    if (decide(symbol, family, 1, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
-    return real(fd);
+    const struct Target target = FD_TARGET(fd);
+    if (decide("futimens", FAMILY_UTIMENS, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const int result = real(fd, times);
+    if (result == 0 && watched) recordNamed("utimens", &target, 0, 1);
+    return result;
 }
 
 EXPORT int syncfs(int fd) {
     static void* slot;
-    return forwardFdCall(&slot, "syncfs", FAMILY_SYNC, fd);
+    const FdFn real = (FdFn)next(&slot, "syncfs");
+    if (decide("syncfs", FAMILY_SYNC, 1, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
+    const int watched = watching(NULL);
+    const int result = real(fd);
+    if (result == 0 && watched) afterSyncfs();
+    return result;
+}
+
+/* fsync and fdatasync. */
+static int forwardFsync(void** slot, const char* symbol, int fd) {
+    const FdFn real = (FdFn)next(slot, symbol);
+    const struct Target target = FD_TARGET(fd);
+    if (decide(symbol, FAMILY_SYNC, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const int result = real(fd);
+    if (result == 0 && watched) recordNamed("fsync", &target, 0, 0);
+    return result;
 }
 
 EXPORT int fsync(int fd) {
     static void* slot;
-    return forwardFdCall(&slot, "fsync", FAMILY_SYNC, fd);
+    return forwardFsync(&slot, "fsync", fd);
 }
 
 EXPORT int fdatasync(int fd) {
     static void* slot;
-    return forwardFdCall(&slot, "fdatasync", FAMILY_SYNC, fd);
+    return forwardFsync(&slot, "fdatasync", fd);
 }
 
 EXPORT int mkdir(const char* path, mode_t mode) {
     static void* slot;
     const PathModeFn real = (PathModeFn)next(&slot, "mkdir");
-    if (decide("mkdir", FAMILY_MKDIR, 1, PATH_TARGET(path)) == VERDICT_FAIL) return -1;
-    return real(path, mode);
+    const struct Target target = PATH_TARGET(path);
+    if (decide("mkdir", FAMILY_MKDIR, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const int result = real(path, mode);
+    if (result == 0 && watched) afterMkdir(&target);
+    return result;
 }
 
 EXPORT int mkdirat(int dirfd, const char* path, mode_t mode) {
     static void* slot;
     const AtModeFn real = (AtModeFn)next(&slot, "mkdirat");
-    if (decide("mkdirat", FAMILY_MKDIR, 1, AT_TARGET(dirfd, path)) == VERDICT_FAIL) return -1;
-    return real(dirfd, path, mode);
+    const struct Target target = AT_TARGET(dirfd, path);
+    if (decide("mkdirat", FAMILY_MKDIR, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const int result = real(dirfd, path, mode);
+    if (result == 0 && watched) afterMkdir(&target);
+    return result;
 }
 
 EXPORT int chmod(const char* path, mode_t mode) {
     static void* slot;
     const PathModeFn real = (PathModeFn)next(&slot, "chmod");
-    if (decide("chmod", FAMILY_CHMOD, 1, PATH_TARGET(path)) == VERDICT_FAIL) return -1;
-    return real(path, mode);
+    const struct Target target = PATH_TARGET(path);
+    if (decide("chmod", FAMILY_CHMOD, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const int result = real(path, mode);
+    if (result == 0 && watched) recordNamed("chmod", &target, 0, 0);
+    return result;
 }
 
 EXPORT int fchmod(int fd, mode_t mode) {
     static void* slot;
     const FdModeFn real = (FdModeFn)next(&slot, "fchmod");
-    if (decide("fchmod", FAMILY_CHMOD, 1, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
-    return real(fd, mode);
+    const struct Target target = FD_TARGET(fd);
+    if (decide("fchmod", FAMILY_CHMOD, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const int result = real(fd, mode);
+    if (result == 0 && watched) recordNamed("chmod", &target, 0, 0);
+    return result;
 }
 
 EXPORT int fchmodat(int dirfd, const char* path, mode_t mode, int flags) {
     static void* slot;
     const FchmodatFn real = (FchmodatFn)next(&slot, "fchmodat");
-    if (decide("fchmodat", FAMILY_CHMOD, 1, AT_TARGET(dirfd, path)) == VERDICT_FAIL) return -1;
-    return real(dirfd, path, mode, flags);
+    const struct Target target = AT_TARGET(dirfd, path);
+    if (decide("fchmodat", FAMILY_CHMOD, 1, target) == VERDICT_FAIL) return -1;
+    const int watched = watching(&target);
+    const int result = real(dirfd, path, mode, flags);
+    if (result == 0 && watched) recordNamed("chmod", &target, flags & AT_SYMLINK_NOFOLLOW, 0);
+    return result;
 }

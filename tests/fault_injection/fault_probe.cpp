@@ -9,6 +9,7 @@
 //                            expects DIR/source to exist
 //   fault_probe spawn DIR    runs "script DIR/child" as a new program, then
 //                            makes DIR/parent-made itself
+//   fault_probe record DIR   every call the shim records (fault_probe.h)
 #include <cerrno>
 #include <chrono>
 #include <cstdio>
@@ -24,13 +25,12 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include "fault_probe.h"
+
 extern char** environ;
 
-namespace {
+namespace fault_probe {
 
-namespace fs = std::filesystem;
-
-// `call` returns a negative value on failure, with errno set.
 void step(const char* name, const std::function<long()>& call) {
     errno = 0;
     const long result = call();
@@ -42,6 +42,16 @@ void step(const char* name, const std::function<long()>& call) {
     }
 }
 
+long succeeded(bool ok) { return ok ? 0 : -1; }
+
+}  // namespace fault_probe
+
+namespace {
+
+namespace fs = std::filesystem;
+using fault_probe::step;
+using fault_probe::succeeded;
+
 void libraryStep(const char* name, const std::function<void(std::error_code&)>& call) {
     std::error_code error;
     call(error);
@@ -51,8 +61,6 @@ void libraryStep(const char* name, const std::function<void(std::error_code&)>& 
         std::printf("%s 0\n", name);
     }
 }
-
-long succeeded(bool ok) { return ok ? 0 : -1; }
 
 int runScript(const std::string& dir) {
     const std::string made = dir + "/made";
@@ -146,13 +154,14 @@ int runSpawn(const char* self, const std::string& dir) {
 int main(int argc, char** argv) {
     std::setvbuf(stdout, nullptr, _IONBF, 0);
     if (argc != 3) {
-        std::fprintf(stderr, "usage: fault_probe script|library|spawn DIR\n");
+        std::fprintf(stderr, "usage: fault_probe script|library|spawn|record DIR\n");
         return 2;
     }
     const std::string mode = argv[1];
     if (mode == "script") return runScript(argv[2]);
     if (mode == "library") return runLibrary(argv[2]);
     if (mode == "spawn") return runSpawn(argv[0], argv[2]);
+    if (mode == "record") return fault_probe::runRecord(argv[2]);
     std::fprintf(stderr, "unknown mode %s\n", argv[1]);
     return 2;
 }

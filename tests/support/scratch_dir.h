@@ -9,7 +9,10 @@ namespace testing_support {
 
 class ScratchDir {
 public:
+    // A new directory below `parent`, by default the system's temporary
+    // directory.
     ScratchDir();
+    explicit ScratchDir(const std::filesystem::path& parent);
     ~ScratchDir();
     ScratchDir(const ScratchDir&) = delete;
     ScratchDir& operator=(const ScratchDir&) = delete;

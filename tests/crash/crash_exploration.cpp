@@ -1,0 +1,399 @@
+#include "crash_exploration.h"
+
+#include <algorithm>
+#include <cstdio>
+#include <sstream>
+#include <stdexcept>
+
+#include <unistd.h>
+
+#include "child_process.h"
+#include "fault_injection.h"
+#include "files.h"
+#include "lib/storage/dual_file_target.h"
+
+namespace crash {
+
+namespace {
+
+namespace fs = std::filesystem;
+using store_test::SlotContent;
+using testing_support::ProcessResult;
+
+constexpr int64_t kClockStart = 1700000000;
+constexpr size_t kReportedViolations = 20;
+// Multi-slot scenarios update this slot; the others hold a blob and an
+// erased blob that must survive every crash untouched.
+constexpr size_t kUpdatedSlot = 1;
+// A writeAt outside a begun write that crosses a block boundary.
+constexpr int64_t kPatchOffset = 4000;
+constexpr size_t kPatchSize = 300;
+
+int64_t clockOf(Clock clock, size_t run) {
+    const int64_t step = static_cast<int64_t>(run);
+    switch (clock) {
+        case Clock::kForward:
+            return kClockStart + 10 * step;
+        case Clock::kEqual:
+            return kClockStart;
+        case Clock::kBackward:
+            return kClockStart - 100 * step;
+    }
+    return kClockStart;
+}
+
+const char* clockName(Clock clock) {
+    switch (clock) {
+        case Clock::kForward:
+            return "forward";
+        case Clock::kEqual:
+            return "equal";
+        case Clock::kBackward:
+            return "backward";
+    }
+    return "?";
+}
+
+// A blob of a little over one block, different for every run.
+Bytes blobFor(size_t run, size_t salt) {
+    return store_test::patternBytes(kBlockSize + 1000 + 211 * run, static_cast<uint32_t>(run * 7919 + salt));
+}
+
+uint8_t hexDigit(char c) {
+    if (c >= '0' && c <= '9') return static_cast<uint8_t>(c - '0');
+    if (c >= 'a' && c <= 'f') return static_cast<uint8_t>(c - 'a' + 10);
+    throw std::runtime_error(std::string("not a hex digit: ") + c);
+}
+
+// The "state:" line that the driver and the broken writer end with.
+SlotContent reportedState(const std::string& out) {
+    const size_t line = out.rfind("state: ");
+    if (line == std::string::npos) throw std::runtime_error("no state line in:\n" + out);
+    int exists = 0;
+    int valid = 0;
+    unsigned status = 0;
+    if (std::sscanf(out.c_str() + line, "state: exists=%d valid=%d read=%u", &exists, &valid, &status) != 3) {
+        throw std::runtime_error("bad state line in:\n" + out);
+    }
+    SlotContent content;
+    content.exists = exists != 0;
+    content.valid = valid != 0;
+    content.status = static_cast<Status>(status);
+    const size_t data = out.find("data=", line) + 5;
+    const size_t end = out.find('\n', data);
+    for (size_t i = data; i + 1 < end; i += 2) {
+        content.data.push_back(static_cast<uint8_t>(hexDigit(out[i]) << 4 | hexDigit(out[i + 1])));
+    }
+    return content;
+}
+
+std::string text(const SlotContent& content) {
+    std::ostringstream out;
+    out << content;
+    std::string shown = out.str();
+    return shown.size() > 120 ? shown.substr(0, 120) + "..." : shown;
+}
+
+// What an update should leave, when the store's rules say so without
+// looking at the copies: a writeAt outside a begun write starts from the
+// other copy's leftover data when no blob is current.
+bool expectedAfter(char update, const SlotContent& before, const Bytes& blob, SlotContent& expected) {
+    switch (update) {
+        case 'W':
+        case 'B':
+        case 'X':
+            expected = store_test::holding(blob);
+            return true;
+        case 'E':
+            expected = store_test::absentBlob();
+            return true;
+        case 'A': {
+            if (!before.exists) return false;
+            Bytes patched = before.data;
+            const size_t end = static_cast<size_t>(kPatchOffset) + kPatchSize;
+            if (patched.size() < end) patched.resize(end);
+            std::copy(blob.begin(), blob.begin() + kPatchSize, patched.begin() + kPatchOffset);
+            expected = store_test::holding(patched);
+            return true;
+        }
+        default:
+            throw std::invalid_argument(std::string("unknown update ") + update);
+    }
+}
+
+}  // namespace
+
+// One run of a scenario: where its record ends, and what it acknowledged.
+struct Segment {
+    size_t end;  // the record's length when the run ended
+    size_t slot;
+    SlotContent acknowledged;
+};
+
+// A scenario's runs: the files they started from, what each slot held
+// then, and the joint record.
+struct ScenarioRecord {
+    FsImage durable;
+    std::vector<SlotContent> initial;
+    std::vector<FsOp> ops;
+    std::vector<FsOp> recorded;  // as the shim wrote them, for reports
+    std::vector<Segment> segments;
+};
+
+namespace {
+
+class Recorder {
+public:
+    Recorder(const fs::path& scratch, const Scenario& scenario)
+        : scenario_(scenario), root_(scratch / "store"), inputs_(scratch / "inputs") {
+        fs::create_directories(inputs_);
+    }
+
+    ScenarioRecord record() {
+        ScenarioRecord result;
+        result.initial.assign(scenario_.slotCount, store_test::nothingStored());
+        const size_t slot = scenario_.slotCount == 1 ? 0 : kUpdatedSlot;
+        if (scenario_.slotCount > 1) populateOtherSlots(result.initial);
+        fs::create_directories(root_);
+        result.durable = snapshotTree(root_);
+
+        std::vector<SlotContent> current = result.initial;
+        std::vector<FsOp> raw;
+        for (size_t run = 0; run < scenario_.updates.size(); ++run) {
+            const char update = scenario_.updates[run];
+            const Bytes blob = blobFor(run + 1, scenario_.slotCount);
+            const fs::path recordFile = inputs_ / ("record" + std::to_string(run));
+            std::map<std::string, std::string> env = testing_support::preloadEnv();
+            env["FAULT_RECORD"] = recordFile.string();
+            env["FAULT_PATH_SUBSTR"] = root_.string() + "/";
+            env["FAULT_MTIME"] = std::to_string(clockOf(scenario_.clock, run));
+            const ProcessResult outcome = testing_support::runProgram(commandFor(update, slot, blob), env);
+            if (outcome.exitStatus != 0) {
+                throw std::runtime_error(std::string("update ") + update + " failed:\n" + outcome.out + outcome.err);
+            }
+            const std::vector<FsOp> ops = readFsRecord(recordFile);
+            checkOneCommit(ops, update);
+            raw.insert(raw.end(), ops.begin(), ops.end());
+
+            // The broken writer only writes; a fresh opening tells what it left.
+            const SlotContent reported = update == 'X' ? openedState(slot) : reportedState(outcome.out);
+            SlotContent expected;
+            if (expectedAfter(update, current[slot], blob, expected) && reported != expected) {
+                throw std::runtime_error(std::string("update ") + update + " left " + text(reported) + ", not " +
+                                         text(expected));
+            }
+            current[slot] = reported;
+            result.segments.push_back(Segment{raw.size(), slot, reported});
+        }
+        result.ops = prepareRecord(raw, root_, result.durable);
+        result.recorded = std::move(raw);
+        // prepareRecord drops nothing below the root, so the run ends stay.
+        if (result.ops.size() != result.recorded.size()) throw std::runtime_error("record outside the store");
+        return result;
+    }
+
+private:
+    std::vector<std::string> commandFor(char update, size_t slot, const Bytes& blob) {
+        const fs::path blobFile = inputs_ / "blob";
+        testing_support::writeBytes(blobFile, blob);
+        if (update == 'X') return {BROKEN_ORDER_WRITER, root_.string(), blobFile.string()};
+        std::vector<std::string> command = {DUAL_FILE_DRIVER, root_.string(), std::to_string(scenario_.slotCount),
+                                            std::to_string(slot)};
+        switch (update) {
+            case 'W':
+                command.insert(command.end(), {"write", blobFile.string()});
+                break;
+            case 'B': {
+                const size_t half = blob.size() / 2;
+                const fs::path head = inputs_ / "head";
+                const fs::path tail = inputs_ / "tail";
+                testing_support::writeBytes(head, Bytes(blob.begin(), blob.begin() + half));
+                testing_support::writeBytes(tail, Bytes(blob.begin() + half, blob.end()));
+                command.insert(command.end(), {"beginWrite", "writeAt", "0", head.string(), "writeAt",
+                                               std::to_string(half), tail.string(), "finalise"});
+                break;
+            }
+            case 'A': {
+                const fs::path patch = inputs_ / "patch";
+                testing_support::writeBytes(patch, Bytes(blob.begin(), blob.begin() + kPatchSize));
+                command.insert(command.end(), {"writeAt", std::to_string(kPatchOffset), patch.string()});
+                break;
+            }
+            case 'E':
+                command.push_back("erase");
+                break;
+            default:
+                throw std::invalid_argument(std::string("unknown update ") + update);
+        }
+        return command;
+    }
+
+    SlotContent openedState(size_t slot) const {
+        Storage::DualFileTarget target(root_, scenario_.slotCount);
+        return store_test::contentOf(*target.getSlot(slot).get());
+    }
+
+    // Slot 0 holds a blob, slot 2 an erased one; written before the record
+    // starts, so they are on disk.
+    void populateOtherSlots(std::vector<SlotContent>& initial) {
+        const fs::path blobFile = inputs_ / "other";
+        const Bytes other = blobFor(0, 99);
+        testing_support::writeBytes(blobFile, other);
+        const std::string slots = std::to_string(scenario_.slotCount);
+        for (const std::vector<std::string>& command :
+             {std::vector<std::string>{DUAL_FILE_DRIVER, root_.string(), slots, "0", "write", blobFile.string()},
+              std::vector<std::string>{DUAL_FILE_DRIVER, root_.string(), slots, "2", "write", blobFile.string(),
+                                       "erase"}}) {
+            // At a fixed time, so that every scenario starts from the same files.
+            std::map<std::string, std::string> env = testing_support::preloadEnv();
+            env["FAULT_MTIME"] = std::to_string(kClockStart);
+            const ProcessResult result = testing_support::runProgram(command, env);
+            if (result.exitStatus != 0) throw std::runtime_error("populating failed:\n" + result.out + result.err);
+        }
+        initial[0] = store_test::holding(other);
+        initial[2] = store_test::absentBlob();
+    }
+
+    // Every acknowledged update ends with the one syncfs of its commit.
+    static void checkOneCommit(const std::vector<FsOp>& ops, char update) {
+        const size_t syncs = static_cast<size_t>(std::count_if(
+            ops.begin(), ops.end(), [](const FsOp& op) { return op.kind == FsOpKind::kSyncfs; }));
+        if (ops.empty() || ops.back().kind != FsOpKind::kSyncfs || syncs != 1) {
+            throw std::runtime_error(std::string("update ") + update + " did not end with its one commit's syncfs");
+        }
+    }
+
+    const Scenario& scenario_;
+    fs::path root_;
+    fs::path inputs_;
+};
+
+fs::path scratchParent() {
+    const fs::path memory = "/dev/shm";
+    std::error_code ignored;
+    return fs::is_directory(memory, ignored) && ::access(memory.c_str(), W_OK) == 0 ? memory
+                                                                                    : fs::temp_directory_path();
+}
+
+}  // namespace
+
+Explorer::Explorer() : scratch_(scratchParent()) {}
+
+Explorer::~Explorer() = default;
+
+std::string Scenario::name() const {
+    return updates + "_" + std::to_string(slotCount) + "slot_" + clockName(clock) + "_" +
+           (order == MetadataOrder::kInOrder ? "inorder" : "perfile");
+}
+
+Totals& Totals::operator+=(const Totals& other) {
+    scenarios += other.scenarios;
+    crashPoints += other.crashPoints;
+    states += other.states;
+    openedStates += other.openedStates;
+    cleanUps += other.cleanUps;
+    violations += other.violations;
+    return *this;
+}
+
+std::string describe(const Totals& totals) {
+    return std::to_string(totals.scenarios) + " scenarios, " + std::to_string(totals.crashPoints) +
+           " crash points, " + std::to_string(totals.states) + " crash states (" +
+           std::to_string(totals.openedStates) + " distinct, each opened; " + std::to_string(totals.cleanUps) +
+           " with a clean-up cut short and opened again), " + std::to_string(totals.violations) + " violations";
+}
+
+std::vector<SlotContent> Explorer::open(const FsImage& image, size_t slotCount, FsImage* afterOpening) {
+    const fs::path root = scratch_ / "state";
+    fs::remove_all(root);
+    materialise(image, root);
+    std::vector<SlotContent> slots;
+    {
+        Storage::DualFileTarget target(root, slotCount);
+        for (size_t i = 0; i < slotCount; ++i) slots.push_back(store_test::contentOf(*target.getSlot(i).get()));
+    }
+    if (afterOpening != nullptr) *afterOpening = snapshotTree(root);
+    return slots;
+}
+
+const Explorer::Observation& Explorer::observe(const FsImage& image, size_t slotCount, Totals& totals) {
+    const std::string key = std::to_string(slotCount) + "\n" + fingerprint(image);
+    const auto known = observations_.find(key);
+    if (known != observations_.end()) return known->second;
+
+    Observation observation;
+    FsImage cleaned;
+    observation.slots = open(image, slotCount, &cleaned);
+    std::vector<std::string> removed;
+    for (const auto& [name, inode] : image.names) {
+        if (cleaned.names.count(name) == 0) removed.push_back(name);
+    }
+    // A power cut during the clean-up leaves any part of it done.
+    if (!removed.empty()) ++totals.cleanUps;
+    const size_t subsets = size_t{1} << std::min<size_t>(removed.size(), 10);
+    for (size_t mask = 1; mask < subsets && observation.cleanupProblem.empty(); ++mask) {
+        FsImage partial = image;
+        for (size_t i = 0; i < removed.size(); ++i) {
+            if (mask & (size_t{1} << i)) partial.dropName(removed[i]);
+        }
+        if (open(partial, slotCount, nullptr) != observation.slots) {
+            observation.cleanupProblem = "a second opening after a cut clean-up disagrees";
+        }
+    }
+    return observations_.emplace(key, std::move(observation)).first->second;
+}
+
+Totals Explorer::explore(const Scenario& scenario) {
+    // The runs do not depend on the metadata order.
+    Scenario recorded = scenario;
+    recorded.order = MetadataOrder::kInOrder;
+    std::unique_ptr<ScenarioRecord>& known = records_[recorded.name()];
+    if (!known) {
+        const fs::path scenarioDir = scratch_ / "scenario";
+        fs::remove_all(scenarioDir);
+        known = std::make_unique<ScenarioRecord>(Recorder(scenarioDir, scenario).record());
+    }
+    const ScenarioRecord& record = *known;
+
+    Totals totals;
+    totals.scenarios = 1;
+    const size_t openedBefore = observations_.size();
+    for (size_t crashPoint = 0; crashPoint <= record.ops.size(); ++crashPoint) {
+        // Runs that ended before the cut are acknowledged; the blob of the
+        // one it interrupted is in flight.
+        std::vector<SlotContent> acknowledged = record.initial;
+        const Segment* inFlight = nullptr;
+        size_t previousEnd = 0;
+        for (const Segment& run : record.segments) {
+            if (run.end <= crashPoint) {
+                acknowledged[run.slot] = run.acknowledged;
+                previousEnd = run.end;
+                continue;
+            }
+            if (crashPoint > previousEnd) inFlight = &run;
+            break;
+        }
+        ++totals.crashPoints;
+        totals.states += forEachCrashState(
+            record.durable, record.ops, crashPoint, scenario.order, [&](const FsImage& image) {
+                const Observation& seen = observe(image, scenario.slotCount, totals);
+                std::string problem = seen.cleanupProblem;
+                for (size_t slot = 0; slot < scenario.slotCount && problem.empty(); ++slot) {
+                    const SlotContent& shown = seen.slots[slot];
+                    const bool allowed = shown == acknowledged[slot] ||
+                                         (inFlight != nullptr && inFlight->slot == slot && shown == inFlight->acknowledged);
+                    if (!allowed) problem = "slot " + std::to_string(slot) + " shows " + text(shown);
+                }
+                if (problem.empty()) return;
+                ++totals.violations;
+                if (reports_.size() < kReportedViolations) {
+                    const std::string after = crashPoint == 0 ? "at the start" : "after " + describe(record.recorded[crashPoint - 1]);
+                    reports_.push_back(scenario.name() + ": power cut " + after + ": " + problem);
+                }
+            });
+    }
+    totals.openedStates = observations_.size() - openedBefore;
+    return totals;
+}
+
+}  // namespace crash

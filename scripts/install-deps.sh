@@ -8,6 +8,11 @@
 #                           runs its programs, and GoogleTest's sources to
 #                           build for ARM64
 #   install-deps.sh fuzz    also clang and its libFuzzer runtime
+#   install-deps.sh bench   also the micro-benchmark library, zlib (the CRC
+#                           reference), sfdisk (run by every registry
+#                           opening), hyperfine, and the peers and tools that
+#                           bench/compare.sh runs (fw_setenv, sqlite3, GNU
+#                           time, Python for the tables)
 set -euo pipefail
 
 packages=(cmake ninja-build g++ libgtest-dev)
@@ -16,6 +21,7 @@ for group in "$@"; do
     tests) packages+=(fdisk e2fsprogs strace) ;;
     cross) packages+=(g++-aarch64-linux-gnu qemu-user googletest file) ;;
     fuzz) packages+=(clang libclang-rt-14-dev) ;;
+    bench) packages+=(libbenchmark-dev zlib1g-dev fdisk hyperfine libubootenv-tool sqlite3 time python3) ;;
     *) echo "unknown package group: $group" >&2; exit 2 ;;
   esac
 done

@@ -1,6 +1,7 @@
 #include "lib/storage/check_value.h"
 
 #include <cerrno>
+#include <chrono>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -10,25 +11,34 @@
 namespace Storage {
 namespace {
 
+// Data and check files are both read in blocks of this size.
 constexpr size_t kReadBlock = 4096;
 
-// Reads `fd` to the end in kReadBlock pieces, handing each to `consume`.
-// Returns the number of bytes read, or -1 on a read error.
+// Reads `fd` to its end into `buffer`, handing each piece to `consume`.
+// Returns the number of bytes read, or -1 on a read error. `size` is the
+// size of a regular file, whose end is then known without the final read
+// that returns nothing; -1 for anything else.
 template <typename Consume>
-int64_t readAll(int fd, Consume consume) {
-    uint8_t block[kReadBlock];
+int64_t readAll(int fd, int64_t size, uint8_t* buffer, size_t capacity, Consume consume) {
     int64_t total = 0;
-    for (;;) {
-        const ssize_t count = ::read(fd, block, sizeof block);
+    while (size < 0 || total < size) {
+        const ssize_t count = ::read(fd, buffer, capacity);
         if (count < 0) {
             if (errno == EINTR) continue;
             return -1;
         }
-        if (count == 0) return total;
-        consume(block, static_cast<size_t>(count));
+        if (count == 0) break;
+        consume(buffer, static_cast<size_t>(count));
         total += count;
     }
+    return total;
 }
+
+int64_t regularFileSize(const struct stat& status) { return S_ISREG(status.st_mode) ? status.st_size : -1; }
+
+// std::filesystem turns a time from here on into an error.
+constexpr time_t kFileClockEnd =
+    static_cast<time_t>(std::chrono::nanoseconds::max().count() / std::chrono::nanoseconds::period::den);
 
 }  // namespace
 
@@ -42,23 +52,42 @@ Status computeCheckValue(const std::filesystem::path& dataPath, uint64_t& value)
     struct stat status {};
     if (::fstat(fd.get(), &status) != 0) return STATUS_FAILED;
 
+    uint8_t block[kReadBlock];
     uint32_t crc = kCrc32Initial;
-    if (readAll(fd.get(), [&](const uint8_t* data, size_t size) { crc = crc32Update(crc, data, size); }) < 0) {
-        return STATUS_FAILED;
-    }
+    const auto consume = [&](const uint8_t* data, size_t size) { crc = crc32Update(crc, data, size); };
+    if (readAll(fd.get(), regularFileSize(status), block, sizeof block, consume) < 0) return STATUS_FAILED;
     // Sizes of 4 GiB and more spill into the CRC half; no blob is that large.
     value = static_cast<uint64_t>(status.st_size) | (static_cast<uint64_t>(crc32Finish(crc)) << 32);
     return STATUS_OK;
 }
 
-Status readCheckValue(const std::filesystem::path& checkPath, uint64_t& value) {
+bool isLater(const CheckTime& later, const CheckTime& earlier) {
+    if (!later.known) return false;
+    if (!earlier.known) return true;
+    if (later.time.tv_sec != earlier.time.tv_sec) return later.time.tv_sec > earlier.time.tv_sec;
+    return later.time.tv_nsec > earlier.time.tv_nsec;
+}
+
+Status readCheckValue(const std::filesystem::path& checkPath, uint64_t& value, CheckTime* modified) {
+    if (modified != nullptr) *modified = CheckTime{};
     UniqueFd fd(::open(checkPath.c_str(), O_RDONLY | O_CLOEXEC));
-    if (!fd) return STATUS_FAILED;
+    if (!fd) return errno == ENOENT ? STATUS_NOT_FOUND : STATUS_FAILED;
+    struct stat status {};
+    int64_t size = -1;
+    if (::fstat(fd.get(), &status) == 0) {
+        size = regularFileSize(status);
+        if (modified != nullptr) *modified = {status.st_mtim.tv_sec < kFileClockEnd, status.st_mtim};
+    }
+
+    uint8_t block[kReadBlock];
     uint8_t stored[kCheckValueSize] = {};
-    const int64_t total = readAll(fd.get(), [&, offset = size_t{0}](const uint8_t* data, size_t size) mutable {
-        for (size_t i = 0; i < size && offset < kCheckValueSize; ++i) stored[offset++] = data[i];
-    });
-    if (total != static_cast<int64_t>(kCheckValueSize)) return STATUS_FAILED;
+    size_t offset = 0;
+    const auto consume = [&](const uint8_t* data, size_t count) {
+        for (size_t i = 0; i < count && offset < kCheckValueSize; ++i) stored[offset++] = data[i];
+    };
+    if (readAll(fd.get(), size, block, sizeof block, consume) != static_cast<int64_t>(kCheckValueSize)) {
+        return STATUS_FAILED;
+    }
     value = 0;
     for (size_t i = kCheckValueSize; i-- > 0;) value = (value << 8) | stored[i];
     return STATUS_OK;

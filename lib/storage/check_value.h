@@ -4,6 +4,7 @@
 #pragma once
 
 #include <cstdint>
+#include <ctime>
 #include <filesystem>
 
 #include "lib/util/status.h"
@@ -13,14 +14,30 @@ namespace Storage {
 constexpr uint64_t kAbsentBlobCheckValue = ~uint64_t{0};
 constexpr size_t kCheckValueSize = 8;
 
-// The check value of `dataPath`. STATUS_OK with kAbsentBlobCheckValue when
-// the file does not exist; STATUS_FAILED when it cannot be opened, sized or
-// read to the end.
+// The check value of `dataPath`, from one open of the file: its size as
+// fstat gives it, the CRC-32 of its bytes read to the end. STATUS_OK with
+// kAbsentBlobCheckValue when the file does not exist; STATUS_FAILED when it
+// cannot be opened, sized or read.
 [[nodiscard]] Status computeCheckValue(const std::filesystem::path& dataPath, uint64_t& value);
 
-// The value stored in `checkPath`. STATUS_FAILED unless the file reads
-// completely and holds exactly 8 bytes.
-[[nodiscard]] Status readCheckValue(const std::filesystem::path& checkPath, uint64_t& value);
+// A check file's modification time, as opening a slot compares them.
+// Unknown when it could not be read or lies beyond what
+// std::filesystem::file_time_type holds (from the year 2262 on); an unknown
+// time is earlier than every known one.
+struct CheckTime {
+    bool known = false;
+    struct timespec time {};
+};
+
+// `later` is strictly later than `earlier`.
+bool isLater(const CheckTime& later, const CheckTime& earlier);
+
+// The value stored in `checkPath`, from one open of the file; `modified`
+// (when not null) receives its modification time, also when the value is
+// bad. STATUS_NOT_FOUND when the file does not exist; STATUS_FAILED unless
+// it reads completely and holds exactly 8 bytes.
+[[nodiscard]] Status readCheckValue(const std::filesystem::path& checkPath, uint64_t& value,
+                                    CheckTime* modified = nullptr);
 
 // The 8 bytes of `value` as stored (little-endian).
 void encodeCheckValue(uint64_t value, uint8_t (&bytes)[kCheckValueSize]);

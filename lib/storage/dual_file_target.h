@@ -28,6 +28,8 @@
 
 namespace Storage {
 
+struct CheckTime;
+
 class DualFileTarget : public Target {
 public:
     // Creates `basePath` with its parents (a failure shows in the slots'
@@ -71,7 +73,8 @@ public:
         };
 
         Copy& other() { return copies_[(current_ + 1) % 2]; }
-        void validate(Copy& copy);
+        // Decides whether the copy is valid; returns its check file's time.
+        CheckTime validate(Copy& copy);
         void invalidate(Copy& copy);
         Status openCopyData(Copy& copy, int flags, UniqueFd& fd);
         Status commit(Copy& copy, std::filesystem::file_time_type previousTime);

@@ -2,7 +2,6 @@
 // umount commands (device and type come from the mount table).
 #pragma once
 
-#include <filesystem>
 #include <string>
 
 #include "lib/util/status.h"
@@ -10,7 +9,7 @@
 namespace Storage {
 
 // Where the boot partition is mounted.
-extern const std::filesystem::path kBootMountPoint;
+extern const char kBootMountPoint[];
 
 // Runs "mount -o remount,rw|ro /media/boot" through system(), after the
 // warning "Remounting "/media/boot" as rw|ro". STATUS_FAILED (and an error

@@ -87,10 +87,10 @@ Status copyFile(const fs::path& from, const fs::path& to) {
 
 Status readCopy(const fs::path& dataPath, bool valid, uint8_t* buffer, size_t size, int64_t offset,
                 size_t* bytesRead) {
-    if (!fileExists(dataPath)) return STATUS_NOT_FOUND;
-    if (!valid) return STATUS_FAILED;
+    if (!valid) return fileExists(dataPath) ? STATUS_FAILED : STATUS_NOT_FOUND;
     UniqueFd fd(::open(dataPath.c_str(), O_RDONLY | O_CLOEXEC));
-    if (!fd) return errno;
+    const int error = errno;  // a file that opens exists; only a failed open asks
+    if (!fd) return fileExists(dataPath) ? static_cast<Status>(error) : STATUS_NOT_FOUND;
     const ssize_t count = ::pread(fd.get(), buffer, size, offset);
     if (count < 0) return errno;
     if (bytesRead != nullptr) *bytesRead = static_cast<size_t>(count);
@@ -116,30 +116,30 @@ SlotHandle DualFileTarget::getSlot(size_t index) {
 
 DualFileTarget::Slot::Slot(const fs::path& directory) {
     const char* const names[] = {"1/data", "2/data"};
+    CheckTime checkTimes[2];
     for (size_t i = 0; i < copies_.size(); ++i) {
         Copy& copy = copies_[i];
         copy.dataPath = directory / names[i];
         copy.checkPath = withSuffix(copy.dataPath, ".chk");
-        validate(copy);
+        checkTimes[i] = validate(copy);
     }
-    const fs::file_time_type earliest = fs::file_time_type::min();
-    const fs::file_time_type time0 = copies_[0].valid ? modificationTime(copies_[0].checkPath) : earliest;
-    if (copies_[1].valid && modificationTime(copies_[1].checkPath) > time0) current_ = 1;
+    if (copies_[1].valid && isLater(checkTimes[1], copies_[0].valid ? checkTimes[0] : CheckTime{})) current_ = 1;
 }
 
-void DualFileTarget::Slot::validate(Copy& copy) {
-    (void)ensureDataDirectory(copy.dataPath);  // a missing directory fails the check below
+CheckTime DualFileTarget::Slot::validate(Copy& copy) {
     uint64_t actual = 0;
+    const Status computed = computeCheckValue(copy.dataPath, actual);
+    // Unless the data file was read its directory may be missing; failing to make it fails the copy.
+    if (computed != STATUS_OK || actual == kAbsentBlobCheckValue) (void)ensureDataDirectory(copy.dataPath);
     uint64_t stored = 0;
-    if (computeCheckValue(copy.dataPath, actual) == STATUS_OK &&
-        readCheckValue(copy.checkPath, stored) == STATUS_OK && actual == stored) {
-        copy.valid = true;
-        return;
-    }
-    // A mismatching check file must never become valid again by accident.
-    if (removeFile(copy.checkPath)) {
+    CheckTime checkTime;
+    const Status read = computed == STATUS_OK ? readCheckValue(copy.checkPath, stored, &checkTime) : STATUS_FAILED;
+    copy.valid = read == STATUS_OK && actual == stored;
+    // A mismatching check file must never become valid again by accident; a missing one needs no removal.
+    if (!copy.valid && read != STATUS_NOT_FOUND && removeFile(copy.checkPath)) {
         LOGE_AT(kCleanupCheckfileLine) << "Failure cleaning up checkfile " << std::quoted(copy.checkPath.string());
     }
+    return checkTime;
 }
 
 bool DualFileTarget::Slot::exists() const {
@@ -470,7 +470,7 @@ Status BootVectorTarget::Slot::write(const uint8_t* data, size_t size) {
 // ---------------------------------------------------------------------------
 // Mount and remount commands
 
-const fs::path kBootMountPoint = "/media/boot";
+const char kBootMountPoint[] = "/media/boot";
 
 namespace {
 
@@ -486,8 +486,8 @@ Status runMountCommand(const char* notice, const char* command, const std::strin
 
 Status remountBootPartition(bool writable) {
     const char* const mode = writable ? "rw" : "ro";
-    LOGW << "Remounting " << std::quoted(kBootMountPoint.string()) << " as " << mode;
-    const std::string command = std::string("mount -o remount,") + mode + " " + kBootMountPoint.string();
+    LOGW << "Remounting " << std::quoted(kBootMountPoint) << " as " << mode;
+    const std::string command = std::string("mount -o remount,") + mode + " " + kBootMountPoint;
     if (std::system(command.c_str()) != 0) {
         LOGE << "Failed to execute mount";
         return STATUS_FAILED;
@@ -520,10 +520,10 @@ SlotHandle FirmwareUpdateBootTarget::getSlot(size_t index) {
 }
 
 std::string FirmwareUpdateBootTarget::getDescription() const {
-    return "FirmwareUpdateBootTarget " + kBootMountPoint.string();
+    return std::string("FirmwareUpdateBootTarget ") + kBootMountPoint;
 }
 
-FirmwareUpdateBootTarget::Slot::Slot(const char* fileName) : destination_(kBootMountPoint / fileName) {}
+FirmwareUpdateBootTarget::Slot::Slot(const char* fileName) : destination_(fs::path(kBootMountPoint) / fileName) {}
 
 Status FirmwareUpdateBootTarget::Slot::close() {
     if (!receive_) return STATUS_INVALID_OPERATION;

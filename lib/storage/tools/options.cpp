@@ -1,9 +1,11 @@
 #include "options.h"
 
+#include <array>
 #include <cstdio>
 #include <cstdlib>
-#include <iterator>
 #include <map>
+#include <string>
+#include <utility>
 
 namespace {
 
@@ -24,45 +26,57 @@ constexpr unsigned kHelpColumn = 26;
 constexpr unsigned kUsageWidth = 80;
 
 using Kind = GetOptHelper::OptionKind;
+using Choices = std::map<std::string, int32_t>;
 
-// Only the targets that have a command-line name can be chosen.
-std::map<std::string, int32_t> targetChoices() {
-    std::map<std::string, int32_t> choices;
-    for (uint32_t value = 0; value < kStorageTargetCount; ++value) {
-        if (const char* name = commandLineName(static_cast<StorageTarget>(value))) {
-            choices.emplace(name, static_cast<int32_t>(value));
-        }
-    }
-    return choices;
+template <typename Value, size_t N>
+Choices choices(const std::pair<const char*, Value> (&words)[N]) {
+    Choices map;
+    for (const auto& [word, value] : words) map.emplace(word, static_cast<int32_t>(value));
+    return map;
 }
 
-// In the order of the usage text.
-const GetOptHelper::OptionSpec kOptionTable[] = {
-    {kOptionBase, "base", "/var/nonvolatile/app", 1, "Base path for storage.", Kind::Plain, {}, nullptr},
-    {kOptionType, "type", "", 1, "Migration type to perform", Kind::Choice,
-     {{"simple", static_cast<int32_t>(MigrationType::simple)},
-      {"checked", static_cast<int32_t>(MigrationType::checked)},
-      {"redundant", static_cast<int32_t>(MigrationType::redundant)}},
-     nullptr},
-    {kOptionTarget, "target", "", 1, "Target to assign result to", Kind::Choice, targetChoices(), nullptr},
-    {kOptionCheck, "check", "settings", 1, "Check to apply in checked/redundant mode", Kind::Choice,
-     {{"settings", static_cast<int32_t>(CheckType::settings)},
-      {"lut", static_cast<int32_t>(CheckType::lut)},
-      {"overlay", static_cast<int32_t>(CheckType::overlay)}},
-     nullptr},
-    {kOptionQueryPresent, "query-present", "", 0,
-     "Don't migrate, return success if target exists, failure otherwise.  For scripting.", Kind::Plain, {},
-     nullptr},
-    {kOptionIfNotPresent, "if-not-present", "", 0, "Only migrate if not already present", Kind::Plain, {}, nullptr},
-    {kOptionIndex, "index", "0", 1, "Slot index within target.", Kind::Plain, {}, nullptr},
-    {kOptionData, "data", "", 1, "Path to file to read for migration data.", Kind::Plain, {}, nullptr},
-    {kOptionData2, "data2", "", 1,
-     "Path to file to read for 2nd block of migration data.  Required for 'redundant' migration type.", Kind::Plain,
-     {}, nullptr},
-    {kOptionVerbose, "verbose", "", 0, "Runs with extra logging.", Kind::Plain, {}, nullptr},
-    {kOptionDebug, "debug", "", 0, "Runs with extra debug logging.", Kind::Plain, {}, nullptr},
-    {kOptionHelp, "help", "", 0, "Print usage instructions.", Kind::Plain, {}, nullptr},
-};
+constexpr std::pair<const char*, MigrationType> kTypeWords[] = {
+    {"simple", MigrationType::simple}, {"checked", MigrationType::checked}, {"redundant", MigrationType::redundant}};
+constexpr std::pair<const char*, CheckType> kCheckWords[] = {
+    {"settings", CheckType::settings}, {"lut", CheckType::lut}, {"overlay", CheckType::overlay}};
+
+// Only the targets that have a command-line name can be chosen.
+Choices targetChoices() {
+    Choices map;
+    for (uint32_t value = 0; value < kStorageTargetCount; ++value) {
+        if (const char* name = commandLineName(static_cast<StorageTarget>(value))) {
+            map.emplace(name, static_cast<int32_t>(value));
+        }
+    }
+    return map;
+}
+
+constexpr size_t kOptionCount = 12;
+
+// In the order of the usage text. Made when an Options is, not at start-up:
+// the choice maps are built on the heap.
+std::array<GetOptHelper::OptionSpec, kOptionCount> optionTable() {
+    return {{
+        {kOptionBase, "base", "/var/nonvolatile/app", 1, "Base path for storage.", Kind::Plain, {}, nullptr},
+        {kOptionType, "type", "", 1, "Migration type to perform", Kind::Choice, choices(kTypeWords), nullptr},
+        {kOptionTarget, "target", "", 1, "Target to assign result to", Kind::Choice, targetChoices(), nullptr},
+        {kOptionCheck, "check", "settings", 1, "Check to apply in checked/redundant mode", Kind::Choice,
+         choices(kCheckWords), nullptr},
+        {kOptionQueryPresent, "query-present", "", 0,
+         "Don't migrate, return success if target exists, failure otherwise.  For scripting.", Kind::Plain, {},
+         nullptr},
+        {kOptionIfNotPresent, "if-not-present", "", 0, "Only migrate if not already present", Kind::Plain, {},
+         nullptr},
+        {kOptionIndex, "index", "0", 1, "Slot index within target.", Kind::Plain, {}, nullptr},
+        {kOptionData, "data", "", 1, "Path to file to read for migration data.", Kind::Plain, {}, nullptr},
+        {kOptionData2, "data2", "", 1,
+         "Path to file to read for 2nd block of migration data.  Required for 'redundant' migration type.",
+         Kind::Plain, {}, nullptr},
+        {kOptionVerbose, "verbose", "", 0, "Runs with extra logging.", Kind::Plain, {}, nullptr},
+        {kOptionDebug, "debug", "", 0, "Runs with extra debug logging.", Kind::Plain, {}, nullptr},
+        {kOptionHelp, "help", "", 0, "Print usage instructions.", Kind::Plain, {}, nullptr},
+    }};
+}
 
 // Base 0, so "0x10" is 16 and "010" is 8. strtoul takes "-1" as the largest
 // unsigned long, which the range test then rejects.
@@ -76,7 +90,8 @@ Status parseSlotIndex(const char* text, uint32_t& slotIndex) {
 
 }  // namespace
 
-Options::Options(int argc, char** argv) : GetOptHelper(kOptionTable, std::size(kOptionTable)) {
+// The base copies the rows before the temporary table goes.
+Options::Options(int argc, char** argv) : GetOptHelper(optionTable().data(), kOptionCount) {
     if (const OptionSpec* base = optFor(kOptionBase)) basePath = base->defaultValue;
     programName = argv[0];
     if (parse(argc, argv) != STATUS_OK) printUsage(1);

@@ -14,7 +14,11 @@ using store_test::absentCheckFile;
 using store_test::bytesOf;
 using store_test::Bytes;
 using store_test::expectedCheckFile;
+using store_test::kPast;
+using store_test::kSecond;
+using store_test::mtimeNs;
 using store_test::patternBytes;
+using store_test::setMtimeNs;
 using testing_support::ScratchDir;
 using testing_support::writeBytes;
 
@@ -55,7 +59,7 @@ TEST(ComputeCheckValue, KnownTextGivesSizeAndCrc) {
 
 class ComputeCheckValueSizes : public ::testing::TestWithParam<size_t> {};
 
-// Sizes around the 4096-byte read blocks.
+// Sizes around the 4096-byte blocks a data file is read in, and larger.
 TEST_P(ComputeCheckValueSizes, MatchesTheReferenceLayout) {
     ScratchDir dir;
     const Bytes data = patternBytes(GetParam(), static_cast<uint32_t>(GetParam()));
@@ -66,7 +70,8 @@ TEST_P(ComputeCheckValueSizes, MatchesTheReferenceLayout) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Blocks, ComputeCheckValueSizes,
-                         ::testing::Values(1, 7, 4095, 4096, 4097, 8192, 12289, 100000));
+                         ::testing::Values(1, 7, 4095, 4096, 4097, 8192, 12289, 65535, 65536, 65537,
+                                           3 * 65536 + 5, 1000000));
 
 TEST(ComputeCheckValue, UnreadableDataFails) {
     ScratchDir dir;
@@ -100,12 +105,105 @@ TEST(ReadCheckValue, AllOnes) {
     EXPECT_EQ(value, Storage::kAbsentBlobCheckValue);
 }
 
-TEST(ReadCheckValue, MissingFileFails) {
+TEST(ReadCheckValue, MissingFileIsNotFound) {
     ScratchDir dir;
     uint64_t value = 7;
-    EXPECT_EQ(Storage::readCheckValue(dir / "data.chk", value), STATUS_FAILED);
+    Storage::CheckTime time{true, {1, 1}};
+    EXPECT_EQ(Storage::readCheckValue(dir / "data.chk", value, &time), STATUS_NOT_FOUND);
+    EXPECT_EQ(value, 7u);
+    EXPECT_FALSE(time.known);
+}
+
+TEST(ReadCheckValue, BelowAFileFails) {
+    ScratchDir dir;
+    writeBytes(dir / "file", bytesOf("x"));
+    uint64_t value = 7;
+    EXPECT_EQ(Storage::readCheckValue(dir / "file" / "data.chk", value), STATUS_FAILED);
     EXPECT_EQ(value, 7u);
 }
+
+TEST(ReadCheckValue, ReportsTheModificationTimeToTheNanosecond) {
+    ScratchDir dir;
+    writeBytes(dir / "data.chk", absentCheckFile());
+    setMtimeNs(dir / "data.chk", kPast + 123456789);
+    uint64_t value = 0;
+    Storage::CheckTime time;
+    ASSERT_EQ(Storage::readCheckValue(dir / "data.chk", value, &time), STATUS_OK);
+    EXPECT_TRUE(time.known);
+    EXPECT_EQ(time.time.tv_sec, kPast / kSecond);
+    EXPECT_EQ(time.time.tv_nsec, kPast % kSecond + 123456789);
+}
+
+// Opening compares the times of valid copies only, but the time comes with
+// every check file that could be opened.
+TEST(ReadCheckValue, ReportsTheTimeOfABadCheckFileToo) {
+    ScratchDir dir;
+    writeBytes(dir / "data.chk", Bytes(9, 0x00));
+    setMtimeNs(dir / "data.chk", kPast);
+    uint64_t value = 7;
+    Storage::CheckTime time;
+    EXPECT_EQ(Storage::readCheckValue(dir / "data.chk", value, &time), STATUS_FAILED);
+    EXPECT_EQ(value, 7u);
+    EXPECT_TRUE(time.known);
+    EXPECT_EQ(time.time.tv_sec, kPast / kSecond);
+}
+
+struct ClockEdge {
+    const char* name;
+    int64_t mtimeNs;
+    bool known;
+};
+
+class ReadCheckValueClockEdge : public ::testing::TestWithParam<ClockEdge> {};
+
+// std::filesystem::last_write_time reports an error (and the earliest time)
+// from second 9223372036 on; such a time is unknown here too.
+TEST_P(ReadCheckValueClockEdge, TimesBeyondTheFileClockAreUnknown) {
+    ScratchDir dir;
+    writeBytes(dir / "data.chk", absentCheckFile());
+    setMtimeNs(dir / "data.chk", GetParam().mtimeNs);
+    if (mtimeNs(dir / "data.chk") != GetParam().mtimeNs) GTEST_SKIP() << "the file system cannot hold this time";
+    uint64_t value = 0;
+    Storage::CheckTime time;
+    ASSERT_EQ(Storage::readCheckValue(dir / "data.chk", value, &time), STATUS_OK);
+    EXPECT_EQ(time.known, GetParam().known);
+
+    std::error_code error;
+    (void)std::filesystem::last_write_time(dir / "data.chk", error);  // only whether it fails matters
+    EXPECT_EQ(!error, GetParam().known) << error.message();
+}
+
+INSTANTIATE_TEST_SUITE_P(Edges, ReadCheckValueClockEdge,
+                         ::testing::Values(ClockEdge{"epoch", 0, true}, ClockEdge{"before_epoch", -kSecond, true},
+                                           ClockEdge{"last_second", 9223372035 * kSecond + 999999999, true},
+                                           ClockEdge{"first_second_beyond", 9223372036 * kSecond, false}),
+                         [](const auto& info) { return std::string(info.param.name); });
+
+struct LaterRow {
+    const char* name;
+    Storage::CheckTime later;
+    Storage::CheckTime earlier;
+    bool expected;
+};
+
+class IsLater : public ::testing::TestWithParam<LaterRow> {};
+
+TEST_P(IsLater, ComparesSecondsThenNanoseconds) {
+    EXPECT_EQ(Storage::isLater(GetParam().later, GetParam().earlier), GetParam().expected);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Rows, IsLater,
+    ::testing::Values(LaterRow{"equal", {true, {10, 5}}, {true, {10, 5}}, false},
+                      LaterRow{"one_nanosecond_later", {true, {10, 6}}, {true, {10, 5}}, true},
+                      LaterRow{"one_nanosecond_earlier", {true, {10, 4}}, {true, {10, 5}}, false},
+                      LaterRow{"later_second_fewer_nanoseconds", {true, {11, 0}}, {true, {10, 999999999}}, true},
+                      LaterRow{"earlier_second_more_nanoseconds", {true, {9, 999999999}}, {true, {10, 0}}, false},
+                      LaterRow{"negative_seconds", {true, {-1, 0}}, {true, {-2, 999999999}}, true},
+                      LaterRow{"known_over_unknown", {true, {-100, 0}}, {false, {}}, true},
+                      LaterRow{"unknown_over_known", {false, {500, 0}}, {true, {-100, 0}}, false},
+                      LaterRow{"both_unknown", {false, {2, 0}}, {false, {1, 0}}, false}),
+    [](const auto& info) { return std::string(info.param.name); });
 
 TEST(ReadCheckValue, DirectoryFails) {
     ScratchDir dir;

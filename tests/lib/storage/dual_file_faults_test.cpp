@@ -345,6 +345,32 @@ TEST_F(DualFileFaults, OpeningCannotRemoveADamagedCopysCheckFile) {
     EXPECT_FALSE(fs::exists(base() / "1" / "data.chk"));
 }
 
+// Opening opens each file of a copy once and removes only check files that
+// are there and wrong.
+TEST_F(DualFileFaults, OpeningOpensEachFileOnce) {
+    prepare();
+    // The driver's closing read of the current copy is the fifth.
+    EXPECT_EQ(countCalls("open", base().string(), {}), 5u);
+    EXPECT_EQ(countCalls("open", ".chk", {}), 2u);
+    EXPECT_EQ(countCalls("mutating", base().string(), {}), 0u);
+}
+
+TEST_F(DualFileFaults, OpeningAFreshStoreRemovesNothing) {
+    EXPECT_EQ(countCalls("open", base().string(), {}), 4u);
+    EXPECT_EQ(countCalls("unlink", base().string(), {}), 0u);
+    EXPECT_EQ(describeTree(base()), "d 1\nd 2\n");
+    EXPECT_EQ(countCalls("mutating", base().string(), {}), 0u);
+}
+
+TEST_F(DualFileFaults, OpeningRemovesOnlyCheckFilesThatAreThere) {
+    store_test::writeCopy(base() / "1", older_, kPast);
+    fs::remove(base() / "1" / "data.chk");  // data without a check file
+    store_test::writeCopy(base() / "2", old_, kPast);
+    testing_support::writeBytes(base() / "2" / "data", bytesOf("changed"));
+    EXPECT_EQ(countCalls("unlink", base().string(), {}), 1u);
+    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(older_) + "\nf 2/data " + hex(bytesOf("changed")) + "\n");
+}
+
 // ---- writing the data ----
 
 class DataWriteFails : public DualFileFaults,

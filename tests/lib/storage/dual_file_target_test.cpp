@@ -1,8 +1,10 @@
 #include "lib/storage/dual_file_target.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <functional>
 #include <iterator>
@@ -11,8 +13,11 @@
 #include <sched.h>
 #include <string>
 #include <sys/mount.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <tuple>
+#include <unistd.h>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -244,6 +249,40 @@ TEST_F(DualFileStore, OnlyCopy1ValidWins) {
     EXPECT_EQ(reopened(), holding(one));
 }
 
+// A check file dated from the year 2262 on has no time std::filesystem can
+// give; it counts as the earliest, whichever copy it belongs to.
+constexpr int64_t kBeyondTheFileClock = 9223372036 * kSecond;
+
+TEST_F(DualFileStore, Copy1DatedBeyondTheFileClockLoses) {
+    store_test::writeCopy(copyDir(0), bytesOf("copy zero"), kPast);
+    store_test::writeCopy(copyDir(1), bytesOf("copy one"), kBeyondTheFileClock);
+    if (mtimeNs(check(1)) != kBeyondTheFileClock) GTEST_SKIP() << "the file system cannot hold this time";
+    EXPECT_EQ(reopened(), holding(bytesOf("copy zero")));
+}
+
+TEST_F(DualFileStore, Copy0DatedBeyondTheFileClockLoses) {
+    store_test::writeCopy(copyDir(0), bytesOf("copy zero"), kBeyondTheFileClock);
+    store_test::writeCopy(copyDir(1), bytesOf("copy one"), kPast);
+    if (mtimeNs(check(0)) != kBeyondTheFileClock) GTEST_SKIP() << "the file system cannot hold this time";
+    EXPECT_EQ(reopened(), holding(bytesOf("copy one")));
+}
+
+TEST_F(DualFileStore, BothDatedBeyondTheFileClockChooseCopy0) {
+    store_test::writeCopy(copyDir(0), bytesOf("copy zero"), kBeyondTheFileClock);
+    store_test::writeCopy(copyDir(1), bytesOf("copy one"), kBeyondTheFileClock + 1);
+    if (mtimeNs(check(1)) != kBeyondTheFileClock + 1) GTEST_SKIP() << "the file system cannot hold this time";
+    EXPECT_EQ(reopened(), holding(bytesOf("copy zero")));
+}
+
+// An invalid copy 0 has no time: copy 1 wins even dated before the epoch.
+TEST_F(DualFileStore, ValidCopy1DatedBeforeTheEpochBeatsAnInvalidCopy0) {
+    store_test::writeCopy(copyDir(0), bytesOf("copy zero"), kPast);
+    writeBytes(data(0), bytesOf("COPY ZERO"));
+    store_test::writeCopy(copyDir(1), bytesOf("copy one"), -1000 * kSecond);
+    EXPECT_EQ(reopened(), holding(bytesOf("copy one")));
+    EXPECT_FALSE(fs::exists(check(0)));
+}
+
 TEST_F(DualFileStore, OpeningKeepsValidFilesAsTheyAre) {
     const Bytes zero = bytesOf("copy zero");
     const Bytes one = bytesOf("copy one");
@@ -314,6 +353,50 @@ TEST_F(DualFileStore, ReadsNeverFallBackToTheOtherCopy) {
     EXPECT_TRUE(slot.isValid());
     uint8_t buffer[8] = {};
     EXPECT_EQ(slot.read(buffer, sizeof buffer, 0), STATUS_NOT_FOUND);
+}
+
+TEST_F(DualFileStore, ReadWhenTheCopyDirectoryBecameAFile) {
+    store_test::writeCopy(copyDir(0), bytesOf("only"), kPast);
+    auto target = open();
+    TargetSlot& slot = slotOf(*target);
+    fs::remove_all(copyDir(0));
+    writeBytes(copyDir(0), bytesOf("a file"));
+    uint8_t buffer[8] = {};
+    size_t count = 42;
+    EXPECT_EQ(slot.readSome(buffer, sizeof buffer, 0, count), STATUS_NOT_FOUND);
+    EXPECT_EQ(count, 42u);
+}
+
+// Something that exists but cannot be opened for reading: the open's errno.
+TEST_F(DualFileStore, ReadOfADataPathThatExistsButCannotBeOpened) {
+    store_test::writeCopy(copyDir(0), bytesOf("only"), kPast);
+    auto target = open();
+    TargetSlot& slot = slotOf(*target);
+    fs::remove(data(0));
+    const int listener = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    ASSERT_GE(listener, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    ASSERT_LT(data(0).string().size(), sizeof address.sun_path);
+    std::strcpy(address.sun_path, data(0).c_str());
+    ASSERT_EQ(::bind(listener, reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    uint8_t buffer[8] = {};
+    size_t count = 42;
+    EXPECT_EQ(slot.readSome(buffer, sizeof buffer, 0, count), static_cast<Status>(ENXIO));
+    EXPECT_EQ(count, 42u);
+    EXPECT_TRUE(slot.exists());
+    ::close(listener);
+}
+
+// The data file turned into a directory: it opens, the read fails.
+TEST_F(DualFileStore, ReadOfADataPathThatBecameADirectory) {
+    store_test::writeCopy(copyDir(0), bytesOf("only"), kPast);
+    auto target = open();
+    TargetSlot& slot = slotOf(*target);
+    fs::remove(data(0));
+    fs::create_directory(data(0));
+    uint8_t buffer[8] = {};
+    EXPECT_EQ(slot.read(buffer, sizeof buffer, 0), static_cast<Status>(EISDIR));
 }
 
 TEST_F(DualFileStore, PartialReadAtTheEnd) {

@@ -104,7 +104,7 @@ TEST(RemountBootPartition, MissingMountCommandIsFailed) {
               "Remounting \"/media/boot\" as rw\nlib/storage/storage_target:N Failed to execute mount\nstatus 52\n");
 }
 
-TEST(RemountBootPartition, MountPointConstant) { EXPECT_EQ(Storage::kBootMountPoint, fs::path("/media/boot")); }
+TEST(RemountBootPartition, MountPointConstant) { EXPECT_STREQ(Storage::kBootMountPoint, "/media/boot"); }
 
 // ---- mountPartition and unmountPartition ----
 

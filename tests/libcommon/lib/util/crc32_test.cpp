@@ -2,11 +2,17 @@
 
 #include <algorithm>
 #include <cstdint>
+#include <fstream>
+#include <iterator>
 #include <random>
+#include <sstream>
 #include <string>
 #include <vector>
 
 #include <gtest/gtest.h>
+
+#include "child_process.h"
+#include "lib/util/crc32_paths.h"
 
 namespace {
 
@@ -157,5 +163,165 @@ TEST(Crc32, EverySingleBitFlipChangesTheValue) {
         data[bit / 8] ^= static_cast<uint8_t>(1u << (bit % 8));
     }
 }
+
+// ---- every implementation path on its own ----
+
+}  // namespace
+
+namespace Crc32Paths {
+// Test names and failure messages show the path by its name.
+void PrintTo(const Path& path, std::ostream* out) { *out << path.name; }
+}  // namespace Crc32Paths
+
+namespace {
+
+class Crc32Path : public ::testing::TestWithParam<Crc32Paths::Path> {
+protected:
+    void SetUp() override {
+        if (!GetParam().available()) GTEST_SKIP() << GetParam().name << " is not available on this CPU";
+    }
+    uint32_t crcOf(const uint8_t* data, size_t length) const {
+        return crc32Finish(GetParam().update(kCrc32Initial, data, length));
+    }
+};
+
+TEST_P(Crc32Path, KnownVectors) {
+    const Bytes fox = bytesOf("The quick brown fox jumps over the lazy dog");
+    const Bytes digits = repeated("123456789", 1000);
+    const Bytes ones(4097, 0xFF);
+    const Bytes zeros(4096, 0x00);
+    EXPECT_EQ(crcOf(nullptr, 0), 0u);
+    EXPECT_EQ(crcOf(fox.data(), fox.size()), 0x414FA339u);
+    EXPECT_EQ(crcOf(digits.data(), digits.size()), 0x407589CFu);
+    EXPECT_EQ(crcOf(ones.data(), ones.size()), 0x1F24BD79u);
+    EXPECT_EQ(crcOf(zeros.data(), zeros.size()), 0xC71C0011u);
+}
+
+TEST_P(Crc32Path, NoBytesLeaveTheState) {
+    for (const uint32_t state : {0u, 1u, 0x12345678u, kCrc32Initial}) {
+        EXPECT_EQ(GetParam().update(state, nullptr, 0), state);
+    }
+}
+
+// Every length up to well past the sizes where a path changes strategy
+// (whole 64-byte steps, 16-byte steps, byte tails), at every alignment,
+// from several starting states.
+TEST_P(Crc32Path, EveryLengthAndAlignmentMatchesBitwise) {
+    std::mt19937 random(20240502u);
+    const Bytes buffer = randomBytes(random, 600 + 16);
+    for (size_t offset = 0; offset < 16; ++offset) {
+        for (size_t length = 0; length <= 600; ++length) {
+            const uint8_t* data = buffer.data() + offset;
+            ASSERT_EQ(crcOf(data, length), bitwiseCrc32(data, length)) << "offset " << offset << " length " << length;
+        }
+    }
+}
+
+TEST_P(Crc32Path, AnyStartingStateMatchesTheTables) {
+    std::mt19937 random(99u);
+    const Bytes buffer = randomBytes(random, 5000);
+    for (const uint32_t state : {0u, 1u, 0x80000000u, 0xDEADBEEFu, kCrc32Initial}) {
+        for (const size_t length : {size_t{0}, size_t{3}, size_t{64}, size_t{127}, size_t{128}, size_t{129}, size_t{4999}}) {
+            ASSERT_EQ(GetParam().update(state, buffer.data() + 1, length),
+                      Crc32Paths::updateTable(state, buffer.data() + 1, length))
+                << "state " << state << " length " << length;
+        }
+    }
+}
+
+TEST_P(Crc32Path, RandomLengthsAndOffsetsMatchBitwise) {
+    std::mt19937 random(0xC0FFEEu);
+    std::uniform_int_distribution<size_t> lengthOf(0, 70000);
+    std::uniform_int_distribution<size_t> offsetOf(0, 15);
+    for (int round = 0; round < 60; ++round) {
+        const size_t length = lengthOf(random);
+        const size_t offset = offsetOf(random);
+        const Bytes buffer = randomBytes(random, offset + length);
+        ASSERT_EQ(crcOf(buffer.data() + offset, length), bitwiseCrc32(buffer.data() + offset, length))
+            << "round " << round << " offset " << offset << " length " << length;
+    }
+}
+
+TEST_P(Crc32Path, LargeBuffersMatchBitwise) {
+    std::mt19937 random(1u << 20);
+    const Bytes data = randomBytes(random, (1u << 20) + 77);
+    for (const size_t length : {size_t{65536}, size_t{65536 + 13}, data.size()}) {
+        EXPECT_EQ(crcOf(data.data(), length), bitwiseCrc32(data.data(), length)) << "length " << length;
+    }
+}
+
+// Pieces cut at random places, each fed by this path or by the tables in
+// turn: the running state means the same to all of them.
+TEST_P(Crc32Path, RandomSplitsMixedWithTheTablesMatchBitwise) {
+    std::mt19937 random(77u);
+    std::uniform_int_distribution<size_t> lengthOf(0, 20000);
+    std::uniform_int_distribution<int> piecesOf(1, 12);
+    for (int round = 0; round < 60; ++round) {
+        const Bytes data = randomBytes(random, lengthOf(random));
+        std::vector<size_t> cuts{0, data.size()};
+        const int pieces = piecesOf(random);
+        std::uniform_int_distribution<size_t> cutAt(0, data.size());
+        for (int i = 1; i < pieces; ++i) cuts.push_back(cutAt(random));
+        std::sort(cuts.begin(), cuts.end());
+
+        uint32_t state = kCrc32Initial;
+        for (size_t i = 0; i + 1 < cuts.size(); ++i) {
+            const Crc32Paths::Update update = (i + round) % 2 == 0 ? GetParam().update : Crc32Paths::updateTable;
+            state = update(state, data.data() + cuts[i], cuts[i + 1] - cuts[i]);
+        }
+        ASSERT_EQ(crc32Finish(state), bitwiseCrc32(data.data(), data.size())) << "round " << round;
+    }
+}
+
+TEST_P(Crc32Path, EverySingleBitFlipOfALongInputMatchesBitwise) {
+    std::mt19937 random(6u);
+    Bytes data = randomBytes(random, 200);
+    for (size_t bit = 0; bit < data.size() * 8; bit += 7) {
+        data[bit / 8] ^= static_cast<uint8_t>(1u << (bit % 8));
+        ASSERT_EQ(crcOf(data.data(), data.size()), bitwiseCrc32(data.data(), data.size())) << "bit " << bit;
+        data[bit / 8] ^= static_cast<uint8_t>(1u << (bit % 8));
+    }
+}
+
+INSTANTIATE_TEST_SUITE_P(Paths, Crc32Path, ::testing::ValuesIn(Crc32Paths::kPaths),
+                         [](const ::testing::TestParamInfo<Crc32Paths::Path>& info) {
+                             std::string name = info.param.name;
+                             std::replace(name.begin(), name.end(), '-', '_');
+                             return name;
+                         });
+
+TEST(Crc32Paths, TheLastPathIsTheTablesAndAlwaysAvailable) {
+    const Crc32Paths::Path& last = *std::prev(std::end(Crc32Paths::kPaths));
+    EXPECT_STREQ(last.name, "table");
+    EXPECT_TRUE(last.available());
+    EXPECT_EQ(last.update, &Crc32Paths::updateTable);
+}
+
+// The CPU's own description of itself, as Linux reports it.
+std::string cpuInfo() {
+    std::ifstream in("/proc/cpuinfo");
+    std::ostringstream text;
+    text << in.rdbuf();
+    return text.str();
+}
+
+#if defined(__x86_64__)
+TEST(Crc32Paths, CarryLessMultiplyIsUsedWhenTheCpuHasIt) {
+    const bool listed = cpuInfo().find(" pclmulqdq") != std::string::npos;
+    EXPECT_EQ(Crc32Paths::clmulAvailable(), listed);
+}
+#endif
+
+#if defined(CRC32_PATHS_ARM_CRC)
+// qemu-aarch64's default CPU has the CRC32 instructions; under emulation
+// /proc/cpuinfo describes the host, so it is asked only on real hardware.
+TEST(Crc32Paths, CrcInstructionsAreUsedWhenTheCpuHasThem) {
+    if (!testing_support::programEmulator().empty()) {
+        EXPECT_TRUE(Crc32Paths::armCrcAvailable());
+    } else {
+        EXPECT_EQ(Crc32Paths::armCrcAvailable(), cpuInfo().find(" crc32") != std::string::npos);
+    }
+}
+#endif
 
 }  // namespace

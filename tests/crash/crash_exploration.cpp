@@ -163,11 +163,9 @@ public:
             const char update = scenario_.updates[run];
             const Bytes blob = blobFor(run + 1, scenario_.slotCount);
             const fs::path recordFile = inputs_ / ("record" + std::to_string(run));
-            std::map<std::string, std::string> env = testing_support::preloadEnv();
-            env["FAULT_RECORD"] = recordFile.string();
-            env["FAULT_PATH_SUBSTR"] = root_.string() + "/";
-            env["FAULT_MTIME"] = std::to_string(clockOf(scenario_.clock, run));
-            const ProcessResult outcome = testing_support::runProgram(commandFor(update, slot, blob), env);
+            const ProcessResult outcome = testing_support::runProgram(
+                commandFor(update, slot, blob),
+                testing_support::recordEnv(recordFile.string(), root_.string() + "/", clockOf(scenario_.clock, run)));
             if (outcome.exitStatus != 0) {
                 throw std::runtime_error(std::string("update ") + update + " failed:\n" + outcome.out + outcome.err);
             }
@@ -245,9 +243,8 @@ private:
               std::vector<std::string>{DUAL_FILE_DRIVER, root_.string(), slots, "2", "write", blobFile.string(),
                                        "erase"}}) {
             // At a fixed time, so that every scenario starts from the same files.
-            std::map<std::string, std::string> env = testing_support::preloadEnv();
-            env["FAULT_MTIME"] = std::to_string(kClockStart);
-            const ProcessResult result = testing_support::runProgram(command, env);
+            const ProcessResult result =
+                testing_support::runProgram(command, testing_support::recordEnv("", "", kClockStart));
             if (result.exitStatus != 0) throw std::runtime_error("populating failed:\n" + result.out + result.err);
         }
         initial[0] = store_test::holding(other);
@@ -380,14 +377,16 @@ Totals Explorer::explore(const Scenario& scenario) {
                 std::string problem = seen.cleanupProblem;
                 for (size_t slot = 0; slot < scenario.slotCount && problem.empty(); ++slot) {
                     const SlotContent& shown = seen.slots[slot];
-                    const bool allowed = shown == acknowledged[slot] ||
-                                         (inFlight != nullptr && inFlight->slot == slot && shown == inFlight->acknowledged);
+                    const bool inFlightHere = inFlight != nullptr && inFlight->slot == slot;
+                    const bool allowed =
+                        shown == acknowledged[slot] || (inFlightHere && shown == inFlight->acknowledged);
                     if (!allowed) problem = "slot " + std::to_string(slot) + " shows " + text(shown);
                 }
                 if (problem.empty()) return;
                 ++totals.violations;
                 if (reports_.size() < kReportedViolations) {
-                    const std::string after = crashPoint == 0 ? "at the start" : "after " + describe(record.recorded[crashPoint - 1]);
+                    const std::string after =
+                        crashPoint == 0 ? "at the start" : "after " + describe(record.recorded[crashPoint - 1]);
                     reports_.push_back(scenario.name() + ": power cut " + after + ": " + problem);
                 }
             });

@@ -113,9 +113,9 @@ private:
                 const uint64_t begin = index * kBlockSize;
                 const uint64_t end = std::min<uint64_t>(begin + kBlockSize, data.size());
                 Block& block = blockOf(op.inode, index);
-                block.versions.push_back(BlockVersion{
-                    p, Bytes(data.begin() + static_cast<std::ptrdiff_t>(begin), data.begin() + static_cast<std::ptrdiff_t>(end)),
-                    end});
+                const auto from = data.begin() + static_cast<std::ptrdiff_t>(begin);
+                const auto to = data.begin() + static_cast<std::ptrdiff_t>(end);
+                block.versions.push_back(BlockVersion{p, Bytes(from, to), end});
             }
         }
     }

@@ -121,17 +121,24 @@ void expectRandomInputsMatchBitwise(Crc crc, int rounds) {
 
 TEST(Crc32, RandomInputsMatchBitwise) { expectRandomInputsMatchBitwise(crc32, 150); }
 
+// 0, `size` and up to eleven random places between, sorted: the bounds of
+// one to twelve pieces.
+std::vector<size_t> randomCuts(std::mt19937& random, size_t size) {
+    std::uniform_int_distribution<int> piecesOf(1, 12);
+    std::vector<size_t> cuts{0, size};
+    const int pieces = piecesOf(random);
+    std::uniform_int_distribution<size_t> cutAt(0, size);
+    for (int i = 1; i < pieces; ++i) cuts.push_back(cutAt(random));
+    std::sort(cuts.begin(), cuts.end());
+    return cuts;
+}
+
 TEST(Crc32, IncrementalAtRandomSplitsMatchesOneShot) {
     std::mt19937 random(77u);
     std::uniform_int_distribution<size_t> lengthOf(0, 70000);
-    std::uniform_int_distribution<int> piecesOf(1, 12);
     for (int round = 0; round < 100; ++round) {
         const Bytes data = randomBytes(random, lengthOf(random));
-        std::vector<size_t> cuts{0, data.size()};
-        const int pieces = piecesOf(random);
-        std::uniform_int_distribution<size_t> cutAt(0, data.size());
-        for (int i = 1; i < pieces; ++i) cuts.push_back(cutAt(random));
-        std::sort(cuts.begin(), cuts.end());
+        const std::vector<size_t> cuts = randomCuts(random, data.size());
 
         uint32_t state = kCrc32Initial;
         for (size_t i = 0; i + 1 < cuts.size(); ++i) {
@@ -251,14 +258,9 @@ TEST_P(Crc32Path, LargeBuffersMatchBitwise) {
 TEST_P(Crc32Path, RandomSplitsMixedWithTheTablesMatchBitwise) {
     std::mt19937 random(77u);
     std::uniform_int_distribution<size_t> lengthOf(0, 20000);
-    std::uniform_int_distribution<int> piecesOf(1, 12);
     for (int round = 0; round < 60; ++round) {
         const Bytes data = randomBytes(random, lengthOf(random));
-        std::vector<size_t> cuts{0, data.size()};
-        const int pieces = piecesOf(random);
-        std::uniform_int_distribution<size_t> cutAt(0, data.size());
-        for (int i = 1; i < pieces; ++i) cuts.push_back(cutAt(random));
-        std::sort(cuts.begin(), cuts.end());
+        const std::vector<size_t> cuts = randomCuts(random, data.size());
 
         uint32_t state = kCrc32Initial;
         for (size_t i = 0; i + 1 < cuts.size(); ++i) {

@@ -59,12 +59,6 @@ Bytes blobFor(size_t run, size_t salt) {
     return store_test::patternBytes(kBlockSize + 1000 + 211 * run, static_cast<uint32_t>(run * 7919 + salt));
 }
 
-uint8_t hexDigit(char c) {
-    if (c >= '0' && c <= '9') return static_cast<uint8_t>(c - '0');
-    if (c >= 'a' && c <= 'f') return static_cast<uint8_t>(c - 'a' + 10);
-    throw std::runtime_error(std::string("not a hex digit: ") + c);
-}
-
 // The "state:" line that the driver and the broken writer end with.
 SlotContent reportedState(const std::string& out) {
     const size_t line = out.rfind("state: ");
@@ -80,10 +74,7 @@ SlotContent reportedState(const std::string& out) {
     content.valid = valid != 0;
     content.status = static_cast<Status>(status);
     const size_t data = out.find("data=", line) + 5;
-    const size_t end = out.find('\n', data);
-    for (size_t i = data; i + 1 < end; i += 2) {
-        content.data.push_back(static_cast<uint8_t>(hexDigit(out[i]) << 4 | hexDigit(out[i + 1])));
-    }
+    content.data = testing_support::fromHex(out.substr(data, out.find('\n', data) - data));
     return content;
 }
 

@@ -6,6 +6,8 @@
 #include <limits>
 #include <stdexcept>
 
+#include "files.h"
+
 namespace crash {
 namespace {
 
@@ -190,14 +192,7 @@ std::string formatTime(const struct timespec& time) {
 }
 
 std::string formatHex(const std::vector<uint8_t>& bytes) {
-    if (bytes.empty()) return "-";
-    static const char kDigits[] = "0123456789abcdef";
-    std::string hex;
-    for (const uint8_t byte : bytes) {
-        hex += kDigits[byte >> 4];
-        hex += kDigits[byte & 0xF];
-    }
-    return hex;
+    return bytes.empty() ? "-" : testing_support::hex(bytes);
 }
 
 }  // namespace

@@ -93,16 +93,6 @@ std::map<std::string, std::string> snapshot(const fs::path& root) {
     return state;
 }
 
-std::string hex(const std::vector<uint8_t>& bytes) {
-    static const char kDigits[] = "0123456789abcdef";
-    std::string text;
-    for (const uint8_t byte : bytes) {
-        text += kDigits[byte >> 4];
-        text += kDigits[byte & 0xF];
-    }
-    return text;
-}
-
 bool below(const std::string& path, const fs::path& root) { return path.rfind(root.string() + "/", 0) == 0; }
 
 // The operations below `root` (and every syncfs), with paths relative to
@@ -126,7 +116,7 @@ std::vector<std::string> comparable(const std::vector<FsOp>& ops, const fs::path
             case FsOpKind::kWrite: {
                 const std::vector<uint8_t> head(op.data.begin(), op.data.begin() + std::min<size_t>(16, op.data.size()));
                 lines.push_back("write " + path + " at " + std::to_string(op.offset) + ": " +
-                                std::to_string(op.data.size()) + " bytes " + hex(head) + "...");
+                                std::to_string(op.data.size()) + " bytes " + testing_support::hex(head) + "...");
                 break;
             }
             case FsOpKind::kUnlink:

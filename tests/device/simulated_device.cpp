@@ -11,6 +11,8 @@
 #include <sys/ioctl.h>
 #include <unistd.h>
 
+#include "files.h"
+
 namespace simulated_device {
 namespace {
 
@@ -114,7 +116,7 @@ uint64_t resourcesPartitionOffset() { return requireNumber("SIMULATED_DEVICE_RES
 uint64_t resourcesPartitionSize() { return requireNumber("SIMULATED_DEVICE_RESOURCES_SIZE"); }
 uint64_t bootVectorSector() { return requireNumber("SIMULATED_DEVICE_BOOT_VECTOR_SECTOR"); }
 uint64_t bootVectorOffset() { return bootVectorSector() * 512; }
-Bytes writtenBootVectorRecord() { return fromHex(requireEnv("SIMULATED_DEVICE_BOOT_VECTOR_RECORD")); }
+Bytes writtenBootVectorRecord() { return testing_support::fromHex(requireEnv("SIMULATED_DEVICE_BOOT_VECTOR_RECORD")); }
 
 std::filesystem::path originalBootFile(const std::string& name) {
     if (name == "BOOT.BIN") return requireEnv("SIMULATED_DEVICE_BOOT_BIN");
@@ -217,25 +219,6 @@ bool isValidBootVectorRecord(const Bytes& record) {
     unsigned c = 0;
     for (size_t i = 0; i < 18; ++i) c = ((((c >> 1) | ((c & 1) << 15)) + record[i]) & 0xFFFF);
     return c == (record[18] | (static_cast<unsigned>(record[19]) << 8));
-}
-
-std::string toHex(const Bytes& bytes) {
-    static const char digits[] = "0123456789abcdef";
-    std::string hex;
-    for (uint8_t byte : bytes) {
-        hex += digits[byte >> 4];
-        hex += digits[byte & 0xF];
-    }
-    return hex;
-}
-
-Bytes fromHex(const std::string& hex) {
-    if (hex.size() % 2 != 0 || hex.find_first_not_of("0123456789abcdefABCDEF") != std::string::npos) {
-        throw std::invalid_argument("not hex: " + hex);
-    }
-    Bytes bytes;
-    for (size_t i = 0; i < hex.size(); i += 2) bytes.push_back(static_cast<uint8_t>(std::stoi(hex.substr(i, 2), nullptr, 16)));
-    return bytes;
 }
 
 std::filesystem::path runnerPath() { return SIMULATED_DEVICE_RUNNER; }

@@ -108,10 +108,6 @@ const char* toString(MountState state);
 Bytes makeBootVectorRecord(uint32_t value, uint8_t seed = 0);
 bool isValidBootVectorRecord(const Bytes& record);
 
-// Bytes as lower-case hex and back (for the run_on_device.sh --record option).
-std::string toHex(const Bytes& bytes);
-Bytes fromHex(const std::string& hex);
-
 // The runner script, for tests that start a device of their own from outside.
 std::filesystem::path runnerPath();
 

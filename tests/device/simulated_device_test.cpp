@@ -112,9 +112,9 @@ TEST_F(SimulatedDevice, RecordSectorHoldsWhatWasWritten) {
         return;
     }
     ASSERT_EQ(simulated_device::writtenBootVectorRecord().size(), 20u);
-    EXPECT_EQ(simulated_device::toHex(onDisk), simulated_device::toHex(simulated_device::writtenBootVectorRecord()));
+    EXPECT_EQ(testing_support::hex(onDisk), testing_support::hex(simulated_device::writtenBootVectorRecord()));
     // Value 0x01020304, big-endian.
-    EXPECT_EQ(simulated_device::toHex(Bytes(onDisk.begin(), onDisk.begin() + 4)), "01020304");
+    EXPECT_EQ(testing_support::hex(Bytes(onDisk.begin(), onDisk.begin() + 4)), "01020304");
     if (variantIs({"badrecord"})) {
         unsigned sum = 0;
         for (size_t i = 0; i < 8; ++i) sum += onDisk[i];
@@ -245,7 +245,7 @@ TEST_F(SimulatedDevice, EverydayDeviceNodesWork) {
 TEST(BootVectorRecordHelper, BuiltRecordsAreValidAndCarryTheValueBigEndian) {
     const Bytes record = simulated_device::makeBootVectorRecord(258);
     ASSERT_EQ(record.size(), 20u);
-    EXPECT_EQ(simulated_device::toHex(Bytes(record.begin(), record.begin() + 4)), "00000102");
+    EXPECT_EQ(testing_support::hex(Bytes(record.begin(), record.begin() + 4)), "00000102");
     EXPECT_TRUE(simulated_device::isValidBootVectorRecord(record));
     EXPECT_TRUE(simulated_device::isValidBootVectorRecord(Bytes(20, 0)));
 }
@@ -279,10 +279,10 @@ TEST(BootVectorRecordHelper, EveryChangedByteIsCaught) {
 
 TEST(BootVectorRecordHelper, HexRoundTrips) {
     const Bytes bytes{0x00, 0x7f, 0x80, 0xff};
-    EXPECT_EQ(simulated_device::toHex(bytes), "007f80ff");
-    EXPECT_EQ(simulated_device::fromHex("007F80ff"), bytes);
-    EXPECT_THROW(simulated_device::fromHex("0"), std::invalid_argument);
-    EXPECT_THROW(simulated_device::fromHex("zz"), std::invalid_argument);
+    EXPECT_EQ(testing_support::hex(bytes), "007f80ff");
+    EXPECT_EQ(testing_support::fromHex("007F80ff"), bytes);
+    EXPECT_THROW(testing_support::fromHex("0"), std::invalid_argument);
+    EXPECT_THROW(testing_support::fromHex("zz"), std::invalid_argument);
 }
 
 TEST(SimulatedDeviceHelper, OutsideTheDeviceTheGuardSkips) {
@@ -531,13 +531,13 @@ TEST_F(SimulatedDeviceLifecycle, BootFilesAndRecordCanBeChosen) {
     testing_support::writeText(boot0010, "chosen BOOT0010.BIN\n");
     const Bytes record = simulated_device::makeBootVectorRecord(0x00000102, 42);
     const ProcessResult result = run(
-        {"--boot-bin", boot.string(), "--boot0010-bin", boot0010.string(), "--record", simulated_device::toHex(record), "--",
+        {"--boot-bin", boot.string(), "--boot0010-bin", boot0010.string(), "--record", testing_support::hex(record), "--",
          "/bin/sh", "-c",
          "cat /media/boot/BOOT.BIN /media/boot/BOOT0010.BIN; echo \"$SIMULATED_DEVICE_BOOT_VECTOR_RECORD\"; "
          "dd if=/dev/mmcblk0 bs=512 skip=30703616 count=1 status=none | head -c 20 | od -An -tx1 | tr -d ' \\n'"});
     EXPECT_EQ(result.exitStatus, 0) << result.err;
-    EXPECT_EQ(result.out, "chosen BOOT.BIN\nchosen BOOT0010.BIN\n" + simulated_device::toHex(record) + "\n" +
-                              simulated_device::toHex(record));
+    EXPECT_EQ(result.out, "chosen BOOT.BIN\nchosen BOOT0010.BIN\n" + testing_support::hex(record) + "\n" +
+                              testing_support::hex(record));
 }
 
 TEST_F(SimulatedDeviceLifecycle, WrongUsageIsRefused) {

@@ -27,4 +27,25 @@ void writeBytes(const std::filesystem::path& path, const Bytes& bytes) {
     writeText(path, std::string(bytes.begin(), bytes.end()));
 }
 
+std::string hex(const Bytes& bytes) {
+    static const char digits[] = "0123456789abcdef";
+    std::string text;
+    for (const uint8_t byte : bytes) {
+        text += digits[byte >> 4];
+        text += digits[byte & 0xF];
+    }
+    return text;
+}
+
+Bytes fromHex(const std::string& text) {
+    if (text.size() % 2 != 0 || text.find_first_not_of("0123456789abcdefABCDEF") != std::string::npos) {
+        throw std::invalid_argument("not hex: " + text);
+    }
+    Bytes bytes;
+    for (size_t i = 0; i < text.size(); i += 2) {
+        bytes.push_back(static_cast<uint8_t>(std::stoi(text.substr(i, 2), nullptr, 16)));
+    }
+    return bytes;
+}
+
 }  // namespace testing_support

@@ -15,4 +15,9 @@ Bytes readBytes(const std::filesystem::path& path);
 void writeText(const std::filesystem::path& path, const std::string& text);
 void writeBytes(const std::filesystem::path& path, const Bytes& bytes);
 
+// Bytes as lower-case hex, two digits each, and back; fromHex takes either
+// case and throws std::invalid_argument for anything else.
+std::string hex(const Bytes& bytes);
+Bytes fromHex(const std::string& text);
+
 }  // namespace testing_support

@@ -13,9 +13,11 @@
 #include <cstring>
 #include <fstream>
 #include <iterator>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
+#include "files.h"
 #include "lib/storage/boot_vector_target.h"
 #include "lib/storage/firmware_update_boot_target.h"
 #include "lib/util/log.h"
@@ -31,31 +33,13 @@ int usage() {
     return 2;
 }
 
-std::string hex(const uint8_t* bytes, size_t size) {
-    std::string text;
-    char digits[3];
-    for (size_t i = 0; i < size; ++i) {
-        std::snprintf(digits, sizeof digits, "%02x", bytes[i]);
-        text += digits;
-    }
-    return text;
-}
-
-bool fromHex(const std::string& text, Bytes& out) {
-    if (text.size() % 2 != 0) return false;
-    for (size_t i = 0; i < text.size(); i += 2) {
-        char* end = nullptr;
-        const std::string pair = text.substr(i, 2);
-        const unsigned long value = std::strtoul(pair.c_str(), &end, 16);
-        if (end != pair.c_str() + 2) return false;
-        out.push_back(static_cast<uint8_t>(value));
-    }
-    return true;
-}
-
 int bootVectorWrite(const std::string& recordHex) {
     Bytes record;
-    if (!fromHex(recordHex, record)) return usage();
+    try {
+        record = testing_support::fromHex(recordHex);
+    } catch (const std::invalid_argument&) {
+        return usage();
+    }
     Storage::BootVectorTarget target;
     Storage::TargetSlot& slot = *target.getSlot(0).get();
     std::printf("write %u\n", slot.write(record.data(), record.size()));
@@ -63,7 +47,7 @@ int bootVectorWrite(const std::string& recordHex) {
     std::memset(buffer, 0xEE, sizeof buffer);
     size_t count = 99;
     const Status status = slot.readSome(buffer, sizeof buffer, 0, count);
-    std::printf("read %u %zu %s\n", status, count, hex(buffer, sizeof buffer).c_str());
+    std::printf("read %u %zu %s\n", status, count, testing_support::hex(Bytes(buffer, buffer + sizeof buffer)).c_str());
     return 0;
 }
 

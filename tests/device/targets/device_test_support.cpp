@@ -103,6 +103,4 @@ void makeBlockNode(const fs::path& node, dev_t number) {
     }
 }
 
-std::string hex(const Bytes& bytes) { return simulated_device::toHex(bytes); }
-
 }  // namespace device_test

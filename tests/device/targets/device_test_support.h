@@ -12,6 +12,7 @@
 
 #include "child_process.h"
 #include "fake_mount_commands.h"
+#include "files.h"
 
 namespace device_test {
 
@@ -55,6 +56,6 @@ dev_t blockDeviceNumber(const std::filesystem::path& node);
 // Replaces whatever is at `node` with a block device node (mode 0660).
 void makeBlockNode(const std::filesystem::path& node, dev_t number);
 
-std::string hex(const Bytes& bytes);
+using testing_support::hex;
 
 }  // namespace device_test

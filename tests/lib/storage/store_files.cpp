@@ -24,16 +24,6 @@ Bytes patternBytes(size_t count, uint32_t seed) {
     return bytes;
 }
 
-std::string hex(const Bytes& bytes) {
-    static const char digits[] = "0123456789abcdef";
-    std::string text;
-    for (const uint8_t byte : bytes) {
-        text += digits[byte >> 4];
-        text += digits[byte & 15];
-    }
-    return text;
-}
-
 uint32_t referenceCrc32(const Bytes& data) {
     uint32_t crc = 0xFFFFFFFFu;
     for (const uint8_t byte : data) {

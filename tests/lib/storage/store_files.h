@@ -24,7 +24,7 @@ constexpr int64_t kPast = 1577836800 * kSecond + kSecond / 2;
 Bytes bytesOf(const std::string& text);
 // `count` bytes of a fixed pseudo-random pattern chosen by `seed`.
 Bytes patternBytes(size_t count, uint32_t seed);
-std::string hex(const Bytes& bytes);
+using testing_support::hex;
 
 // CRC-32 of IEEE 802.3 one bit at a time, straight from the polynomial.
 uint32_t referenceCrc32(const Bytes& data);

@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "lib/storage/untrusted_tree.h"
 #include "lib/util/crc32.h"
 #include "lib/util/fd.h"
 
@@ -14,14 +15,14 @@ namespace {
 // Data and check files are both read in blocks of this size.
 constexpr size_t kReadBlock = 4096;
 
-// Reads `fd` to its end into `buffer`, handing each piece to `consume`.
-// Returns the number of bytes read, or -1 on a read error. `size` is the
-// size of a regular file, whose end is then known without the final read
-// that returns nothing; -1 for anything else.
+// Reads the regular file `fd` of `size` bytes, handing each piece of it to
+// `consume`. Returns the number of bytes read, or -1 on a read error. The
+// end is known from the size, without the final read that returns nothing;
+// a file that shrank meanwhile ends early.
 template <typename Consume>
 int64_t readAll(int fd, int64_t size, uint8_t* buffer, size_t capacity, Consume consume) {
     int64_t total = 0;
-    while (size < 0 || total < size) {
+    while (total < size) {
         const ssize_t count = ::read(fd, buffer, capacity);
         if (count < 0) {
             if (errno == EINTR) continue;
@@ -34,7 +35,16 @@ int64_t readAll(int fd, int64_t size, uint8_t* buffer, size_t capacity, Consume 
     return total;
 }
 
-int64_t regularFileSize(const struct stat& status) { return S_ISREG(status.st_mode) ? status.st_size : -1; }
+// The check value of the open data file `fd`, whose fstat is `status`.
+Status checkValueOf(int fd, const struct stat& status, uint64_t& value) {
+    uint8_t block[kReadBlock];
+    uint32_t crc = kCrc32Initial;
+    const auto consume = [&](const uint8_t* data, size_t size) { crc = crc32Update(crc, data, size); };
+    if (readAll(fd, status.st_size, block, sizeof block, consume) < 0) return STATUS_FAILED;
+    // Sizes of 4 GiB and more spill into the CRC half; no blob is that large.
+    value = static_cast<uint64_t>(status.st_size) | (static_cast<uint64_t>(crc32Finish(crc)) << 32);
+    return STATUS_OK;
+}
 
 // std::filesystem turns a time from here on into an error.
 constexpr time_t kFileClockEnd =
@@ -42,24 +52,27 @@ constexpr time_t kFileClockEnd =
 
 }  // namespace
 
-Status computeCheckValue(const std::filesystem::path& dataPath, uint64_t& value) {
-    UniqueFd fd(::open(dataPath.c_str(), O_RDONLY | O_CLOEXEC));
+Status computeCheckValue(int directory, const char* name, uint64_t& value) {
+    struct stat status {};
+    const UniqueFd fd = openRegularAt(directory, name, O_RDONLY, 0, &status);
     if (!fd) {
         if (errno != ENOENT) return STATUS_FAILED;
         value = kAbsentBlobCheckValue;
         return STATUS_OK;
     }
-    struct stat status {};
-    if (::fstat(fd.get(), &status) != 0) return STATUS_FAILED;
-
-    uint8_t block[kReadBlock];
-    uint32_t crc = kCrc32Initial;
-    const auto consume = [&](const uint8_t* data, size_t size) { crc = crc32Update(crc, data, size); };
-    if (readAll(fd.get(), regularFileSize(status), block, sizeof block, consume) < 0) return STATUS_FAILED;
-    // Sizes of 4 GiB and more spill into the CRC half; no blob is that large.
-    value = static_cast<uint64_t>(status.st_size) | (static_cast<uint64_t>(crc32Finish(crc)) << 32);
-    return STATUS_OK;
+    return checkValueOf(fd.get(), status, value);
 }
+
+bool matchesCheckValue(int directory, const char* name, uint64_t stored) {
+    struct stat status {};
+    const UniqueFd fd = openRegularAt(directory, name, O_RDONLY, 0, &status);
+    if (!fd) return errno == ENOENT && stored == kAbsentBlobCheckValue;
+    if (static_cast<uint32_t>(status.st_size) != static_cast<uint32_t>(stored)) return false;
+    uint64_t actual = 0;
+    return checkValueOf(fd.get(), status, actual) == STATUS_OK && actual == stored;
+}
+
+CheckTime checkTimeOf(const struct stat& status) { return {status.st_mtim.tv_sec < kFileClockEnd, status.st_mtim}; }
 
 bool isLater(const CheckTime& later, const CheckTime& earlier) {
     if (!later.known) return false;
@@ -68,24 +81,22 @@ bool isLater(const CheckTime& later, const CheckTime& earlier) {
     return later.time.tv_nsec > earlier.time.tv_nsec;
 }
 
-Status readCheckValue(const std::filesystem::path& checkPath, uint64_t& value, CheckTime* modified) {
+Status readCheckValue(int directory, const char* name, uint64_t& value, CheckTime* modified) {
     if (modified != nullptr) *modified = CheckTime{};
-    UniqueFd fd(::open(checkPath.c_str(), O_RDONLY | O_CLOEXEC));
-    if (!fd) return errno == ENOENT ? STATUS_NOT_FOUND : STATUS_FAILED;
     struct stat status {};
-    int64_t size = -1;
-    if (::fstat(fd.get(), &status) == 0) {
-        size = regularFileSize(status);
-        if (modified != nullptr) *modified = {status.st_mtim.tv_sec < kFileClockEnd, status.st_mtim};
-    }
+    const UniqueFd fd = openRegularAt(directory, name, O_RDONLY, 0, &status);
+    if (!fd) return errno == ENOENT ? STATUS_NOT_FOUND : STATUS_FAILED;
+    if (modified != nullptr) *modified = checkTimeOf(status);
+    // Any other size cannot be good, and a huge planted file is not read.
+    if (status.st_size != static_cast<off_t>(kCheckValueSize)) return STATUS_FAILED;
 
-    uint8_t block[kReadBlock];
     uint8_t stored[kCheckValueSize] = {};
     size_t offset = 0;
     const auto consume = [&](const uint8_t* data, size_t count) {
         for (size_t i = 0; i < count && offset < kCheckValueSize; ++i) stored[offset++] = data[i];
     };
-    if (readAll(fd.get(), size, block, sizeof block, consume) != static_cast<int64_t>(kCheckValueSize)) {
+    uint8_t block[kReadBlock];
+    if (readAll(fd.get(), status.st_size, block, sizeof block, consume) != static_cast<int64_t>(kCheckValueSize)) {
         return STATUS_FAILED;
     }
     value = 0;

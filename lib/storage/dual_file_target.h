@@ -15,12 +15,23 @@
 // newer wins (equal times: copy 0). A power cut at any instant therefore
 // leaves at least the previous version readable.
 //
+// Less trusted code may write below the base directory (the base itself
+// may be a link). Nothing below it is reached through a symbolic link, and
+// nothing but a regular file is read or written as a data or check file:
+// a link, FIFO, socket, device node or directory where a store file or
+// directory should be makes that copy invalid at opening, and an update of
+// that copy fails (ENOTDIR, ELOOP, EISDIR or ENXIO, or STATUS_FAILED where
+// the open of a data file is logged) without following it or waiting on it.
+// An entry in the place of a check or transient file is removed or
+// replaced, never followed.
+//
 // Failures are returned as errno values or STATUS_FAILED; nothing is
 // thrown but allocation failures.
 #pragma once
 
 #include <array>
 #include <filesystem>
+#include <string>
 #include <vector>
 
 #include "lib/storage/storage_target.h"
@@ -29,6 +40,7 @@
 namespace Storage {
 
 struct CheckTime;
+class SlotDirectories;
 
 class DualFileTarget : public Target {
 public:
@@ -42,7 +54,11 @@ public:
 
     class Slot : public TargetSlot {
     public:
-        explicit Slot(const std::filesystem::path& directory);
+        // Opens the slot that lives in `baseDirectory` itself (empty
+        // `name`) or in its subdirectory `name`. `base`, when not negative,
+        // is an open descriptor of the base directory, borrowed for the
+        // construction only.
+        Slot(std::filesystem::path baseDirectory, std::string name, int base = -1);
 
         // The current copy is valid and its data file exists.
         bool exists() const override;
@@ -72,18 +88,22 @@ public:
             bool valid = false;
         };
 
-        Copy& other() { return copies_[(current_ + 1) % 2]; }
+        unsigned otherIndex() const { return (current_ + 1) % 2; }
+        // Each operation reaches the slot's directories afresh.
+        SlotDirectories directories() const;
         // Decides whether the copy is valid; returns its check file's time.
-        CheckTime validate(Copy& copy);
-        void invalidate(Copy& copy);
-        Status openCopyData(Copy& copy, int flags, UniqueFd& fd);
-        Status commit(Copy& copy, std::filesystem::file_time_type previousTime);
-        Status commitOther(std::filesystem::file_time_type previousTime);
-        std::filesystem::file_time_type currentCheckTime() const;
+        CheckTime validate(unsigned index, SlotDirectories& directories);
+        void invalidate(unsigned index, SlotDirectories& directories);
+        Status openCopyData(unsigned index, SlotDirectories& directories, int flags, UniqueFd& fd);
+        Status commit(unsigned index, SlotDirectories& directories, const CheckTime& previousTime);
+        Status commitOther(SlotDirectories& directories, const CheckTime& previousTime);
+        CheckTime currentCheckTime(SlotDirectories& directories);
 
         std::array<Copy, 2> copies_;
         unsigned current_ = 0;
         bool writing_ = false;
+        std::filesystem::path baseDirectory_;
+        std::string name_;
     };
 
 private:

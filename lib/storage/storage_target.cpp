@@ -11,12 +11,12 @@
 
 #include "lib/storage/boot_vector_target.h"
 #include "lib/storage/check_value.h"
-#include "lib/storage/directories.h"
 #include "lib/storage/dual_file_target.h"
 #include "lib/storage/file_read_target.h"
 #include "lib/storage/firmware_update_boot_target.h"
 #include "lib/storage/firmware_update_partition_target.h"
 #include "lib/storage/mount_commands.h"
+#include "lib/storage/slot_directories.h"
 #include "lib/util/log.h"
 #include "lib/util/run_command.h"
 
@@ -44,7 +44,7 @@ constexpr mode_t kFileMode = 0666;
 // A superseding check file is made at least this much newer than the one it
 // replaces, so that opening picks it even when the clock stood still or went
 // back.
-constexpr std::chrono::nanoseconds kCheckTimeStep = std::chrono::seconds(2);
+constexpr time_t kCheckTimeStepSeconds = 2;
 
 fs::path withSuffix(const fs::path& path, const char* suffix) {
     fs::path result = path;
@@ -52,28 +52,12 @@ fs::path withSuffix(const fs::path& path, const char* suffix) {
     return result;
 }
 
-// std::filesystem::remove: a missing file is no error.
-std::error_code removeFile(const fs::path& path) {
-    std::error_code error;
-    fs::remove(path, error);
-    return error;
-}
+std::error_code errorCode(int error) { return std::error_code(error, std::generic_category()); }
 
-bool fileExists(const fs::path& path) {
-    std::error_code ignored;
-    return fs::exists(path, ignored);
-}
-
-// The earliest representable time when the file's time cannot be read.
-fs::file_time_type modificationTime(const fs::path& path) {
-    std::error_code ignored;
-    return fs::last_write_time(path, ignored);
-}
-
-Status copyFile(const fs::path& from, const fs::path& to) {
-    UniqueFd source(::open(from.c_str(), O_RDONLY | O_CLOEXEC));
+Status copyFile(const CopyDirectory& from, const CopyDirectory& to) {
+    const UniqueFd source = from.open(kDataName, O_RDONLY);
     if (!source) return STATUS_FAILED;
-    UniqueFd target(::open(to.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, kFileMode));
+    const UniqueFd target = to.open(kDataName, O_WRONLY | O_CREAT | O_TRUNC, kFileMode);
     if (!target) return STATUS_FAILED;
     uint8_t block[65536];
     for (;;) {
@@ -85,12 +69,12 @@ Status copyFile(const fs::path& from, const fs::path& to) {
     }
 }
 
-Status readCopy(const fs::path& dataPath, bool valid, uint8_t* buffer, size_t size, int64_t offset,
+Status readCopy(const CopyDirectory& directory, bool valid, uint8_t* buffer, size_t size, int64_t offset,
                 size_t* bytesRead) {
-    if (!valid) return fileExists(dataPath) ? STATUS_FAILED : STATUS_NOT_FOUND;
-    UniqueFd fd(::open(dataPath.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!valid) return directory.holds(kDataName) ? STATUS_FAILED : STATUS_NOT_FOUND;
+    const UniqueFd fd = directory.open(kDataName, O_RDONLY);
     const int error = errno;  // a file that opens exists; only a failed open asks
-    if (!fd) return fileExists(dataPath) ? static_cast<Status>(error) : STATUS_NOT_FOUND;
+    if (!fd) return directory.holds(kDataName) ? static_cast<Status>(error) : STATUS_NOT_FOUND;
     const ssize_t count = ::pread(fd.get(), buffer, size, offset);
     if (count < 0) return errno;
     if (bytesRead != nullptr) *bytesRead = static_cast<size_t>(count);
@@ -103,9 +87,11 @@ DualFileTarget::DualFileTarget(fs::path basePath, size_t slotCount) {
     basePath_ = std::move(basePath);
     std::error_code ignored;  // a missing directory shows in the slots' operations
     fs::create_directories(basePath_, ignored);
+    // Opened once for all slots; followed if it is a link (the integrator's choice).
+    const UniqueFd base(::open(basePath_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     slots_.reserve(slotCount);
     for (size_t i = 0; i < slotCount; ++i) {
-        slots_.emplace_back(slotCount == 1 ? basePath_ : basePath_ / std::to_string(i));
+        slots_.emplace_back(basePath_, slotCount == 1 ? std::string() : std::to_string(i), base.get());
     }
 }
 
@@ -114,78 +100,88 @@ SlotHandle DualFileTarget::getSlot(size_t index) {
     return SlotHandle::borrow(&slots_[index]);
 }
 
-DualFileTarget::Slot::Slot(const fs::path& directory) {
+DualFileTarget::Slot::Slot(fs::path baseDirectory, std::string name, int base)
+    : baseDirectory_(std::move(baseDirectory)), name_(std::move(name)) {
     const char* const names[] = {"1/data", "2/data"};
+    const fs::path directory = name_.empty() ? baseDirectory_ : baseDirectory_ / name_;
+    SlotDirectories opening(baseDirectory_, name_, base);
     CheckTime checkTimes[2];
-    for (size_t i = 0; i < copies_.size(); ++i) {
+    for (unsigned i = 0; i < copies_.size(); ++i) {
         Copy& copy = copies_[i];
         copy.dataPath = directory / names[i];
         copy.checkPath = withSuffix(copy.dataPath, ".chk");
-        checkTimes[i] = validate(copy);
+        checkTimes[i] = validate(i, opening);
     }
     if (copies_[1].valid && isLater(checkTimes[1], copies_[0].valid ? checkTimes[0] : CheckTime{})) current_ = 1;
 }
 
-CheckTime DualFileTarget::Slot::validate(Copy& copy) {
-    uint64_t actual = 0;
-    const Status computed = computeCheckValue(copy.dataPath, actual);
-    // Unless the data file was read its directory may be missing; failing to make it fails the copy.
-    if (computed != STATUS_OK || actual == kAbsentBlobCheckValue) (void)ensureDataDirectory(copy.dataPath);
+SlotDirectories DualFileTarget::Slot::directories() const { return SlotDirectories(baseDirectory_, name_); }
+
+CheckTime DualFileTarget::Slot::validate(unsigned index, SlotDirectories& directories) {
+    Copy& copy = copies_[index];
+    // A failure to make it shows as a missing or unusable directory below.
+    const CopyDirectory directory = directories.ensure(index);
     uint64_t stored = 0;
     CheckTime checkTime;
-    const Status read = computed == STATUS_OK ? readCheckValue(copy.checkPath, stored, &checkTime) : STATUS_FAILED;
-    copy.valid = read == STATUS_OK && actual == stored;
+    // The stored value first: data that no check file vouches for is not read.
+    const Status read = directory.readCheck(stored, &checkTime);
+    copy.valid = read == STATUS_OK && directory.dataMatches(stored);
     // A mismatching check file must never become valid again by accident; a missing one needs no removal.
-    if (!copy.valid && read != STATUS_NOT_FOUND && removeFile(copy.checkPath)) {
+    if (!copy.valid && read != STATUS_NOT_FOUND && directory.remove(kCheckName) != 0) {
         LOGE_AT(kCleanupCheckfileLine) << "Failure cleaning up checkfile " << std::quoted(copy.checkPath.string());
     }
     return checkTime;
 }
 
 bool DualFileTarget::Slot::exists() const {
-    const Copy& copy = copies_[current_];
-    return copy.valid && fileExists(copy.dataPath);
+    if (!copies_[current_].valid) return false;
+    SlotDirectories reached = directories();
+    return reached.open(current_).holds(kDataName);
 }
 
 Status DualFileTarget::Slot::read(uint8_t* buffer, size_t size, int64_t offset) {
-    const Copy copy = copies_[current_];
-    return readCopy(copy.dataPath, copy.valid, buffer, size, offset, nullptr);
+    SlotDirectories reached = directories();
+    return readCopy(reached.open(current_), copies_[current_].valid, buffer, size, offset, nullptr);
 }
 
 Status DualFileTarget::Slot::readSome(uint8_t* buffer, size_t size, int64_t offset, size_t& bytesRead) {
-    const Copy copy = copies_[current_];
-    return readCopy(copy.dataPath, copy.valid, buffer, size, offset, &bytesRead);
+    SlotDirectories reached = directories();
+    return readCopy(reached.open(current_), copies_[current_].valid, buffer, size, offset, &bytesRead);
 }
 
-fs::file_time_type DualFileTarget::Slot::currentCheckTime() const {
-    return modificationTime(copies_[current_].checkPath);
+CheckTime DualFileTarget::Slot::currentCheckTime(SlotDirectories& directories) {
+    return directories.open(current_).checkTime();
 }
 
-void DualFileTarget::Slot::invalidate(Copy& copy) {
-    if (const std::error_code error = removeFile(copy.checkPath)) LOGE_AT(kInvalidateLine) << "" << error;
-    copy.valid = false;
+void DualFileTarget::Slot::invalidate(unsigned index, SlotDirectories& directories) {
+    if (const int error = directories.open(index).remove(kCheckName)) LOGE_AT(kInvalidateLine) << "" << errorCode(error);
+    copies_[index].valid = false;
 }
 
-Status DualFileTarget::Slot::openCopyData(Copy& copy, int flags, UniqueFd& fd) {
-    if (ensureDataDirectory(copy.dataPath) != STATUS_OK) {
+Status DualFileTarget::Slot::openCopyData(unsigned index, SlotDirectories& directories, int flags, UniqueFd& fd) {
+    CopyDirectory directory = directories.ensure(index);
+    if (directory.fd < 0) {
         // Tried again only to print what it says now; outside the statement,
         // since it logs on its own.
-        const Status retried = ensureDataDirectory(copy.dataPath);
-        LOGE_AT(kOpenCopyDataLine) << "" << retried;
+        directory = directories.ensure(index);
+        LOGE_AT(kOpenCopyDataLine) << "" << (directory.fd < 0 ? static_cast<Status>(directory.error) : STATUS_OK);
     }
-    if (const std::error_code error = removeFile(copy.checkPath)) return statusFromError(error);
-    fd = openFd(copy.dataPath.c_str(), flags | O_CLOEXEC, kFileMode);
+    if (const int error = directory.remove(kCheckName)) return static_cast<Status>(error);
+    fd = directory.open(kDataName, flags, kFileMode);
+    if (!fd) logOpenFailure(copies_[index].dataPath.c_str(), errno);
     return fd ? STATUS_OK : STATUS_FAILED;
 }
 
-Status DualFileTarget::Slot::commit(Copy& copy, fs::file_time_type previousTime) {
+Status DualFileTarget::Slot::commit(unsigned index, SlotDirectories& directories, const CheckTime& previousTime) {
+    Copy& copy = copies_[index];
+    const CopyDirectory directory = directories.open(index);
     uint64_t value = 0;
-    if (computeCheckValue(copy.dataPath, value) != STATUS_OK) return STATUS_FAILED;
+    if (directory.computeCheck(value) != STATUS_OK) return STATUS_FAILED;
 
-    const fs::path tmpPath = withSuffix(copy.checkPath, ".tmp");
     {
-        // A failed open is logged by openFd; the write below then fails.
-        UniqueFd tmp = openFd(tmpPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, kFileMode);
+        const UniqueFd tmp = directory.open(kTransientName, O_WRONLY | O_CREAT | O_TRUNC, kFileMode);
+        // A failed open is logged here; the write below then fails.
+        if (!tmp) logOpenFailure(withSuffix(copy.checkPath, ".tmp").c_str(), errno);
         uint8_t bytes[kCheckValueSize];
         encodeCheckValue(value, bytes);
         const ssize_t written = ::write(tmp.get(), bytes, sizeof bytes);
@@ -197,23 +193,24 @@ Status DualFileTarget::Slot::commit(Copy& copy, fs::file_time_type previousTime)
                 LOGE_AT(kCheckWriteShortLine) << "Failed to write expected data: " << written;
             }
             (void)::ftruncate(tmp.get(), 0);  // an orphaned partial file is harmless; the removal matters
-            if (removeFile(tmpPath)) LOGE_AT(kCheckCleanupLine) << "Failed to cleanup check file";
+            if (directory.remove(kTransientName) != 0) LOGE_AT(kCheckCleanupLine) << "Failed to cleanup check file";
             return STATUS_FAILED;
+        }
+        // The time the write gave it.
+        struct stat status {};
+        const bool stated = ::fstat(tmp.get(), &status) == 0;
+        if (previousTime.known && !(stated && isLater(checkTimeOf(status), previousTime))) {
+            struct timespec times[2] = {{0, UTIME_OMIT}, previousTime.time};
+            times[1].tv_sec += kCheckTimeStepSeconds;
+            if (::futimens(tmp.get(), times) != 0) LOGE_AT(kCheckTimeLine) << "" << errorCode(errno);
         }
     }
 
-    if (!(previousTime < modificationTime(tmpPath))) {
-        std::error_code error;
-        fs::last_write_time(tmpPath, previousTime + kCheckTimeStep, error);
-        if (error) LOGE_AT(kCheckTimeLine) << "" << error;
-    }
+    if (::renameat(directory.fd, kTransientName, directory.fd, kCheckName) != 0) return errno;
 
-    std::error_code renameError;
-    fs::rename(tmpPath, copy.checkPath, renameError);
-    if (renameError) return statusFromError(renameError);
-
-    const UniqueFd check = openFd(copy.checkPath.c_str(), O_RDONLY | O_CLOEXEC);
+    const UniqueFd check = directory.open(kCheckName, O_RDONLY);
     if (!check) {
+        logOpenFailure(copy.checkPath.c_str(), errno);
         LOGE_AT(kSyncOpenLine) << "Failed to open path " << std::quoted(copy.checkPath.string()) << " for  fs sync";
         copy.valid = true;
         return STATUS_OK;
@@ -228,18 +225,18 @@ Status DualFileTarget::Slot::commit(Copy& copy, fs::file_time_type previousTime)
     return STATUS_OK;
 }
 
-Status DualFileTarget::Slot::commitOther(fs::file_time_type previousTime) {
-    const Status status = commit(other(), previousTime);
-    if (status == STATUS_OK) current_ = (current_ + 1) % 2;
+Status DualFileTarget::Slot::commitOther(SlotDirectories& directories, const CheckTime& previousTime) {
+    const Status status = commit(otherIndex(), directories, previousTime);
+    if (status == STATUS_OK) current_ = otherIndex();
     return status;
 }
 
 Status DualFileTarget::Slot::write(const uint8_t* data, size_t size) {
-    const fs::file_time_type previousTime = currentCheckTime();
-    Copy& target = other();
-    invalidate(target);
+    SlotDirectories reached = directories();
+    const CheckTime previousTime = currentCheckTime(reached);
+    invalidate(otherIndex(), reached);
     UniqueFd fd;
-    if (const Status status = openCopyData(target, O_RDWR | O_CREAT | O_TRUNC, fd)) return status;
+    if (const Status status = openCopyData(otherIndex(), reached, O_RDWR | O_CREAT | O_TRUNC, fd)) return status;
     const ssize_t written = ::write(fd.get(), data, size);
     if (written < 0) {
         const int error = errno;
@@ -248,60 +245,67 @@ Status DualFileTarget::Slot::write(const uint8_t* data, size_t size) {
     }
     if (static_cast<size_t>(written) != size) return STATUS_FAILED;
     fd.reset();
-    return commitOther(previousTime);
+    return commitOther(reached, previousTime);
 }
 
 Status DualFileTarget::Slot::beginWrite() {
     if (writing_) return STATUS_OK;
+    SlotDirectories reached = directories();
+    const CopyDirectory directory = reached.open(otherIndex());
     // The second removal finds nothing; it is kept deliberately.
     for (int attempt = 0; attempt < 2; ++attempt) {
-        if (const std::error_code error = removeFile(other().dataPath)) return statusFromError(error);
+        if (const int error = directory.remove(kDataName)) return static_cast<Status>(error);
     }
     writing_ = true;
     return STATUS_OK;
 }
 
 Status DualFileTarget::Slot::writeAt(int64_t offset, const uint8_t* data, size_t size) {
-    fs::file_time_type previousTime{};
-    Copy& target = other();
+    SlotDirectories reached = directories();
+    CheckTime previousTime;
+    const unsigned target = otherIndex();
     if (!writing_) {
-        previousTime = currentCheckTime();
-        invalidate(target);
-        if (const Status status = ensureDataDirectory(target.dataPath)) {
-            LOG_STATUS_AT(kEnsureDirectoryLine, status);
-            return status;
+        previousTime = currentCheckTime(reached);
+        invalidate(target, reached);
+        const CopyDirectory directory = reached.ensure(target);
+        if (directory.fd < 0) {
+            LOG_STATUS_AT(kEnsureDirectoryLine, static_cast<Status>(directory.error));
+            return static_cast<Status>(directory.error);
         }
-        const Copy& source = copies_[current_];
-        if (fileExists(source.dataPath) && source.valid && copyFile(source.dataPath, target.dataPath) != STATUS_OK) {
+        const CopyDirectory source = reached.open(current_);
+        if (source.holds(kDataName) && copies_[current_].valid && copyFile(source, directory) != STATUS_OK) {
             LOGE_AT(kCopyOldDataLine) << "Failed to copy old data\n";
             return STATUS_FAILED;
         }
     }
     UniqueFd fd;
-    if (const Status status = openCopyData(target, O_RDWR | O_CREAT, fd)) return status;
+    if (const Status status = openCopyData(target, reached, O_RDWR | O_CREAT, fd)) return status;
     const ssize_t written = ::pwrite(fd.get(), data, size, offset);
     if (written < 0 && errno != 0) return static_cast<Status>(errno);
     if (written < 0 || static_cast<size_t>(written) != size) return STATUS_FAILED;
     fd.reset();
-    return writing_ ? STATUS_OK : commitOther(previousTime);
+    return writing_ ? STATUS_OK : commitOther(reached, previousTime);
 }
 
 Status DualFileTarget::Slot::finalise() {
     if (!writing_) return STATUS_INVALID_OPERATION;
     writing_ = false;
-    return commitOther(currentCheckTime());
+    SlotDirectories reached = directories();
+    return commitOther(reached, currentCheckTime(reached));
 }
 
 Status DualFileTarget::Slot::erase() {
-    const fs::file_time_type previousTime = currentCheckTime();
-    Copy& target = other();
-    invalidate(target);
-    if (const std::error_code error = removeFile(target.dataPath)) return statusFromError(error);
-    if (const Status status = ensureDataDirectory(target.dataPath)) {
-        LOG_STATUS_AT(kEraseDirectoryLine, status);
-        return status;
+    SlotDirectories reached = directories();
+    const CheckTime previousTime = currentCheckTime(reached);
+    const unsigned target = otherIndex();
+    invalidate(target, reached);
+    if (const int error = reached.open(target).remove(kDataName)) return static_cast<Status>(error);
+    const CopyDirectory directory = reached.ensure(target);
+    if (directory.fd < 0) {
+        LOG_STATUS_AT(kEraseDirectoryLine, static_cast<Status>(directory.error));
+        return static_cast<Status>(directory.error);
     }
-    return commitOther(previousTime);
+    return commitOther(reached, previousTime);
 }
 
 // ---------------------------------------------------------------------------

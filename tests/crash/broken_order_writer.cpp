@@ -40,8 +40,8 @@ Copy inspect(const fs::path& directory) {
     uint64_t actual = 0;
     uint64_t stored = 0;
     struct stat status {};
-    copy.valid = Storage::computeCheckValue(copy.data, actual) == STATUS_OK &&
-                 Storage::readCheckValue(copy.check, stored) == STATUS_OK && actual == stored &&
+    copy.valid = Storage::computeCheckValue(AT_FDCWD, copy.data.c_str(), actual) == STATUS_OK &&
+                 Storage::readCheckValue(AT_FDCWD, copy.check.c_str(), stored) == STATUS_OK && actual == stored &&
                  ::stat(copy.check.c_str(), &status) == 0;
     if (copy.valid) copy.checkTime = status.st_mtim;
     return copy;
@@ -60,7 +60,7 @@ bool fail(const char* what, const fs::path& path) {
 // under a temporary name, dated after the current copy, renamed into place.
 bool commit(const Copy& copy, const timespec& previous) {
     uint64_t value = 0;
-    if (Storage::computeCheckValue(copy.data, value) != STATUS_OK) return fail("check value of", copy.data);
+    if (Storage::computeCheckValue(AT_FDCWD, copy.data.c_str(), value) != STATUS_OK) return fail("check value of", copy.data);
     uint8_t bytes[kCheckValueSize];
     Storage::encodeCheckValue(value, bytes);
     const fs::path tmp = copy.check.string() + ".tmp";

@@ -1,5 +1,6 @@
 #include "lib/storage/check_value.h"
 
+#include <fcntl.h>
 #include <filesystem>
 
 #include <gtest/gtest.h>
@@ -36,7 +37,7 @@ TEST(ReferenceCrc32, MatchesTheStandardCheckValue) {
 TEST(ComputeCheckValue, AbsentFileIsAllOnes) {
     ScratchDir dir;
     uint64_t value = 0;
-    ASSERT_EQ(Storage::computeCheckValue(dir / "data", value), STATUS_OK);
+    ASSERT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "data").c_str(), value), STATUS_OK);
     EXPECT_EQ(value, 0xFFFFFFFFFFFFFFFFull);
     EXPECT_EQ(Storage::kAbsentBlobCheckValue, 0xFFFFFFFFFFFFFFFFull);
 }
@@ -45,7 +46,7 @@ TEST(ComputeCheckValue, EmptyFileIsZero) {
     ScratchDir dir;
     writeBytes(dir / "data", {});
     uint64_t value = 1;
-    ASSERT_EQ(Storage::computeCheckValue(dir / "data", value), STATUS_OK);
+    ASSERT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "data").c_str(), value), STATUS_OK);
     EXPECT_EQ(value, 0u);
 }
 
@@ -53,7 +54,7 @@ TEST(ComputeCheckValue, KnownTextGivesSizeAndCrc) {
     ScratchDir dir;
     writeBytes(dir / "data", bytesOf("123456789"));
     uint64_t value = 0;
-    ASSERT_EQ(Storage::computeCheckValue(dir / "data", value), STATUS_OK);
+    ASSERT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "data").c_str(), value), STATUS_OK);
     EXPECT_EQ(value, 0xCBF4392600000009ull);
 }
 
@@ -65,7 +66,7 @@ TEST_P(ComputeCheckValueSizes, MatchesTheReferenceLayout) {
     const Bytes data = patternBytes(GetParam(), static_cast<uint32_t>(GetParam()));
     writeBytes(dir / "data", data);
     uint64_t value = 0;
-    ASSERT_EQ(Storage::computeCheckValue(dir / "data", value), STATUS_OK);
+    ASSERT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "data").c_str(), value), STATUS_OK);
     EXPECT_EQ(value, littleEndian(expectedCheckFile(data)));
 }
 
@@ -77,7 +78,7 @@ TEST(ComputeCheckValue, UnreadableDataFails) {
     ScratchDir dir;
     std::filesystem::create_directory(dir / "data");  // opens, but cannot be read
     uint64_t value = 7;
-    EXPECT_EQ(Storage::computeCheckValue(dir / "data", value), STATUS_FAILED);
+    EXPECT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "data").c_str(), value), STATUS_FAILED);
     EXPECT_EQ(value, 7u);
 }
 
@@ -85,7 +86,7 @@ TEST(ComputeCheckValue, DataBelowAFileFails) {
     ScratchDir dir;
     writeBytes(dir / "file", bytesOf("x"));
     uint64_t value = 7;
-    EXPECT_EQ(Storage::computeCheckValue(dir / "file" / "data", value), STATUS_FAILED);
+    EXPECT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "file" / "data").c_str(), value), STATUS_FAILED);
     EXPECT_EQ(value, 7u);
 }
 
@@ -93,7 +94,7 @@ TEST(ReadCheckValue, EightBytesAreLittleEndian) {
     ScratchDir dir;
     writeBytes(dir / "data.chk", {0x01, 0x02, 0x03, 0x04, 0x05, 0x06, 0x07, 0x88});
     uint64_t value = 0;
-    ASSERT_EQ(Storage::readCheckValue(dir / "data.chk", value), STATUS_OK);
+    ASSERT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value), STATUS_OK);
     EXPECT_EQ(value, 0x8807060504030201ull);
 }
 
@@ -101,7 +102,7 @@ TEST(ReadCheckValue, AllOnes) {
     ScratchDir dir;
     writeBytes(dir / "data.chk", absentCheckFile());
     uint64_t value = 0;
-    ASSERT_EQ(Storage::readCheckValue(dir / "data.chk", value), STATUS_OK);
+    ASSERT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value), STATUS_OK);
     EXPECT_EQ(value, Storage::kAbsentBlobCheckValue);
 }
 
@@ -109,7 +110,7 @@ TEST(ReadCheckValue, MissingFileIsNotFound) {
     ScratchDir dir;
     uint64_t value = 7;
     Storage::CheckTime time{true, {1, 1}};
-    EXPECT_EQ(Storage::readCheckValue(dir / "data.chk", value, &time), STATUS_NOT_FOUND);
+    EXPECT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value, &time), STATUS_NOT_FOUND);
     EXPECT_EQ(value, 7u);
     EXPECT_FALSE(time.known);
 }
@@ -118,7 +119,7 @@ TEST(ReadCheckValue, BelowAFileFails) {
     ScratchDir dir;
     writeBytes(dir / "file", bytesOf("x"));
     uint64_t value = 7;
-    EXPECT_EQ(Storage::readCheckValue(dir / "file" / "data.chk", value), STATUS_FAILED);
+    EXPECT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "file" / "data.chk").c_str(), value), STATUS_FAILED);
     EXPECT_EQ(value, 7u);
 }
 
@@ -128,7 +129,7 @@ TEST(ReadCheckValue, ReportsTheModificationTimeToTheNanosecond) {
     setMtimeNs(dir / "data.chk", kPast + 123456789);
     uint64_t value = 0;
     Storage::CheckTime time;
-    ASSERT_EQ(Storage::readCheckValue(dir / "data.chk", value, &time), STATUS_OK);
+    ASSERT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value, &time), STATUS_OK);
     EXPECT_TRUE(time.known);
     EXPECT_EQ(time.time.tv_sec, kPast / kSecond);
     EXPECT_EQ(time.time.tv_nsec, kPast % kSecond + 123456789);
@@ -142,7 +143,7 @@ TEST(ReadCheckValue, ReportsTheTimeOfABadCheckFileToo) {
     setMtimeNs(dir / "data.chk", kPast);
     uint64_t value = 7;
     Storage::CheckTime time;
-    EXPECT_EQ(Storage::readCheckValue(dir / "data.chk", value, &time), STATUS_FAILED);
+    EXPECT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value, &time), STATUS_FAILED);
     EXPECT_EQ(value, 7u);
     EXPECT_TRUE(time.known);
     EXPECT_EQ(time.time.tv_sec, kPast / kSecond);
@@ -165,7 +166,7 @@ TEST_P(ReadCheckValueClockEdge, TimesBeyondTheFileClockAreUnknown) {
     if (mtimeNs(dir / "data.chk") != GetParam().mtimeNs) GTEST_SKIP() << "the file system cannot hold this time";
     uint64_t value = 0;
     Storage::CheckTime time;
-    ASSERT_EQ(Storage::readCheckValue(dir / "data.chk", value, &time), STATUS_OK);
+    ASSERT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value, &time), STATUS_OK);
     EXPECT_EQ(time.known, GetParam().known);
 
     std::error_code error;
@@ -209,7 +210,7 @@ TEST(ReadCheckValue, DirectoryFails) {
     ScratchDir dir;
     std::filesystem::create_directory(dir / "data.chk");
     uint64_t value = 7;
-    EXPECT_EQ(Storage::readCheckValue(dir / "data.chk", value), STATUS_FAILED);
+    EXPECT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value), STATUS_FAILED);
     EXPECT_EQ(value, 7u);
 }
 
@@ -219,7 +220,7 @@ TEST_P(ReadCheckValueLength, OnlyEightBytesAreGood) {
     ScratchDir dir;
     writeBytes(dir / "data.chk", Bytes(GetParam(), 0x00));
     uint64_t value = 7;
-    const Status status = Storage::readCheckValue(dir / "data.chk", value);
+    const Status status = Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value);
     if (GetParam() == 8) {
         EXPECT_EQ(status, STATUS_OK);
         EXPECT_EQ(value, 0u);
@@ -243,7 +244,7 @@ TEST(EncodeCheckValue, RoundTripsThroughAFile) {
     const Bytes data = patternBytes(300, 3);
     writeBytes(dir / "data", data);
     uint64_t value = 0;
-    ASSERT_EQ(Storage::computeCheckValue(dir / "data", value), STATUS_OK);
+    ASSERT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "data").c_str(), value), STATUS_OK);
     uint8_t bytes[Storage::kCheckValueSize] = {};
     Storage::encodeCheckValue(value, bytes);
     EXPECT_EQ(Bytes(bytes, bytes + 8), expectedCheckFile(data));

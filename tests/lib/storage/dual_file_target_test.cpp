@@ -1184,7 +1184,10 @@ TEST_F(DualFileStore, UnremovableCheckPathFailsTheWrite) {
     EXPECT_EQ(reopened(), holding(bytesOf("older")));
 }
 
-TEST_F(DualFileStore, UnusableCopyDirectoryFailsEveryUpdate) {
+// A link where a copy directory should be is never followed: the copy is
+// invalid at opening (its check file cannot be reached to remove it), and
+// every update of it fails with ENOTDIR without creating anything.
+TEST_F(DualFileStore, LinkedCopyDirectoryFailsEveryUpdate) {
     {
         auto target = open();
         EXPECT_EQ(write(slotOf(*target), bytesOf("kept")), STATUS_OK);  // copy 1
@@ -1202,29 +1205,26 @@ TEST_F(DualFileStore, UnusableCopyDirectoryFailsEveryUpdate) {
         std::printf("writeAt %u\n", slot.writeAt(1, blob.data(), blob.size()));
         std::printf("erase %u\n", slot.erase());
         std::printf("beginWrite %u\n", slot.beginWrite());
-        std::printf("writeAt %u\n", slot.writeAt(0, blob.data(), blob.size()));
         std::printf("finalise %u\n", slot.finalise());
         std::printf("%s\n", hex(contentOf(slot).data).c_str());
         return 0;
     });
-    const std::string dataPath = (copyDir(1) / "data").string();
-    EXPECT_EQ(result.out,
-              "lib/storage/storage_target:410 17\n"
-              "libcommon/lib/util/fd:14 Failed to open " + dataPath + ": No such file or directory\n"
-              "write 52\n"
-              "[lib/storage/storage_target:192] err_code = 17 (<unknown>)\n"
-              "writeAt 17\n"
-              "[lib/storage/storage_target:427] err_code = 17 (<unknown>)\n"
-              "erase 17\n"
-              "beginWrite 0\n"
-              "lib/storage/storage_target:410 17\n"
-              "libcommon/lib/util/fd:14 Failed to open " + dataPath + ": No such file or directory\n"
-              "writeAt 52\n"
-              "libcommon/lib/util/fd:14 Failed to open " + dataPath + ".chk.tmp: No such file or directory\n"
-              "lib/storage/storage_target:461 finalise: write failed: 9: Bad file descriptor\n"
-              "finalise 52\n" +
-                  hex(bytesOf("current")) + "\n");
+    const std::string invalidated = "lib/storage/storage_target:378 generic:20\n";
+    EXPECT_EQ(result.out, "lib/storage/storage_target:334 Failure cleaning up checkfile \"" +
+                              (copyDir(1) / "data.chk").string() + "\"\n" + invalidated +
+                              "lib/storage/storage_target:410 20\n"
+                              "write 20\n" +
+                              invalidated +
+                              "[lib/storage/storage_target:192] err_code = 20 (<unknown>)\n"
+                              "writeAt 20\n" +
+                              invalidated +
+                              "erase 20\n"
+                              "beginWrite 20\n"
+                              "finalise 95\n" +
+                              hex(bytesOf("current")) + "\n");
     EXPECT_EQ(reopened(), holding(bytesOf("current")));
+    EXPECT_FALSE(fs::exists(dir / "nowhere"));
+    EXPECT_TRUE(fs::is_symlink(copyDir(1)));
 }
 
 // A directory in place of the transient file: it can be neither opened nor
@@ -1263,11 +1263,13 @@ TEST_F(DualFileStore, DirectoryFailuresAreShownAtInfoLevel) {
     const auto result = runInChild([&] {
         setLogOutput(LOG_OUTPUT_STDOUT);
         setLogLevel(LOG_PRIORITY_INFO);
-        std::printf("erase %u\n", slotOf(*target).erase());
+        const Bytes block = bytesOf("block");
+        std::printf("writeAt %u\n", slotOf(*target).writeAt(0, block.data(), block.size()));
         return 0;
     });
-    EXPECT_EQ(result.out, "Failed to create \"" + copyDir(1).string() +
-                              "\" File exists\n[lib/storage/storage_target:427] err_code = 17 (<unknown>)\nerase 17\n");
+    EXPECT_EQ(result.out, "lib/storage/storage_target:378 generic:20\nFailed to create \"" + copyDir(1).string() +
+                              "\" Not a directory\n[lib/storage/storage_target:192] err_code = 20 (<unknown>)\n"
+                              "writeAt 20\n");
 }
 
 // ---- resources ----

@@ -1,0 +1,134 @@
+#include "lib/storage/slot_directories.h"
+
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+#include <iomanip>
+#include <sys/stat.h>
+#include <unistd.h>
+#include <utility>
+
+#include "lib/storage/untrusted_tree.h"
+#include "lib/util/log.h"
+
+namespace Storage {
+namespace fs = std::filesystem;
+namespace {
+
+constexpr const char* kCopyNames[2] = {"1", "2"};
+
+CopyDirectory reached(int fd) {
+    CopyDirectory directory;
+    directory.fd = fd;
+    return directory;
+}
+
+CopyDirectory notReached(int error, bool missing) {
+    CopyDirectory directory;
+    directory.error = error;
+    directory.missing = missing;
+    return directory;
+}
+
+// Opens (with `create`: makes) the directory `name` in `parent` into `out`,
+// unless an earlier call of the same operation did.
+CopyDirectory reachBelow(const CopyDirectory& parent, const char* name, bool create, UniqueFd& out) {
+    if (out) return reached(out.get());
+    if (parent.fd < 0) return parent;
+    out = create ? makeDirectoryAt(parent.fd, name) : openDirectoryAt(parent.fd, name);
+    if (out) return reached(out.get());
+    const int error = errno;
+    return notReached(error, error == ENOENT || (create && !entryExists(parent.fd, name)));
+}
+
+}  // namespace
+
+Status CopyDirectory::computeCheck(uint64_t& value) const {
+    if (fd >= 0) return computeCheckValue(fd, kDataName, value);
+    if (!missing) return STATUS_FAILED;
+    value = kAbsentBlobCheckValue;
+    return STATUS_OK;
+}
+
+bool CopyDirectory::dataMatches(uint64_t stored) const {
+    if (fd >= 0) return matchesCheckValue(fd, kDataName, stored);
+    return missing && stored == kAbsentBlobCheckValue;
+}
+
+Status CopyDirectory::readCheck(uint64_t& value, CheckTime* modified) const {
+    if (fd >= 0) return readCheckValue(fd, kCheckName, value, modified);
+    if (modified != nullptr) *modified = CheckTime{};
+    return missing ? STATUS_NOT_FOUND : STATUS_FAILED;
+}
+
+CheckTime CopyDirectory::checkTime() const {
+    struct stat status {};
+    if (fd < 0 || ::fstatat(fd, kCheckName, &status, AT_SYMLINK_NOFOLLOW) != 0 || !S_ISREG(status.st_mode)) {
+        return CheckTime{};
+    }
+    return checkTimeOf(status);
+}
+
+int CopyDirectory::remove(const char* name) const {
+    if (fd < 0) return missing ? 0 : error;
+    // An empty directory goes too, as std::filesystem::remove would take it.
+    if (::unlinkat(fd, name, 0) == 0 || errno == ENOENT) return 0;
+    if (errno != EISDIR) return errno;
+    return ::unlinkat(fd, name, AT_REMOVEDIR) == 0 ? 0 : errno;
+}
+
+UniqueFd CopyDirectory::open(const char* name, int flags, mode_t mode) const {
+    if (fd >= 0) return openRegularAt(fd, name, flags, mode);
+    errno = missing ? ENOENT : error;
+    return UniqueFd();
+}
+
+bool CopyDirectory::holds(const char* name) const { return fd >= 0 && entryExists(fd, name); }
+
+SlotDirectories::SlotDirectories(fs::path basePath, std::string slotName, int base)
+    : basePath_(std::move(basePath)), slotName_(std::move(slotName)), borrowedBase_(base) {}
+
+CopyDirectory SlotDirectories::open(unsigned copy) { return reach(copy, false); }
+
+CopyDirectory SlotDirectories::ensure(unsigned copy) {
+    const CopyDirectory directory = reach(copy, true);
+    if (directory.fd < 0) {
+        LOGI << "Failed to create " << std::quoted(copyPath(copy).string()) << " " << std::strerror(directory.error);
+    }
+    return directory;
+}
+
+fs::path SlotDirectories::copyPath(unsigned copy) const {
+    return (slotName_.empty() ? basePath_ : basePath_ / slotName_) / kCopyNames[copy];
+}
+
+CopyDirectory SlotDirectories::reach(unsigned copy, bool create) {
+    return reachBelow(reachSlot(create), kCopyNames[copy], create, copies_[copy]);
+}
+
+CopyDirectory SlotDirectories::reachSlot(bool create) {
+    if (slotName_.empty()) return reachBase(create);
+    return reachBelow(reachBase(create), slotName_.c_str(), create, slot_);
+}
+
+CopyDirectory SlotDirectories::reachBase(bool create) {
+    if (borrowedBase_ >= 0) return reached(borrowedBase_);
+    if (!base_) {
+        // Followed if it is a link: the base is the integrator's, not the applications'.
+        const auto openBase = [&] { base_.reset(::open(basePath_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC)); };
+        openBase();
+        if (!base_ && errno == ENOENT && create) {
+            std::error_code error;
+            fs::create_directories(basePath_, error);
+            if (error) return notReached(static_cast<int>(statusFromError(error)), true);
+            openBase();
+        }
+        if (!base_) {
+            const int error = errno;
+            return notReached(error, error == ENOENT);
+        }
+    }
+    return reached(base_.get());
+}
+
+}  // namespace Storage

@@ -1,0 +1,91 @@
+// The directories of one dual-file slot, as one operation reaches them.
+//
+// The base directory is opened by its path and may be a link: where the
+// stores live is the integrator's choice. Below it less trusted code can
+// write, so the slot directory of a multi-slot target and the copy
+// directories "1" and "2" are opened one component at a time without
+// following a link, and every file in them is reached relative to its
+// directory's descriptor (untrusted_tree.h). A link, or anything but a
+// directory, where a directory should be fails with ENOTDIR.
+//
+// Each operation makes its own SlotDirectories: names are resolved afresh,
+// once per operation, and every descriptor is closed when it returns.
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <filesystem>
+#include <string>
+
+#include "lib/storage/check_value.h"
+#include "lib/util/fd.h"
+#include "lib/util/status.h"
+
+namespace Storage {
+
+// The names inside a copy directory.
+constexpr const char* kDataName = "data";
+constexpr const char* kCheckName = "data.chk";
+constexpr const char* kTransientName = "data.chk.tmp";
+
+// A copy's directory as far as an operation could reach it.
+struct CopyDirectory {
+    int fd = -1;           // borrowed from the SlotDirectories
+    int error = 0;         // why fd is -1: the errno
+    bool missing = false;  // fd is -1 because it, or one above it, does not exist
+
+    // The check value of the data file (check_value.h). A missing directory
+    // holds no data file; an unusable one gives STATUS_FAILED.
+    [[nodiscard]] Status computeCheck(uint64_t& value) const;
+    // The data file has the check value `stored` (matchesCheckValue).
+    bool dataMatches(uint64_t stored) const;
+    // The stored check value (check_value.h): STATUS_NOT_FOUND in a missing
+    // directory, STATUS_FAILED in an unusable one.
+    [[nodiscard]] Status readCheck(uint64_t& value, CheckTime* modified) const;
+    // The modification time of the check file; unknown unless it is a
+    // regular file.
+    CheckTime checkTime() const;
+    // Removes the entry `name`: a file, a link (itself, never followed) or
+    // an empty directory. 0 when done or when there is nothing to remove,
+    // else the errno.
+    int remove(const char* name) const;
+    // openRegularAt in this directory; errno is ENOENT when the directory is
+    // missing and its own error when it is unusable.
+    UniqueFd open(const char* name, int flags, mode_t mode = 0) const;
+    // An entry `name` of any kind is there.
+    bool holds(const char* name) const;
+};
+
+class SlotDirectories {
+public:
+    // `slotName` is empty when the slot lives in the base directory itself.
+    // `base`, when not negative, is an open descriptor of the base
+    // directory, borrowed, used instead of opening it again.
+    SlotDirectories(std::filesystem::path basePath, std::string slotName, int base = -1);
+    SlotDirectories(SlotDirectories&&) = default;
+    SlotDirectories& operator=(SlotDirectories&&) = delete;
+
+    // The directory of copy 0 ("1") or copy 1 ("2") if it exists.
+    CopyDirectory open(unsigned copy);
+    // The same, first making whatever is missing (the base with its
+    // parents, mode 0777 less the umask). A failure is logged at info
+    // priority as "Failed to create <quoted copy directory> <message>".
+    CopyDirectory ensure(unsigned copy);
+
+    // The copy directory's path, for messages.
+    std::filesystem::path copyPath(unsigned copy) const;
+
+private:
+    CopyDirectory reach(unsigned copy, bool create);
+    CopyDirectory reachSlot(bool create);
+    CopyDirectory reachBase(bool create);
+
+    std::filesystem::path basePath_;
+    std::string slotName_;
+    int borrowedBase_;
+    UniqueFd base_;
+    UniqueFd slot_;
+    std::array<UniqueFd, 2> copies_;
+};
+
+}  // namespace Storage

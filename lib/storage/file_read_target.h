@@ -1,6 +1,11 @@
 // Read-only access to files below one base directory. Slots are opened by
 // name with addSlot, get a fresh index each (indices are not reused until
 // the 32-bit counter wraps) and keep their file open until removed.
+//
+// The bases are the device's own partitions, which applications cannot
+// write, and nothing is ever written here: names may be links and are
+// followed. Opening never waits, though: a FIFO opens at once and, like a
+// directory, then has no file size.
 #pragma once
 
 #include <filesystem>
@@ -25,7 +30,7 @@ public:
     // Opens basePath/name (an absolute name replaces the base). STATUS_FAILED
     // after logging the open failure. The size query throws
     // std::filesystem::filesystem_error for a name that opens but has no
-    // file size, such as a directory.
+    // file size, such as a directory or a FIFO.
     Status addSlot(const char* name, size_t& index, size_t& size) override;
     // STATUS_INVALID_PARAMETER for an index that is not open.
     Status removeSlot(size_t index) override;

@@ -318,7 +318,8 @@ SlotHandle FileReadTarget::getSlot(size_t index) {
 
 Status FileReadTarget::addSlot(const char* name, size_t& index, size_t& size) {
     const fs::path path = basePath_ / name;
-    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    // O_NONBLOCK: a FIFO opens at once instead of waiting for a writer.
+    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
     if (!fd) {
         logOpenFailure(path.c_str(), errno);
         return STATUS_FAILED;
@@ -549,7 +550,9 @@ Status FirmwareUpdateBootTarget::Slot::beginWrite() {
     if (!receive_) return STATUS_FAILED;
     LOGW << "Opened " << temporaryPath_ << " for receiving firmware";
     // The data lives only behind the descriptor from here on, so nothing is
-    // left in /tmp whatever happens later.
+    // left in /tmp whatever happens later. mkostemp made the name with
+    // O_EXCL, and in the sticky /tmp nobody else can replace it before this
+    // removal.
     (void)::unlink(temporaryPath_.c_str());
     return STATUS_OK;
 }
@@ -633,6 +636,9 @@ Status FirmwareUpdateBootTarget::Slot::writeDestination() {
     for (int attempt = 1;; ++attempt) {
         LOGI << "Opening " << std::quoted(destination_.string()) << " for write";
         Status status = STATUS_FAILED;
+        // By its fixed path: the boot partition is mounted read-only and
+        // only root remounts it, so nothing less trusted can have put a
+        // link or a FIFO there.
         UniqueFd file = openFd(destination_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, kFileMode);
         if (!file) {
             LOGE << "Failed to open BOOT.BIN for writing\n";

@@ -54,9 +54,9 @@ bool isSfdiskComplaint(const std::string& line) {
 
 }  // namespace
 
-ProcessResult runTool(std::vector<std::string> args) {
+ProcessResult runTool(std::vector<std::string> args, unsigned timeLimitSeconds) {
     args.insert(args.begin(), kBinary);
-    return testing_support::runProgram(args);
+    return testing_support::runProgram(args, {}, timeLimitSeconds);
 }
 
 Host currentHost() {

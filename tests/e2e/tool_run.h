@@ -19,8 +19,10 @@ using testing_support::ProcessResult;
 
 extern const std::string kBinary;
 
-// Runs the tool with `args` after its own path; the result as it came.
-ProcessResult runTool(std::vector<std::string> args);
+// Runs the tool with `args` after its own path; the result as it came. With
+// a time limit, a run still going after that many seconds is ended by
+// SIGALRM.
+ProcessResult runTool(std::vector<std::string> args, unsigned timeLimitSeconds = 0);
 
 // Where a run happens decides what building the registry logs: the
 // boot-vector target reads its record from "/dev/mmcblk0" on every run.

@@ -66,9 +66,12 @@ const std::vector<std::string>& programEmulator() {
 
 namespace {
 
-ProcessResult execute(const std::vector<std::string>& command, const std::map<std::string, std::string>& extraEnv) {
+ProcessResult execute(const std::vector<std::string>& command, const std::map<std::string, std::string>& extraEnv,
+                      unsigned timeLimitSeconds = 0) {
     return runCaptured([&] {
         for (const auto& [name, value] : extraEnv) setenv(name.c_str(), value.c_str(), 1);
+        // A pending alarm survives the exec; its default action ends the program.
+        if (timeLimitSeconds != 0) alarm(timeLimitSeconds);
         std::vector<char*> args;
         for (const auto& arg : command) args.push_back(const_cast<char*>(arg.c_str()));
         args.push_back(nullptr);
@@ -79,10 +82,11 @@ ProcessResult execute(const std::vector<std::string>& command, const std::map<st
 
 }  // namespace
 
-ProcessResult runProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& extraEnv) {
+ProcessResult runProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& extraEnv,
+                         unsigned timeLimitSeconds) {
     std::vector<std::string> command = programEmulator();
     command.insert(command.end(), argv.begin(), argv.end());
-    return execute(command, extraEnv);
+    return execute(command, extraEnv, timeLimitSeconds);
 }
 
 // The host's own shell: never through the emulator.

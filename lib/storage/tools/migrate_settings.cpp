@@ -33,7 +33,8 @@ Status readMigrationData(const std::string& fileName, Block& out) {
         return statusFromError(error);
     }
     out.resize(size);
-    const UniqueFd fd(::open(fileName.c_str(), O_RDONLY | O_CLOEXEC));
+    // A FIFO put there since the size query reads as an error, never waits.
+    const UniqueFd fd(::open(fileName.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
     if (!fd) return STATUS_FAILED;
     for (size_t done = 0; done < out.size();) {
         const ssize_t count = ::read(fd.get(), out.data() + done, out.size() - done);

@@ -6,6 +6,8 @@
 #include <dirent.h>
 #include <filesystem>
 #include <string>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -251,6 +253,26 @@ TEST_F(FileReadTargetTest, DirectoryOpensButItsSizeThrows) {
     // The directory's descriptor did not stay open, and no index was used.
     EXPECT_EQ(openDescriptorCount(), descriptorsBefore);
     EXPECT_EQ(add(target, "first.bin", first.size()), 0u);
+}
+
+// A FIFO opens at once instead of waiting for a writer (the child would be
+// ended by its alarm), and then has no file size, like a directory.
+TEST_F(FileReadTargetTest, FifoNeverWaitsAndItsSizeThrows) {
+    ASSERT_EQ(::mkfifo((base() / "fifo").c_str(), 0666), 0);
+    const auto result = runInChild([&] {
+        ::alarm(20);
+        FileReadTarget target(base());
+        size_t index = kUnset;
+        size_t size = kUnset;
+        try {
+            (void)target.addSlot("fifo", index, size);
+        } catch (const fs::filesystem_error&) {
+            return target.getSlotCount() == 0 && index == kUnset ? 0 : 2;
+        }
+        return 1;
+    });
+    EXPECT_EQ(result.signal, 0) << "waited on the FIFO";
+    EXPECT_EQ(result.exitStatus, 0);
 }
 
 TEST_F(FileReadTargetTest, RemoveAllSlotsKeepsTheCounter) {

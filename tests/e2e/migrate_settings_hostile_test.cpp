@@ -1,0 +1,189 @@
+// The real migrate_settings, as root, over stores into which a less trusted
+// program has planted links, FIFOs, sockets, device nodes and directories:
+// no run writes outside the base directory or waits, and each one either
+// stores the blob or fails.
+#include <csignal>
+#include <filesystem>
+#include <iterator>
+#include <string>
+#include <sys/stat.h>
+#include <tuple>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "hostile_tree.h"
+#include "scratch_dir.h"
+#include "tool_run.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using e2e::Bytes;
+using e2e::concat;
+using e2e::ProcessResult;
+using testing_support::Plant;
+
+// Long enough for an emulated run; a wait never ends by itself.
+constexpr unsigned kTimeLimitSeconds = 30;
+
+class HostileStores : public ::testing::Test {
+protected:
+    HostileStores() { fs::create_directory(inputs); }
+
+    testing_support::ScratchDir scratch;
+    const fs::path base = scratch / "base";
+    const fs::path inputs = scratch / "inputs";
+    const testing_support::Victims victims{scratch / "victims"};
+
+    std::string dataFile(const std::string& name, const Bytes& bytes) {
+        testing_support::writeBytes(inputs / name, bytes);
+        return (inputs / name).string();
+    }
+
+    ProcessResult run(const std::vector<std::string>& args) const {
+        return e2e::runTool(concat({"--base", base.string()}, args), kTimeLimitSeconds);
+    }
+
+    // Everything outside the base directory and the data files.
+    std::string outside() const { return testing_support::snapshotTree(scratch.path(), {"base", "inputs"}); }
+
+    void plant(const std::string& relative, Plant what) {
+        std::string reason;
+        if (!testing_support::plantAt(base / relative, what, victims, reason)) GTEST_SKIP() << reason;
+    }
+};
+
+void expectFinished(const ProcessResult& result) {
+    EXPECT_NE(result.signal, SIGALRM) << "still running after " << kTimeLimitSeconds << " s";
+    EXPECT_EQ(result.signal, 0) << result.out << result.err;
+}
+
+// A link planted at the data file that the next migration writes used to
+// make that migration write the blob into the link's target.
+TEST_F(HostileStores, LinkAtTheOtherCopysDataIsNeverWrittenThrough) {
+    plant("settings/2/data", Plant::kLinkToFile);
+    const std::string before = outside();
+    const std::string blob = dataFile("blob", e2e::pattern(100, 1));
+
+    const ProcessResult result = run({"--target", "settings", "--type", "simple", "--data", blob});
+    expectFinished(result);
+    EXPECT_EQ(result.exitStatus, 1);
+    EXPECT_NE(result.out.find("Failed to open " + (base / "settings/2/data").string() +
+                              ": Too many levels of symbolic links\n"),
+              std::string::npos)
+        << result.out;
+    EXPECT_EQ(outside(), before);
+    EXPECT_TRUE(fs::is_symlink(base / "settings/2/data"));
+    EXPECT_EQ(run({"--target", "settings", "--query-present"}).exitStatus, 10);
+}
+
+// A FIFO planted in one store used to make every run wait forever while
+// the registry opened the stores, whatever the target.
+TEST_F(HostileStores, FifoInOneStoreNeverHoldsUpARun) {
+    plant("app/internal/2/data", Plant::kFifo);
+    const std::string before = outside();
+    for (const char* target : {"settings", "lut", "overlay", "calib_save", "calib_extra", "util_save",
+                               "application_internal", "reboot_persistent"}) {
+        SCOPED_TRACE(target);
+        const ProcessResult query = run({"--target", target, "--query-present"});
+        expectFinished(query);
+        EXPECT_EQ(query.exitStatus, 10);
+    }
+    const std::string blob = dataFile("blob", e2e::pattern(100, 2));
+    const ProcessResult elsewhere = run({"--target", "settings", "--type", "simple", "--data", blob});
+    expectFinished(elsewhere);
+    EXPECT_EQ(elsewhere.exitStatus, 0) << elsewhere.out;
+    EXPECT_EQ(run({"--target", "settings", "--query-present"}).exitStatus, 0);
+
+    // The FIFO is where this migration would write: it fails at once.
+    const ProcessResult into = run({"--target", "application_internal", "--type", "simple", "--data", blob});
+    expectFinished(into);
+    EXPECT_EQ(into.exitStatus, 1);
+    EXPECT_NE(into.out.find("Failed to open " + (base / "app/internal/2/data").string() +
+                            ": No such device or address\n"),
+              std::string::npos)
+        << into.out;
+    EXPECT_EQ(outside(), before);
+}
+
+// The data file is the script's to choose, yet a FIFO there is refused at
+// once rather than waited on.
+TEST_F(HostileStores, FifoAsTheDataFileIsRefusedAtOnce) {
+    const fs::path fifo = inputs / "fifo";
+    ASSERT_EQ(::mkfifo(fifo.c_str(), 0666), 0);
+    const ProcessResult result = run({"--target", "settings", "--type", "simple", "--data", fifo.string()});
+    expectFinished(result);
+    EXPECT_EQ(result.exitStatus, 1);
+    EXPECT_NE(result.out.find("lib/storage/tools/migrate_settings:494 Failed to open '" + fifo.string() + "'\n"),
+              std::string::npos)
+        << result.out;
+}
+
+// Places the tool's stores touch: a path below the base directory, and
+// the target and slot whose migrations reach it.
+struct Place {
+    const char* name;
+    const char* relative;
+    const char* target;
+    const char* index;
+};
+
+const Place kPlaces[] = {
+    {"copy0_data", "settings/1/data", "settings", "0"},
+    {"copy0_check", "settings/1/data.chk", "settings", "0"},
+    {"copy0_tmp", "settings/1/data.chk.tmp", "settings", "0"},
+    {"copy0_directory", "settings/1", "settings", "0"},
+    {"copy1_data", "settings/2/data", "settings", "0"},
+    {"copy1_check", "settings/2/data.chk", "settings", "0"},
+    {"copy1_tmp", "settings/2/data.chk.tmp", "settings", "0"},
+    {"copy1_directory", "settings/2", "settings", "0"},
+    {"slot_directory", "app/luts/3", "lut", "3"},
+};
+
+class HostileStoreSweep : public HostileStores, public ::testing::WithParamInterface<std::tuple<size_t, Plant>> {
+protected:
+    const Place& place() const { return kPlaces[std::get<0>(GetParam())]; }
+    std::vector<std::string> slotArgs() const { return {"--target", place().target, "--index", place().index}; }
+};
+
+// Two migrations (one into each copy) and a query, after two that filled
+// both copies: each run ends in time with 0 or 1 (10 or 0 for the query),
+// and the query agrees with the last migration that succeeded.
+TEST_P(HostileStoreSweep, MigrationsStayInsideTheBaseAndNeverWait) {
+    for (int filled = 0; filled < 2; ++filled) {
+        const std::string blob = dataFile("filled-" + std::to_string(filled), e2e::pattern(40 + filled, 10));
+        ASSERT_EQ(run(concat(slotArgs(), {"--type", "simple", "--data", blob})).exitStatus, 0);
+    }
+    plant(place().relative, std::get<1>(GetParam()));
+    if (IsSkipped()) return;
+    const std::string before = outside();
+
+    bool stored = false;
+    for (int round = 0; round < 2; ++round) {
+        const std::string blob = dataFile("blob-" + std::to_string(round), e2e::pattern(100 + round, 20));
+        const ProcessResult result = run(concat(slotArgs(), {"--type", "simple", "--data", blob}));
+        expectFinished(result);
+        EXPECT_TRUE(result.exitStatus == 0 || result.exitStatus == 1) << result.exitStatus;
+        stored = result.exitStatus == 0;
+    }
+    const ProcessResult query = run(concat(slotArgs(), {"--query-present"}));
+    expectFinished(query);
+    EXPECT_TRUE(query.exitStatus == 0 || query.exitStatus == 10) << query.exitStatus;
+    if (stored) {
+        EXPECT_EQ(query.exitStatus, 0);
+    }
+    EXPECT_EQ(outside(), before);
+}
+
+std::string caseName(const ::testing::TestParamInfo<HostileStoreSweep::ParamType>& info) {
+    return std::string(kPlaces[std::get<0>(info.param)].name) + "_" +
+                       testing_support::plantName(std::get<1>(info.param));
+}
+
+INSTANTIATE_TEST_SUITE_P(Planted, HostileStoreSweep,
+                         ::testing::Combine(::testing::Range<size_t>(0, std::size(kPlaces)),
+                                            ::testing::ValuesIn(testing_support::allPlants())),
+                         caseName);
+
+}  // namespace

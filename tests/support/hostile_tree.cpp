@@ -1,0 +1,148 @@
+#include "hostile_tree.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+#include <stdexcept>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include "files.h"
+
+namespace testing_support {
+namespace fs = std::filesystem;
+namespace {
+
+// Fixed, clearly past times: any write or creation would move them.
+constexpr time_t kVictimTime = 1262304000;  // 2010-01-01
+
+void setTimes(const fs::path& path) {
+    const struct timespec times[2] = {{kVictimTime, 0}, {kVictimTime, 0}};
+    if (::utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW) != 0) {
+        throw std::runtime_error("cannot date " + path.string() + ": " + std::strerror(errno));
+    }
+}
+
+void check(bool done, const std::string& what, const fs::path& path) {
+    if (!done) throw std::runtime_error(what + " " + path.string() + ": " + std::strerror(errno));
+}
+
+void makeSocket(const fs::path& where) {
+    const int listener = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    check(listener >= 0, "socket for", where);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    if (where.string().size() >= sizeof address.sun_path) {
+        ::close(listener);
+        throw std::runtime_error("socket path too long: " + where.string());
+    }
+    std::strcpy(address.sun_path, where.c_str());
+    const bool bound = ::bind(listener, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
+    ::close(listener);  // the socket file stays; nobody listens on it
+    check(bound, "bind", where);
+}
+
+std::string entryLine(const fs::path& path, const std::string& relative) {
+    struct stat status {};
+    check(::lstat(path.c_str(), &status) == 0, "lstat", path);
+    std::string line = relative + " mode=" + std::to_string(status.st_mode) +
+                       " mtime=" + std::to_string(status.st_mtim.tv_sec) + "." + std::to_string(status.st_mtim.tv_nsec);
+    if (S_ISREG(status.st_mode)) line += " bytes=" + hex(readBytes(path));
+    if (S_ISLNK(status.st_mode)) line += " target=" + fs::read_symlink(path).string();
+    if (S_ISCHR(status.st_mode) || S_ISBLK(status.st_mode)) line += " rdev=" + std::to_string(status.st_rdev);
+    return line;
+}
+
+}  // namespace
+
+const std::vector<Plant>& allPlants() {
+    static const std::vector<Plant> plants = {Plant::kLinkToFile, Plant::kLinkToDirectory, Plant::kDanglingLink,
+                                              Plant::kLinkLoop,   Plant::kFifo,            Plant::kSocket,
+                                              Plant::kDirectory,  Plant::kDeviceNode};
+    return plants;
+}
+
+std::string plantName(Plant plant) {
+    switch (plant) {
+        case Plant::kLinkToFile: return "link_to_file";
+        case Plant::kLinkToDirectory: return "link_to_directory";
+        case Plant::kDanglingLink: return "dangling_link";
+        case Plant::kLinkLoop: return "link_loop";
+        case Plant::kFifo: return "fifo";
+        case Plant::kSocket: return "socket";
+        case Plant::kDirectory: return "directory";
+        case Plant::kDeviceNode: return "device_node";
+    }
+    return "unknown";
+}
+
+Victims::Victims(const fs::path& directory)
+    : file_(directory / "victim-file"), directory_(directory / "victim-directory"), missing_(directory / "missing") {
+    fs::create_directory(directory);
+    writeText(file_, "victim bytes\n");
+    fs::create_directory(directory_);
+    writeText(directory_ / "inside", "inside the victim directory\n");
+    for (const fs::path& path : {directory_ / "inside", file_, directory_, directory}) setTimes(path);
+}
+
+bool plantAt(const fs::path& where, Plant plant, const Victims& victims, std::string& reason) {
+    fs::remove_all(where);
+    fs::create_directories(where.parent_path());
+    switch (plant) {
+        case Plant::kLinkToFile:
+            fs::create_symlink(victims.file(), where);
+            break;
+        case Plant::kLinkToDirectory:
+            fs::create_directory_symlink(victims.directory(), where);
+            break;
+        case Plant::kDanglingLink:
+            fs::create_symlink(victims.missing(), where);
+            break;
+        case Plant::kLinkLoop:
+            fs::create_symlink(where.filename(), where);
+            break;
+        case Plant::kFifo:
+            check(::mkfifo(where.c_str(), 0666) == 0, "mkfifo", where);
+            break;
+        case Plant::kSocket:
+            makeSocket(where);
+            break;
+        case Plant::kDirectory:
+            fs::create_directory(where);
+            writeText(where / "planted", "planted\n");
+            break;
+        case Plant::kDeviceNode:
+            if (::mknod(where.c_str(), S_IFCHR | 0666, makedev(1, 5)) != 0) {
+                reason = std::string("mknod: ") + std::strerror(errno) + " (needs CAP_MKNOD)";
+                return false;
+            }
+            break;
+    }
+    return true;
+}
+
+std::string snapshotTree(const fs::path& root, const std::vector<fs::path>& skipped) {
+    std::vector<std::string> lines = {entryLine(root, ".")};
+    for (auto it = fs::recursive_directory_iterator(root); it != fs::recursive_directory_iterator(); ++it) {
+        const fs::path relative = it->path().lexically_relative(root);
+        const bool skip = std::any_of(skipped.begin(), skipped.end(), [&](const fs::path& prefix) {
+            const auto mismatch = std::mismatch(prefix.begin(), prefix.end(), relative.begin(), relative.end());
+            return mismatch.first == prefix.end();
+        });
+        if (skip) {
+            it.disable_recursion_pending();
+            continue;
+        }
+        lines.push_back(entryLine(it->path(), relative.string()));
+    }
+    std::sort(lines.begin(), lines.end());
+    std::string text;
+    for (const auto& line : lines) text += line + "\n";
+    return text;
+}
+
+}  // namespace testing_support

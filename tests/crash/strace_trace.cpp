@@ -323,8 +323,11 @@ void TraceReader::apply(long pid, const Call& call) {
 
 }  // namespace
 
-std::vector<FsOp> parseStraceTrace(const std::string& trace, const std::string& root, std::set<std::string> existing) {
-    TraceReader reader(root, std::move(existing));
+namespace {
+
+// Calls `visit` with each call of `trace` (unfinished ones joined to their
+// resumption) and its process; a problem with a line is rethrown naming it.
+void forEachCall(const std::string& trace, const std::function<void(long, const Call&)>& visit) {
     std::map<long, std::string> unfinished;
     size_t start = 0;
     for (size_t number = 1; start < trace.size(); ++number) {
@@ -351,14 +354,93 @@ std::vector<FsOp> parseStraceTrace(const std::string& trace, const std::string& 
                 call = first->second + call.substr(resumed + 9);
                 unfinished.erase(first);
             }
-            reader.apply(pid, parseCall(call));
+            visit(pid, parseCall(call));
         } catch (const std::exception& problem) {
             // Lines carry whole writes: only their starts are shown.
             const std::string shown = line.size() > 200 ? line.substr(0, 200) + "..." : line;
             throw std::runtime_error("strace line " + std::to_string(number) + " \"" + shown + "\": " + problem.what());
         }
     }
+}
+
+// The name a call gives for a path, with the directory argument it is
+// relative to ("" for the working directory's calls that have none).
+struct Named {
+    std::string directoryArg;
+    std::string nameArg;
+};
+
+// Every path a call names; utimensat with a NULL path names none.
+std::vector<Named> namesOf(const Call& call) {
+    const std::string& name = call.name;
+    const std::vector<std::string>& args = call.args;
+    if (name == "open" || name == "creat" || name == "unlink" || name == "rmdir" || name == "mkdir" ||
+        name == "truncate" || name == "chmod") {
+        return {{"", args.at(0)}};
+    }
+    if (name == "rename") return {{"", args.at(0)}, {"", args.at(1)}};
+    if (name == "renameat" || name == "renameat2") return {{args.at(0), args.at(1)}, {args.at(2), args.at(3)}};
+    if (name == "utimensat" && args.at(1) == "NULL") return {};
+    if (name == "openat" || name == "unlinkat" || name == "mkdirat" || name == "utimensat" || name == "fchmodat") {
+        return {{args.at(0), args.at(1)}};
+    }
+    return {};
+}
+
+bool decimal(const std::string& component) {
+    return !component.empty() && component.find_first_not_of("0123456789") == std::string::npos;
+}
+
+// Why a call that names `named` below `root` could follow a link planted
+// there, or "".
+std::string followingProblem(const Call& call, const Named& named, const std::string& root) {
+    const std::string name = stringArg(named.nameArg);
+    const Described directory = described(named.directoryArg);
+    const bool absolute = !name.empty() && name.front() == '/';
+    const bool fromWorkingDirectory = absolute || !directory.hasPath || directory.head == "AT_FDCWD";
+    const std::string path = absolute ? name : directory.path + "/" + name;
+    if (path.rfind(root + "/", 0) != 0) return "";
+    const bool opens = call.name == "open" || call.name == "openat";
+    const std::string flags = opens ? call.args.at(call.name == "open" ? 1 : 2) : "";
+    if (fromWorkingDirectory) {
+        // Only the stores' own base directories, whose names are never numbers, are made or opened by path.
+        const bool directoryOnly = call.name == "mkdir" || call.name == "mkdirat" ||
+                                   (opens && hasFlag(flags, "O_DIRECTORY") && !hasFlag(flags, "O_CREAT"));
+        if (!directoryOnly) return "names a store entry by its path";
+        const std::string below = path.substr(root.size() + 1);
+        for (size_t start = 0, end = 0; end != std::string::npos; start = end + 1) {
+            end = below.find('/', start);
+            if (decimal(below.substr(start, end == std::string::npos ? std::string::npos : end - start))) {
+                return "reaches a slot or copy directory by its path";
+            }
+        }
+        return "";
+    }
+    if (name.find('/') != std::string::npos) return "names more than one component below a directory";
+    if (opens && !hasFlag(flags, "O_NOFOLLOW")) return "opens without O_NOFOLLOW";
+    if (call.name == "utimensat" && !hasFlag(call.args.at(3), "AT_SYMLINK_NOFOLLOW")) {
+        return "sets a time without AT_SYMLINK_NOFOLLOW";
+    }
+    return "";
+}
+
+}  // namespace
+
+std::vector<FsOp> parseStraceTrace(const std::string& trace, const std::string& root, std::set<std::string> existing) {
+    TraceReader reader(root, std::move(existing));
+    forEachCall(trace, [&](long pid, const Call& call) { reader.apply(pid, call); });
     return reader.takeOps();
+}
+
+std::vector<std::string> linkFollowingCalls(const std::string& trace, const std::string& root) {
+    std::vector<std::string> found;
+    forEachCall(trace, [&](long, const Call& call) {
+        for (const Named& named : namesOf(call)) {
+            const std::string problem = followingProblem(call, named, root);
+            if (!problem.empty()) found.push_back(call.name + "(" + stringArg(named.nameArg) + "): " + problem);
+        }
+    });
+    return found;
 }
 
 }  // namespace crash

@@ -41,4 +41,14 @@ extern const std::vector<std::string> kStraceOptions;
 std::vector<FsOp> parseStraceTrace(const std::string& trace, const std::string& root,
                                    std::set<std::string> existing);
 
+// The calls in `trace` (failed ones included) that name an entry below
+// `root` (absolute, without a final '/') in a way that could follow a link
+// planted there, one line each: anything named by its path (from the
+// working directory or absolute) but the making and opening of
+// directories whose names below `root` are not decimal numbers (slot and
+// copy directories are), a relative name of more than one component, an
+// open without O_NOFOLLOW, a utimensat of a name without
+// AT_SYMLINK_NOFOLLOW. Throws as parseStraceTrace.
+std::vector<std::string> linkFollowingCalls(const std::string& trace, const std::string& root);
+
 }  // namespace crash

@@ -125,3 +125,54 @@ TEST(StraceTrace, RejectsWhatItCannotFollowNamingTheLine) {
 }
 
 }  // namespace
+
+namespace {
+
+const std::string kStoreDir = fd("5", "/r/s/1");
+
+std::vector<std::string> following(const std::string& line) {
+    return crash::linkFollowingCalls("10 " + line + "\n", "/r/s");
+}
+
+// What the store does below its base: directories one component at a time
+// with O_NOFOLLOW, files relative to them with O_NOFOLLOW, removals,
+// renames and times on descriptors; the base itself and its parents by
+// path.
+TEST(LinkFollowingCalls, TheStoresOwnCallsPass) {
+    const std::string trace =
+        "10 mkdir(" + str("/r/s") + ", 0777) = 0\n" +
+        "10 openat(" + kCwd + ", " + str("/r/s") + ", O_RDONLY|O_CLOEXEC|O_DIRECTORY) = 4" + fd("", "/r/s") + "\n" +
+        "10 openat(" + fd("4", "/r/s") + ", " + str("1") + ", O_RDONLY|O_NOFOLLOW|O_CLOEXEC|O_DIRECTORY) = 5" +
+        fd("", "/r/s/1") + "\n" +
+        "10 mkdirat(" + fd("4", "/r/s") + ", " + str("2") + ", 0777) = 0\n" +
+        "10 openat(" + kStoreDir + ", " + str("data") + ", O_RDWR|O_CREAT|O_TRUNC|O_NOFOLLOW|O_CLOEXEC, 0666) = 6" +
+        fd("", "/r/s/1/data") + "\n" +
+        "10 unlinkat(" + kStoreDir + ", " + str("data.chk") + ", 0) = -1 ENOENT (No such file or directory)\n" +
+        "10 utimensat(" + fd("7", "/r/s/1/data.chk.tmp") + ", NULL, [UTIME_OMIT, {tv_sec=5, tv_nsec=0}], 0) = 0\n" +
+        "10 renameat(" + kStoreDir + ", " + str("data.chk.tmp") + ", " + kStoreDir + ", " + str("data.chk") +
+        ") = 0\n" +
+        // Outside the stores anything goes.
+        "10 openat(" + kCwd + ", " + str("/r/input") + ", O_RDONLY) = 8" + fd("", "/r/input") + "\n";
+    EXPECT_EQ(crash::linkFollowingCalls(trace, "/r/s"), std::vector<std::string>{});
+}
+
+TEST(LinkFollowingCalls, EveryWayAroundADescriptorIsCaught) {
+    EXPECT_EQ(following("openat(" + kCwd + ", " + str("/r/s/1/data") + ", O_RDONLY|O_NOFOLLOW) = 3"),
+              std::vector<std::string>{"openat(/r/s/1/data): names a store entry by its path"});
+    EXPECT_EQ(following("unlink(" + str("/r/s/1/data.chk") + ") = 0"),
+              std::vector<std::string>{"unlink(/r/s/1/data.chk): names a store entry by its path"});
+    EXPECT_EQ(following("openat(" + kCwd + ", " + str("s/7") + ", O_RDONLY|O_DIRECTORY) = 3"),
+              std::vector<std::string>{"openat(s/7): reaches a slot or copy directory by its path"});
+    EXPECT_EQ(following("mkdir(" + str("/r/s/app/2") + ", 0777) = 0"),
+              std::vector<std::string>{"mkdir(/r/s/app/2): reaches a slot or copy directory by its path"});
+    EXPECT_EQ(following("openat(" + fd("4", "/r/s") + ", " + str("1/data") + ", O_RDONLY|O_NOFOLLOW) = 3"),
+              std::vector<std::string>{"openat(1/data): names more than one component below a directory"});
+    EXPECT_EQ(following("openat(" + kStoreDir + ", " + str("data") + ", O_RDONLY|O_CLOEXEC) = 3"),
+              std::vector<std::string>{"openat(data): opens without O_NOFOLLOW"});
+    EXPECT_EQ(following("utimensat(" + kStoreDir + ", " + str("data.chk.tmp") + ", NULL, 0) = 0"),
+              std::vector<std::string>{"utimensat(data.chk.tmp): sets a time without AT_SYMLINK_NOFOLLOW"});
+    EXPECT_EQ(following("renameat(" + kStoreDir + ", " + str("a") + ", " + kCwd + ", " + str("/r/s/1/b") + ") = 0"),
+              std::vector<std::string>{"renameat(/r/s/1/b): names a store entry by its path"});
+}
+
+}  // namespace

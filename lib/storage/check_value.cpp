@@ -5,9 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "lib/storage/untrusted_tree.h"
 #include "lib/util/crc32.h"
-#include "lib/util/fd.h"
 
 namespace Storage {
 namespace {
@@ -35,8 +33,13 @@ int64_t readAll(int fd, int64_t size, uint8_t* buffer, size_t capacity, Consume 
     return total;
 }
 
-// The check value of the open data file `fd`, whose fstat is `status`.
-Status checkValueOf(int fd, const struct stat& status, uint64_t& value) {
+// std::filesystem turns a time from here on into an error.
+constexpr time_t kFileClockEnd =
+    static_cast<time_t>(std::chrono::nanoseconds::max().count() / std::chrono::nanoseconds::period::den);
+
+}  // namespace
+
+Status computeCheckValue(int fd, const struct stat& status, uint64_t& value) {
     uint8_t block[kReadBlock];
     uint32_t crc = kCrc32Initial;
     const auto consume = [&](const uint8_t* data, size_t size) { crc = crc32Update(crc, data, size); };
@@ -46,30 +49,10 @@ Status checkValueOf(int fd, const struct stat& status, uint64_t& value) {
     return STATUS_OK;
 }
 
-// std::filesystem turns a time from here on into an error.
-constexpr time_t kFileClockEnd =
-    static_cast<time_t>(std::chrono::nanoseconds::max().count() / std::chrono::nanoseconds::period::den);
-
-}  // namespace
-
-Status computeCheckValue(int directory, const char* name, uint64_t& value) {
-    struct stat status {};
-    const UniqueFd fd = openRegularAt(directory, name, O_RDONLY, 0, &status);
-    if (!fd) {
-        if (errno != ENOENT) return STATUS_FAILED;
-        value = kAbsentBlobCheckValue;
-        return STATUS_OK;
-    }
-    return checkValueOf(fd.get(), status, value);
-}
-
-bool matchesCheckValue(int directory, const char* name, uint64_t stored) {
-    struct stat status {};
-    const UniqueFd fd = openRegularAt(directory, name, O_RDONLY, 0, &status);
-    if (!fd) return errno == ENOENT && stored == kAbsentBlobCheckValue;
+bool matchesCheckValue(int fd, const struct stat& status, uint64_t stored) {
     if (static_cast<uint32_t>(status.st_size) != static_cast<uint32_t>(stored)) return false;
     uint64_t actual = 0;
-    return checkValueOf(fd.get(), status, actual) == STATUS_OK && actual == stored;
+    return computeCheckValue(fd, status, actual) == STATUS_OK && actual == stored;
 }
 
 CheckTime checkTimeOf(const struct stat& status) { return {status.st_mtim.tv_sec < kFileClockEnd, status.st_mtim}; }
@@ -81,22 +64,16 @@ bool isLater(const CheckTime& later, const CheckTime& earlier) {
     return later.time.tv_nsec > earlier.time.tv_nsec;
 }
 
-Status readCheckValue(int directory, const char* name, uint64_t& value, CheckTime* modified) {
-    if (modified != nullptr) *modified = CheckTime{};
-    struct stat status {};
-    const UniqueFd fd = openRegularAt(directory, name, O_RDONLY, 0, &status);
-    if (!fd) return errno == ENOENT ? STATUS_NOT_FOUND : STATUS_FAILED;
-    if (modified != nullptr) *modified = checkTimeOf(status);
+Status readCheckValue(int fd, const struct stat& status, uint64_t& value) {
     // Any other size cannot be good, and a huge planted file is not read.
     if (status.st_size != static_cast<off_t>(kCheckValueSize)) return STATUS_FAILED;
-
     uint8_t stored[kCheckValueSize] = {};
     size_t offset = 0;
     const auto consume = [&](const uint8_t* data, size_t count) {
         for (size_t i = 0; i < count && offset < kCheckValueSize; ++i) stored[offset++] = data[i];
     };
     uint8_t block[kReadBlock];
-    if (readAll(fd.get(), status.st_size, block, sizeof block, consume) != static_cast<int64_t>(kCheckValueSize)) {
+    if (readAll(fd, status.st_size, block, sizeof block, consume) != static_cast<int64_t>(kCheckValueSize)) {
         return STATUS_FAILED;
     }
     value = 0;

@@ -14,18 +14,16 @@ namespace Storage {
 constexpr uint64_t kAbsentBlobCheckValue = ~uint64_t{0};
 constexpr size_t kCheckValueSize = 8;
 
-// The check value of the data file `name` in `directory`, from one open of
-// the file: its size as fstat gives it, the CRC-32 of its bytes read to the
-// end. STATUS_OK with kAbsentBlobCheckValue when the file does not exist;
-// STATUS_FAILED when it cannot be opened, sized or read, or is not a regular
-// file (a link is not followed; a FIFO or device is never read).
-[[nodiscard]] Status computeCheckValue(int directory, const char* name, uint64_t& value);
+// The check value of the open regular data file `fd`, whose fstat is
+// `status`: its size ORed with the CRC-32 of its bytes, read to the end in
+// blocks of 4096 bytes, shifted left by 32. STATUS_FAILED on a read error.
+[[nodiscard]] Status computeCheckValue(int fd, const struct stat& status, uint64_t& value);
 
-// Whether the data file `name` in `directory` has the check value `stored`,
-// as computeCheckValue gives it. The data is read only when its size agrees
+// Whether the open regular data file `fd` has the check value `stored`, as
+// computeCheckValue gives it. The data is read only when its size agrees
 // with the size half of `stored`: a file that cannot match, however large,
 // is never read.
-bool matchesCheckValue(int directory, const char* name, uint64_t stored);
+bool matchesCheckValue(int fd, const struct stat& status, uint64_t stored);
 
 // A check file's modification time, as opening a slot compares them.
 // Unknown when it could not be read or lies beyond what
@@ -42,12 +40,10 @@ CheckTime checkTimeOf(const struct stat& status);
 // `later` is strictly later than `earlier`.
 bool isLater(const CheckTime& later, const CheckTime& earlier);
 
-// The value stored in the check file `name` in `directory`, from one open
-// of the file; `modified` (when not null) receives its modification time,
-// also when the value is bad. STATUS_NOT_FOUND when the file does not
-// exist; STATUS_FAILED unless it is a regular file (a link is not followed)
-// that reads completely and holds exactly 8 bytes.
-[[nodiscard]] Status readCheckValue(int directory, const char* name, uint64_t& value, CheckTime* modified = nullptr);
+// The value stored in the open regular check file `fd`, whose fstat is
+// `status`. STATUS_FAILED unless it holds exactly 8 bytes and they read; a
+// file of any other size is not read.
+[[nodiscard]] Status readCheckValue(int fd, const struct stat& status, uint64_t& value);
 
 // The 8 bytes of `value` as stored (little-endian).
 void encodeCheckValue(uint64_t value, uint8_t (&bytes)[kCheckValueSize]);

@@ -44,21 +44,12 @@ CopyDirectory reachBelow(const CopyDirectory& parent, const char* name, bool cre
 }  // namespace
 
 Status CopyDirectory::computeCheck(uint64_t& value) const {
-    if (fd >= 0) return computeCheckValue(fd, kDataName, value);
-    if (!missing) return STATUS_FAILED;
+    struct stat status {};
+    const UniqueFd data = open(kDataName, O_RDONLY, 0, &status);
+    if (data) return computeCheckValue(data.get(), status, value);
+    if (errno != ENOENT) return STATUS_FAILED;
     value = kAbsentBlobCheckValue;
     return STATUS_OK;
-}
-
-bool CopyDirectory::dataMatches(uint64_t stored) const {
-    if (fd >= 0) return matchesCheckValue(fd, kDataName, stored);
-    return missing && stored == kAbsentBlobCheckValue;
-}
-
-Status CopyDirectory::readCheck(uint64_t& value, CheckTime* modified) const {
-    if (fd >= 0) return readCheckValue(fd, kCheckName, value, modified);
-    if (modified != nullptr) *modified = CheckTime{};
-    return missing ? STATUS_NOT_FOUND : STATUS_FAILED;
 }
 
 CheckTime CopyDirectory::checkTime() const {
@@ -77,8 +68,8 @@ int CopyDirectory::remove(const char* name) const {
     return ::unlinkat(fd, name, AT_REMOVEDIR) == 0 ? 0 : errno;
 }
 
-UniqueFd CopyDirectory::open(const char* name, int flags, mode_t mode) const {
-    if (fd >= 0) return openRegularAt(fd, name, flags, mode);
+UniqueFd CopyDirectory::open(const char* name, int flags, mode_t mode, struct stat* status) const {
+    if (fd >= 0) return openRegularAt(fd, name, flags, mode, status);
     errno = missing ? ENOENT : error;
     return UniqueFd();
 }
@@ -96,6 +87,20 @@ CopyDirectory SlotDirectories::ensure(unsigned copy) {
         LOGI << "Failed to create " << std::quoted(copyPath(copy).string()) << " " << std::strerror(directory.error);
     }
     return directory;
+}
+
+UniqueFd SlotDirectories::openForReading(unsigned copy, const char* name, struct stat& status) {
+    if (!copies_[copy]) {
+        const CopyDirectory base = reachBase(false);
+        if (base.fd < 0) {
+            errno = base.missing ? ENOENT : base.error;
+            return UniqueFd();
+        }
+        const std::string path = (slotName_.empty() ? std::string() : slotName_ + "/") + kCopyNames[copy] + "/" + name;
+        UniqueFd fd = openRegularBeneath(base.fd, path.c_str(), O_RDONLY, &status);
+        if (fd || errno != ENOSYS) return fd;
+    }
+    return open(copy).open(name, O_RDONLY, 0, &status);
 }
 
 fs::path SlotDirectories::copyPath(unsigned copy) const {

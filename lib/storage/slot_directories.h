@@ -34,14 +34,10 @@ struct CopyDirectory {
     int error = 0;         // why fd is -1: the errno
     bool missing = false;  // fd is -1 because it, or one above it, does not exist
 
-    // The check value of the data file (check_value.h). A missing directory
-    // holds no data file; an unusable one gives STATUS_FAILED.
+    // The check value of the data file (check_value.h); a missing file, or
+    // a missing directory, holds an absent blob. STATUS_FAILED when it
+    // cannot be computed.
     [[nodiscard]] Status computeCheck(uint64_t& value) const;
-    // The data file has the check value `stored` (matchesCheckValue).
-    bool dataMatches(uint64_t stored) const;
-    // The stored check value (check_value.h): STATUS_NOT_FOUND in a missing
-    // directory, STATUS_FAILED in an unusable one.
-    [[nodiscard]] Status readCheck(uint64_t& value, CheckTime* modified) const;
     // The modification time of the check file; unknown unless it is a
     // regular file.
     CheckTime checkTime() const;
@@ -51,7 +47,7 @@ struct CopyDirectory {
     int remove(const char* name) const;
     // openRegularAt in this directory; errno is ENOENT when the directory is
     // missing and its own error when it is unusable.
-    UniqueFd open(const char* name, int flags, mode_t mode = 0) const;
+    UniqueFd open(const char* name, int flags, mode_t mode = 0, struct stat* status = nullptr) const;
     // An entry `name` of any kind is there.
     bool holds(const char* name) const;
 };
@@ -71,6 +67,14 @@ public:
     // parents, mode 0777 less the umask). A failure is logged at info
     // priority as "Failed to create <quoted copy directory> <message>".
     CopyDirectory ensure(unsigned copy);
+
+    // Opens the regular file `name` of copy 0 or 1 for reading, with its
+    // fstat in `status`. Where the kernel can (openRegularBeneath), in one
+    // call from the base directory without opening the directories on the
+    // way; elsewhere through them. errno on failure: ENOENT when the file or
+    // a directory above it is missing; ELOOP or ENOTDIR for a link on the
+    // way; EISDIR or ENXIO for something that is not a regular file.
+    UniqueFd openForReading(unsigned copy, const char* name, struct stat& status);
 
     // The copy directory's path, for messages.
     std::filesystem::path copyPath(unsigned copy) const;

@@ -69,12 +69,22 @@ Status copyFile(const CopyDirectory& from, const CopyDirectory& to) {
     }
 }
 
-Status readCopy(const CopyDirectory& directory, bool valid, uint8_t* buffer, size_t size, int64_t offset,
-                size_t* bytesRead) {
-    if (!valid) return directory.holds(kDataName) ? STATUS_FAILED : STATUS_NOT_FOUND;
-    const UniqueFd fd = directory.open(kDataName, O_RDONLY);
+// Whether the data file of a copy has the check value `stored` (an absent
+// file matches an absent blob).
+bool dataMatches(SlotDirectories& directories, unsigned copy, uint64_t stored) {
+    struct stat status {};
+    const UniqueFd data = directories.openForReading(copy, kDataName, status);
+    if (!data) return errno == ENOENT && stored == kAbsentBlobCheckValue;
+    return matchesCheckValue(data.get(), status, stored);
+}
+
+Status readCopy(SlotDirectories& directories, unsigned copy, bool valid, uint8_t* buffer, size_t size,
+                int64_t offset, size_t* bytesRead) {
+    if (!valid) return directories.open(copy).holds(kDataName) ? STATUS_FAILED : STATUS_NOT_FOUND;
+    struct stat status {};
+    const UniqueFd fd = directories.openForReading(copy, kDataName, status);
     const int error = errno;  // a file that opens exists; only a failed open asks
-    if (!fd) return directory.holds(kDataName) ? static_cast<Status>(error) : STATUS_NOT_FOUND;
+    if (!fd) return directories.open(copy).holds(kDataName) ? static_cast<Status>(error) : STATUS_NOT_FOUND;
     const ssize_t count = ::pread(fd.get(), buffer, size, offset);
     if (count < 0) return errno;
     if (bytesRead != nullptr) *bytesRead = static_cast<size_t>(count);
@@ -119,15 +129,23 @@ SlotDirectories DualFileTarget::Slot::directories() const { return SlotDirectori
 
 CheckTime DualFileTarget::Slot::validate(unsigned index, SlotDirectories& directories) {
     Copy& copy = copies_[index];
-    // A failure to make it shows as a missing or unusable directory below.
-    const CopyDirectory directory = directories.ensure(index);
+    struct stat status {};
     uint64_t stored = 0;
     CheckTime checkTime;
     // The stored value first: data that no check file vouches for is not read.
-    const Status read = directory.readCheck(stored, &checkTime);
-    copy.valid = read == STATUS_OK && directory.dataMatches(stored);
+    Status read = STATUS_NOT_FOUND;
+    const UniqueFd check = directories.openForReading(index, kCheckName, status);
+    if (check) {
+        checkTime = checkTimeOf(status);
+        read = readCheckValue(check.get(), status, stored);
+    } else {
+        if (errno != ENOENT) read = STATUS_FAILED;
+        // Without a check file the directory may be missing; failing to make it fails the updates.
+        (void)directories.ensure(index);
+    }
+    copy.valid = read == STATUS_OK && dataMatches(directories, index, stored);
     // A mismatching check file must never become valid again by accident; a missing one needs no removal.
-    if (!copy.valid && read != STATUS_NOT_FOUND && directory.remove(kCheckName) != 0) {
+    if (!copy.valid && read != STATUS_NOT_FOUND && directories.open(index).remove(kCheckName) != 0) {
         LOGE_AT(kCleanupCheckfileLine) << "Failure cleaning up checkfile " << std::quoted(copy.checkPath.string());
     }
     return checkTime;
@@ -141,12 +159,12 @@ bool DualFileTarget::Slot::exists() const {
 
 Status DualFileTarget::Slot::read(uint8_t* buffer, size_t size, int64_t offset) {
     SlotDirectories reached = directories();
-    return readCopy(reached.open(current_), copies_[current_].valid, buffer, size, offset, nullptr);
+    return readCopy(reached, current_, copies_[current_].valid, buffer, size, offset, nullptr);
 }
 
 Status DualFileTarget::Slot::readSome(uint8_t* buffer, size_t size, int64_t offset, size_t& bytesRead) {
     SlotDirectories reached = directories();
-    return readCopy(reached.open(current_), copies_[current_].valid, buffer, size, offset, &bytesRead);
+    return readCopy(reached, current_, copies_[current_].valid, buffer, size, offset, &bytesRead);
 }
 
 CheckTime DualFileTarget::Slot::currentCheckTime(SlotDirectories& directories) {

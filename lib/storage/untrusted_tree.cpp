@@ -1,8 +1,12 @@
 #include "lib/storage/untrusted_tree.h"
 
+#include <atomic>
 #include <cerrno>
 #include <fcntl.h>
+#include <linux/openat2.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
+#include <unistd.h>
 
 namespace Storage {
 
@@ -26,11 +30,15 @@ bool isRegularFile(int fd, struct stat& status) {
     return false;
 }
 
-UniqueFd openRegularAt(int directory, const char* name, int flags, mode_t mode, struct stat* status) {
-    // O_NONBLOCK: a FIFO opens at once (or fails with ENXIO) and a leased
-    // file fails with EWOULDBLOCK instead of waiting; it changes nothing
-    // for a regular file. O_NOCTTY: a terminal never becomes ours.
-    UniqueFd fd(::openat(directory, name, flags | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC, mode));
+namespace {
+
+// O_NONBLOCK: a FIFO opens at once (or fails with ENXIO) and a leased file
+// fails with EWOULDBLOCK instead of waiting; it changes nothing for a
+// regular file. O_NOCTTY: a terminal never becomes ours.
+constexpr int kSafeFlags = O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
+
+// `fd`, or none when it is open on anything but a regular file.
+UniqueFd regularOnly(UniqueFd fd, struct stat* status) {
     struct stat ignored {};
     if (fd && !isRegularFile(fd.get(), status != nullptr ? *status : ignored)) {
         const int error = errno;
@@ -38,6 +46,28 @@ UniqueFd openRegularAt(int directory, const char* name, int flags, mode_t mode, 
         errno = error;
     }
     return fd;
+}
+
+// Cleared by the first openat2 that the kernel does not know.
+std::atomic<bool> kernelOpensBeneath{true};
+
+}  // namespace
+
+UniqueFd openRegularAt(int directory, const char* name, int flags, mode_t mode, struct stat* status) {
+    return regularOnly(UniqueFd(::openat(directory, name, flags | kSafeFlags, mode)), status);
+}
+
+UniqueFd openRegularBeneath(int directory, const char* path, int flags, struct stat* status) {
+    if (!kernelOpensBeneath.load(std::memory_order_relaxed)) {
+        errno = ENOSYS;
+        return UniqueFd();
+    }
+    struct open_how how {};
+    how.flags = static_cast<uint64_t>(flags | kSafeFlags);
+    how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_BENEATH;
+    UniqueFd fd(static_cast<int>(::syscall(SYS_openat2, directory, path, &how, sizeof how)));
+    if (!fd && errno == ENOSYS) kernelOpensBeneath.store(false, std::memory_order_relaxed);
+    return regularOnly(std::move(fd), status);
 }
 
 bool entryExists(int directory, const char* name) {

@@ -32,6 +32,15 @@ UniqueFd makeDirectoryAt(int parent, const char* name);
 // `status`, when not null, receives the file's fstat.
 UniqueFd openRegularAt(int directory, const char* name, int flags, mode_t mode = 0, struct stat* status = nullptr);
 
+// openRegularAt for a relative `path` of any number of components below
+// `directory`, in one call that follows no link anywhere on the way:
+// openat2 with RESOLVE_NO_SYMLINKS and RESOLVE_BENEATH, so a link as any
+// component fails with ELOOP and a way out of `directory` with EXDEV.
+// ENOSYS where the kernel, or an emulator, has no openat2; from then on
+// every call fails that way at once, and the caller takes the directories
+// one at a time instead.
+UniqueFd openRegularBeneath(int directory, const char* path, int flags, struct stat* status = nullptr);
+
 // Whether `fd` is open on a regular file, with its fstat in `status`; sets
 // errno (EISDIR, ENXIO, or that of fstat) when not.
 bool isRegularFile(int fd, struct stat& status);

@@ -33,6 +33,29 @@ struct Copy {
     timespec checkTime{};
 };
 
+// The check value of the data file as the store computes it: all ones when
+// there is none.
+bool checkValueOf(const fs::path& data, uint64_t& value) {
+    const int fd = ::open(data.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) {
+        value = Storage::kAbsentBlobCheckValue;
+        return errno == ENOENT;
+    }
+    struct stat status {};
+    const bool computed = ::fstat(fd, &status) == 0 && Storage::computeCheckValue(fd, status, value) == STATUS_OK;
+    ::close(fd);
+    return computed;
+}
+
+bool storedValueOf(const fs::path& check, uint64_t& value) {
+    const int fd = ::open(check.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) return false;
+    struct stat status {};
+    const bool read = ::fstat(fd, &status) == 0 && Storage::readCheckValue(fd, status, value) == STATUS_OK;
+    ::close(fd);
+    return read;
+}
+
 Copy inspect(const fs::path& directory) {
     Copy copy;
     copy.data = directory / "data";
@@ -40,8 +63,7 @@ Copy inspect(const fs::path& directory) {
     uint64_t actual = 0;
     uint64_t stored = 0;
     struct stat status {};
-    copy.valid = Storage::computeCheckValue(AT_FDCWD, copy.data.c_str(), actual) == STATUS_OK &&
-                 Storage::readCheckValue(AT_FDCWD, copy.check.c_str(), stored) == STATUS_OK && actual == stored &&
+    copy.valid = checkValueOf(copy.data, actual) && storedValueOf(copy.check, stored) && actual == stored &&
                  ::stat(copy.check.c_str(), &status) == 0;
     if (copy.valid) copy.checkTime = status.st_mtim;
     return copy;
@@ -60,7 +82,7 @@ bool fail(const char* what, const fs::path& path) {
 // under a temporary name, dated after the current copy, renamed into place.
 bool commit(const Copy& copy, const timespec& previous) {
     uint64_t value = 0;
-    if (Storage::computeCheckValue(AT_FDCWD, copy.data.c_str(), value) != STATUS_OK) return fail("check value of", copy.data);
+    if (!checkValueOf(copy.data, value)) return fail("check value of", copy.data);
     uint8_t bytes[kCheckValueSize];
     Storage::encodeCheckValue(value, bytes);
     const fs::path tmp = copy.check.string() + ".tmp";

@@ -10,7 +10,7 @@ namespace crash {
 
 // '?': calls that some architectures lack (ARM64 has only the *at forms).
 const char* const kStraceCalls =
-    "?open,openat,?creat,read,readv,lseek,write,writev,pwrite64,pwritev,pwritev2,ftruncate,?truncate,?unlink,"
+    "?open,openat,openat2,?creat,read,readv,lseek,write,writev,pwrite64,pwritev,pwritev2,ftruncate,?truncate,?unlink,"
     "unlinkat,?rmdir,?mkdir,mkdirat,?rename,renameat,renameat2,utimensat,fsync,fdatasync,syncfs,?chmod,fchmod,"
     "fchmodat";
 
@@ -129,6 +129,15 @@ Call parseCall(const std::string& text) {
     call.result = number(result.substr(0, end));
     if (end != std::string::npos && result[end] == '<') call.resultPath = described(result).path;
     return call;
+}
+
+// A field of a struct argument, "{name=value, ...}": the value, or "".
+std::string field(const std::string& arg, const std::string& name) {
+    if (arg.size() < 2 || arg.front() != '{' || arg.back() != '}') throw LineError("not a struct: " + arg);
+    for (const std::string& part : splitTopLevel(arg.substr(1, arg.size() - 2))) {
+        if (part.rfind(name + "=", 0) == 0) return part.substr(name.size() + 1);
+    }
+    return "";
 }
 
 bool hasFlag(const std::string& flags, const std::string& flag) {
@@ -272,6 +281,8 @@ void TraceReader::apply(long pid, const Call& call) {
         opened(pid, call, pathOf("", args.at(0)), args.at(1));
     } else if (name == "openat") {
         opened(pid, call, pathOf(args.at(0), args.at(1)), args.at(2));
+    } else if (name == "openat2") {
+        opened(pid, call, pathOf(args.at(0), args.at(1)), field(args.at(2), "flags"));
     } else if (name == "creat") {
         opened(pid, call, pathOf("", args.at(0)), "O_WRONLY|O_CREAT|O_TRUNC");
     } else if (name == "read" || name == "readv" || name == "lseek") {
@@ -381,7 +392,8 @@ std::vector<Named> namesOf(const Call& call) {
     if (name == "rename") return {{"", args.at(0)}, {"", args.at(1)}};
     if (name == "renameat" || name == "renameat2") return {{args.at(0), args.at(1)}, {args.at(2), args.at(3)}};
     if (name == "utimensat" && args.at(1) == "NULL") return {};
-    if (name == "openat" || name == "unlinkat" || name == "mkdirat" || name == "utimensat" || name == "fchmodat") {
+    if (name == "openat" || name == "openat2" || name == "unlinkat" || name == "mkdirat" || name == "utimensat" ||
+        name == "fchmodat") {
         return {{args.at(0), args.at(1)}};
     }
     return {};
@@ -400,8 +412,10 @@ std::string followingProblem(const Call& call, const Named& named, const std::st
     const bool fromWorkingDirectory = absolute || !directory.hasPath || directory.head == "AT_FDCWD";
     const std::string path = absolute ? name : directory.path + "/" + name;
     if (path.rfind(root + "/", 0) != 0) return "";
-    const bool opens = call.name == "open" || call.name == "openat";
-    const std::string flags = opens ? call.args.at(call.name == "open" ? 1 : 2) : "";
+    const bool opens = call.name == "open" || call.name == "openat" || call.name == "openat2";
+    const std::string flags = call.name == "openat2" ? field(call.args.at(2), "flags")
+                              : opens                ? call.args.at(call.name == "open" ? 1 : 2)
+                                                     : "";
     if (fromWorkingDirectory) {
         // Only the stores' own base directories, whose names are never numbers, are made or opened by path.
         const bool directoryOnly = call.name == "mkdir" || call.name == "mkdirat" ||
@@ -415,6 +429,10 @@ std::string followingProblem(const Call& call, const Named& named, const std::st
             }
         }
         return "";
+    }
+    if (call.name == "openat2") {
+        // Any number of components, none of them followed if a link.
+        return hasFlag(field(call.args.at(2), "resolve"), "RESOLVE_NO_SYMLINKS") ? "" : "opens without RESOLVE_NO_SYMLINKS";
     }
     if (name.find('/') != std::string::npos) return "names more than one component below a directory";
     if (opens && !hasFlag(flags, "O_NOFOLLOW")) return "opens without O_NOFOLLOW";

@@ -46,9 +46,11 @@ std::vector<FsOp> parseStraceTrace(const std::string& trace, const std::string& 
 // planted there, one line each: anything named by its path (from the
 // working directory or absolute) but the making and opening of
 // directories whose names below `root` are not decimal numbers (slot and
-// copy directories are), a relative name of more than one component, an
-// open without O_NOFOLLOW, a utimensat of a name without
-// AT_SYMLINK_NOFOLLOW. Throws as parseStraceTrace.
+// copy directories are), a relative name of more than one component (but
+// for openat2 with RESOLVE_NO_SYMLINKS, which follows no link on the way),
+// an open without O_NOFOLLOW, an openat2 without RESOLVE_NO_SYMLINKS, a
+// utimensat of a name without AT_SYMLINK_NOFOLLOW. Throws as
+// parseStraceTrace.
 std::vector<std::string> linkFollowingCalls(const std::string& trace, const std::string& root);
 
 }  // namespace crash

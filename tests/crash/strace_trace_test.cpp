@@ -148,6 +148,9 @@ TEST(LinkFollowingCalls, TheStoresOwnCallsPass) {
         "10 openat(" + kStoreDir + ", " + str("data") + ", O_RDWR|O_CREAT|O_TRUNC|O_NOFOLLOW|O_CLOEXEC, 0666) = 6" +
         fd("", "/r/s/1/data") + "\n" +
         "10 unlinkat(" + kStoreDir + ", " + str("data.chk") + ", 0) = -1 ENOENT (No such file or directory)\n" +
+        "10 openat2(" + fd("4", "/r/s") + ", " + str("1/data.chk") +
+        ", {flags=O_RDONLY|O_NOFOLLOW|O_CLOEXEC, resolve=RESOLVE_NO_SYMLINKS|RESOLVE_BENEATH}, 24) = 9" +
+        fd("", "/r/s/1/data.chk") + "\n" +
         "10 utimensat(" + fd("7", "/r/s/1/data.chk.tmp") + ", NULL, [UTIME_OMIT, {tv_sec=5, tv_nsec=0}], 0) = 0\n" +
         "10 renameat(" + kStoreDir + ", " + str("data.chk.tmp") + ", " + kStoreDir + ", " + str("data.chk") +
         ") = 0\n" +
@@ -171,6 +174,9 @@ TEST(LinkFollowingCalls, EveryWayAroundADescriptorIsCaught) {
               std::vector<std::string>{"openat(data): opens without O_NOFOLLOW"});
     EXPECT_EQ(following("utimensat(" + kStoreDir + ", " + str("data.chk.tmp") + ", NULL, 0) = 0"),
               std::vector<std::string>{"utimensat(data.chk.tmp): sets a time without AT_SYMLINK_NOFOLLOW"});
+    EXPECT_EQ(following("openat2(" + fd("4", "/r/s") + ", " + str("1/data") +
+                        ", {flags=O_RDONLY|O_NOFOLLOW, resolve=RESOLVE_BENEATH}, 24) = 3"),
+              std::vector<std::string>{"openat2(1/data): opens without RESOLVE_NO_SYMLINKS"});
     EXPECT_EQ(following("renameat(" + kStoreDir + ", " + str("a") + ", " + kCwd + ", " + str("/r/s/1/b") + ") = 0"),
               std::vector<std::string>{"renameat(/r/s/1/b): names a store entry by its path"});
 }

@@ -7,7 +7,8 @@
  *
  *   FAULT_CALL         what to count: a call family, an exact function name,
  *                      or "mutating".
- *                        open      open, openat, creat, fopen, read-only
+ *                        open      open, openat, creat, fopen, and
+ *                                  openat2 through syscall(), read-only
  *                                  or not
  *                        write     write, writev
  *                        pwrite    pwrite, pwritev
@@ -96,7 +97,8 @@
  * standard error, and so does a record line that cannot be written later.
  *
  * The shim neither allocates (record lines are built in anonymous mappings)
- * nor uses stdio, and its own I/O goes through raw system calls: it may run
+ * nor uses stdio, and its own I/O goes through raw system calls
+ * (raw_syscall.h, never through the syscall() it interposes): it may run
  * inside the start-up of any process, before the program's allocator or its
  * sanitizer runtime is ready, and its own calls are never counted or
  * recorded.
@@ -108,6 +110,7 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <limits.h>
+#include <linux/openat2.h>
 #include <signal.h>
 #include <stdarg.h>
 #include <stddef.h>
@@ -122,6 +125,7 @@
 #include <unistd.h>
 
 #include "fault_record_line.h"
+#include "raw_syscall.h"
 
 #define EXPORT __attribute__((visibility("default")))
 
@@ -150,7 +154,7 @@ struct Function {
 };
 
 static const struct Function kFunctions[] = {
-    {"open", FAMILY_OPEN},         {"openat", FAMILY_OPEN},
+    {"open", FAMILY_OPEN},         {"openat", FAMILY_OPEN},       {"openat2", FAMILY_OPEN},
     {"creat", FAMILY_OPEN},        {"fopen", FAMILY_OPEN},
     {"write", FAMILY_WRITE},       {"writev", FAMILY_WRITE},
     {"pwrite", FAMILY_PWRITE},     {"pwritev", FAMILY_PWRITE},
@@ -233,7 +237,7 @@ static unsigned long seen;
 
 static void rawWrite(int fd, const char* text, size_t length) {
     while (length > 0) {
-        const long done = syscall(SYS_write, fd, text, length);
+        const long done = rawSyscall(SYS_write, fd, text, length);
         if (done < 0 && errno == EINTR) continue;
         if (done <= 0) return;
         text += done;
@@ -255,19 +259,19 @@ static size_t formatDecimal(unsigned long value, char* out) {
 /* Returns 0 when the file cannot be opened. */
 static int writeCountFile(unsigned long count) {
     if (!config.hasCountFile) return 1;
-    const long fd = syscall(SYS_openat, AT_FDCWD, config.countFile, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666);
+    const long fd = rawSyscall(SYS_openat, AT_FDCWD, config.countFile, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666);
     if (fd < 0) return 0;
     char text[24];
     const size_t length = formatDecimal(count, text);
     text[length] = '\n';
     rawWrite((int)fd, text, length + 1);
-    syscall(SYS_close, fd);
+    rawSyscall(SYS_close, fd);
     return 1;
 }
 
 __attribute__((noreturn)) static void crashNow(void) {
-    syscall(SYS_kill, syscall(SYS_getpid), SIGKILL);
-    for (;;) syscall(SYS_exit_group, 99);
+    rawSyscall(SYS_kill, rawSyscall(SYS_getpid), SIGKILL);
+    for (;;) rawSyscall(SYS_exit_group, 99);
 }
 
 __attribute__((noreturn)) static void configError(const char* variable, const char* value, const char* problem) {
@@ -282,7 +286,7 @@ __attribute__((noreturn)) static void configError(const char* variable, const ch
     rawWrite(2, ": ", 2);
     rawWrite(2, problem, strlen(problem));
     rawWrite(2, "\n", 1);
-    for (;;) syscall(SYS_exit_group, 98);
+    for (;;) rawSyscall(SYS_exit_group, 98);
 }
 
 /* ---- configuration ---- */
@@ -371,9 +375,9 @@ static void parseClock(const char* value) {
 static void parseRecord(const char* value) {
     if (value[0] != '/') configError("FAULT_RECORD", value, "not an absolute path");
     if (!copyValue(config.record, sizeof config.record, value)) configError("FAULT_RECORD", NULL, "too long");
-    const long fd = syscall(SYS_openat, AT_FDCWD, value, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0666);
+    const long fd = rawSyscall(SYS_openat, AT_FDCWD, value, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0666);
     if (fd < 0) configError("FAULT_RECORD", value, "cannot be written");
-    syscall(SYS_close, fd);
+    rawSyscall(SYS_close, fd);
     config.hasRecord = 1;
 }
 
@@ -417,7 +421,7 @@ static void loadConfig(void) {
         config.hasCountFile = 1;
         if (!writeCountFile(0)) configError("FAULT_COUNT_FILE", countFile, "cannot be written");
     }
-    config.pid = (pid_t)syscall(SYS_getpid);
+    config.pid = (pid_t)rawSyscall(SYS_getpid);
     config.active = 1;
 
     /* Programs this process starts must not inherit the fault. */
@@ -443,7 +447,7 @@ static int enabled(void) {
         __atomic_store_n(&state, STATE_READY, __ATOMIC_RELEASE);
         current = STATE_READY;
     }
-    return current == STATE_READY && config.active && (pid_t)syscall(SYS_getpid) == config.pid;
+    return current == STATE_READY && config.active && (pid_t)rawSyscall(SYS_getpid) == config.pid;
 }
 
 __attribute__((constructor)) static void loadAtStartup(void) {
@@ -473,7 +477,7 @@ static size_t descriptorPath(int fd, char* out, size_t capacity) {
     if (fd < 0) return 0;
     at += formatDecimal((unsigned long)fd, link + at);
     link[at] = '\0';
-    const long length = syscall(SYS_readlinkat, AT_FDCWD, link, out, capacity - 1);
+    const long length = rawSyscall(SYS_readlinkat, AT_FDCWD, link, out, capacity - 1);
     if (length <= 0) return 0;
     out[length] = '\0';
     return (size_t)length;
@@ -579,8 +583,8 @@ static int watching(const struct Target* target) {
 /* stat of the file a target names (its descriptor when it has no path),
  * following a last symbolic link unless `noFollow`. */
 static int statTarget(const struct Target* target, int noFollow, struct stat* status) {
-    if (target->path == NULL) return syscall(SYS_fstat, target->fd, status) == 0;
-    return syscall(SYS_newfstatat, target->dirfd, target->path, status, noFollow ? AT_SYMLINK_NOFOLLOW : 0) == 0;
+    if (target->path == NULL) return rawSyscall(SYS_fstat, target->fd, status) == 0;
+    return rawSyscall(SYS_newfstatat, target->dirfd, target->path, status, noFollow ? AT_SYMLINK_NOFOLLOW : 0) == 0;
 }
 
 /* The target's absolute name; ends the process when there is none. */
@@ -595,7 +599,7 @@ static void nameOf(const struct Target* target, char* out) {
     }
     size_t length = 0;
     if (target->dirfd == AT_FDCWD) {
-        const long size = syscall(SYS_getcwd, out, PATH_MAX);
+        const long size = rawSyscall(SYS_getcwd, out, PATH_MAX);
         length = size > 0 ? (size_t)size - 1 : 0;
     } else {
         length = descriptorPath(target->dirfd, out, PATH_MAX);
@@ -638,8 +642,8 @@ static int changedRegularFile(const struct Target* target, struct stat* status) 
     if (!statTarget(target, 0, status) || !S_ISREG(status->st_mode)) return 0;
     if (!config.hasClock) return 1;
     const struct timespec times[2] = {{config.clock, 0}, {config.clock, 0}};
-    const long done = target->path == NULL ? syscall(SYS_utimensat, target->fd, NULL, times, 0)
-                                           : syscall(SYS_utimensat, target->dirfd, target->path, times, 0);
+    const long done = target->path == NULL ? rawSyscall(SYS_utimensat, target->fd, NULL, times, 0)
+                                           : rawSyscall(SYS_utimensat, target->dirfd, target->path, times, 0);
     if (done != 0) configError("FAULT_MTIME", NULL, "cannot set a file's time");
     return statTarget(target, 0, status);
 }
@@ -682,9 +686,9 @@ static void afterOpen(const struct Target* named, int fd, int flags, int existed
  * call named one (-1: it wrote at the file position), the old end of file
  * under O_APPEND. */
 static off_t writtenAt(int fd, off_t offset, size_t done, const struct stat* after) {
-    if (syscall(SYS_fcntl, fd, F_GETFL) & O_APPEND) return after->st_size - (off_t)done;
+    if (rawSyscall(SYS_fcntl, fd, F_GETFL) & O_APPEND) return after->st_size - (off_t)done;
     if (offset >= 0) return offset;
-    return (off_t)syscall(SYS_lseek, fd, 0, SEEK_CUR) - (off_t)done;
+    return (off_t)rawSyscall(SYS_lseek, fd, 0, SEEK_CUR) - (off_t)done;
 }
 
 static void recordWrite(const char* name, const struct stat* status, off_t offset, const struct iovec* buffers,
@@ -718,7 +722,7 @@ static void afterWrite(int fd, off_t offset, const struct iovec* buffers, int bu
 
 static int readAll(int fd, unsigned char* buffer, size_t count, off_t offset) {
     while (count > 0) {
-        const long got = syscall(SYS_pread64, fd, buffer, count, offset);
+        const long got = rawSyscall(SYS_pread64, fd, buffer, count, offset);
         if (got < 0 && errno == EINTR) continue;
         if (got <= 0) return 0;
         buffer += got;
@@ -737,7 +741,7 @@ static void afterCopy(int outFd, off_t outOffset, int inFd, off_t inOffset, ssiz
     struct stat status;
     if (changedRegularFile(&written, &status) && config.hasRecord) {
         const size_t count = (size_t)done;
-        if (inOffset < 0) inOffset = (off_t)syscall(SYS_lseek, inFd, 0, SEEK_CUR) - (off_t)count;
+        if (inOffset < 0) inOffset = (off_t)rawSyscall(SYS_lseek, inFd, 0, SEEK_CUR) - (off_t)count;
         outOffset = writtenAt(outFd, outOffset, count, &status);
         unsigned char* bytes = recordMap(count);
         if (bytes == NULL) recordFailed("no memory for copied bytes");
@@ -968,6 +972,26 @@ EXPORT int creat(const char* path, mode_t mode) {
 EXPORT int creat64(const char* path, mode_t mode) {
     static void* slot;
     return forwardCreat(&slot, "creat64", path, mode);
+}
+
+/* openat2 has no glibc wrapper: programs reach it through syscall(), whose
+ * other numbers pass straight to the kernel. */
+EXPORT long syscall(long number, ...) {
+    va_list args;
+    va_start(args, number);
+    long a[6];
+    for (int i = 0; i < 6; ++i) a[i] = va_arg(args, long);
+    va_end(args);
+    if (number != SYS_openat2) return rawSyscall6(number, a[0], a[1], a[2], a[3], a[4], a[5]);
+    const struct open_how* how = (const struct open_how*)a[2];
+    const int flags = how != NULL ? (int)how->flags : 0;
+    const struct Target target = AT_TARGET((int)a[0], (const char*)a[1]);
+    if (decide("openat2", FAMILY_OPEN, openMutates(flags), target) == VERDICT_FAIL) return -1;
+    int existed = 0;
+    const int watched = watchOpen(&target, flags, &existed);
+    const long fd = rawSyscall(SYS_openat2, a[0], a[1], a[2], a[3]);
+    if (fd >= 0 && watched) afterOpen(&target, (int)fd, flags, existed);
+    return fd;
 }
 
 /* glibc's stdio opens through internal calls the shim cannot see. */

@@ -1,6 +1,7 @@
 #define _GNU_SOURCE
 
 #include "fault_record_line.h"
+#include "raw_syscall.h"
 
 #include <errno.h>
 #include <fcntl.h>
@@ -14,11 +15,11 @@ enum { kFixedBytes = 160 };
 
 void* recordMap(size_t size) {
     const long memory =
-        syscall(SYS_mmap, NULL, size == 0 ? 1 : size, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+        rawSyscall(SYS_mmap, NULL, size == 0 ? 1 : size, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
     return memory == -1 ? NULL : (void*)memory;
 }
 
-void recordUnmap(void* memory, size_t size) { syscall(SYS_munmap, memory, size == 0 ? 1 : size); }
+void recordUnmap(void* memory, size_t size) { rawSyscall(SYS_munmap, memory, size == 0 ? 1 : size); }
 
 static void put(struct RecordLine* line, const char* text, size_t length) {
     if (line->overflowed || line->capacity - line->length < length) {
@@ -106,14 +107,14 @@ int recordLineAppend(struct RecordLine* line, const char* file) {
     put(line, "\n", 1);
     int written = 0;
     if (!line->overflowed) {
-        const long fd = syscall(SYS_openat, AT_FDCWD, file, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0666);
+        const long fd = rawSyscall(SYS_openat, AT_FDCWD, file, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0666);
         if (fd >= 0) {
             long done;
             do {
-                done = syscall(SYS_write, fd, line->text, line->length);
+                done = rawSyscall(SYS_write, fd, line->text, line->length);
             } while (done < 0 && errno == EINTR);
             written = done == (long)line->length;
-            syscall(SYS_close, fd);
+            rawSyscall(SYS_close, fd);
         }
     }
     recordUnmap(line->text, line->capacity);

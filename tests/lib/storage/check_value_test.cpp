@@ -2,10 +2,14 @@
 
 #include <fcntl.h>
 #include <filesystem>
+#include <stdexcept>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <gtest/gtest.h>
 
 #include "files.h"
+#include "lib/util/fd.h"
 #include "scratch_dir.h"
 #include "store_files.h"
 
@@ -23,6 +27,29 @@ using store_test::setMtimeNs;
 using testing_support::ScratchDir;
 using testing_support::writeBytes;
 
+// A file opened as the store hands it to the check-value functions.
+struct Opened {
+    UniqueFd fd;
+    struct stat status {};
+};
+
+Opened opened(const std::filesystem::path& path) {
+    Opened file;
+    file.fd.reset(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!file.fd || ::fstat(file.fd.get(), &file.status) != 0) throw std::runtime_error("cannot open " + path.string());
+    return file;
+}
+
+Status computeFor(const std::filesystem::path& path, uint64_t& value) {
+    const Opened file = opened(path);
+    return Storage::computeCheckValue(file.fd.get(), file.status, value);
+}
+
+Status readFrom(const std::filesystem::path& path, uint64_t& value) {
+    const Opened file = opened(path);
+    return Storage::readCheckValue(file.fd.get(), file.status, value);
+}
+
 uint64_t littleEndian(const Bytes& bytes) {
     uint64_t value = 0;
     for (size_t i = bytes.size(); i-- > 0;) value = (value << 8) | bytes[i];
@@ -34,19 +61,13 @@ TEST(ReferenceCrc32, MatchesTheStandardCheckValue) {
     EXPECT_EQ(store_test::referenceCrc32({}), 0u);
 }
 
-TEST(ComputeCheckValue, AbsentFileIsAllOnes) {
-    ScratchDir dir;
-    uint64_t value = 0;
-    ASSERT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "data").c_str(), value), STATUS_OK);
-    EXPECT_EQ(value, 0xFFFFFFFFFFFFFFFFull);
-    EXPECT_EQ(Storage::kAbsentBlobCheckValue, 0xFFFFFFFFFFFFFFFFull);
-}
+TEST(CheckValue, AbsentBlobIsAllOnes) { EXPECT_EQ(Storage::kAbsentBlobCheckValue, 0xFFFFFFFFFFFFFFFFull); }
 
 TEST(ComputeCheckValue, EmptyFileIsZero) {
     ScratchDir dir;
     writeBytes(dir / "data", {});
     uint64_t value = 1;
-    ASSERT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "data").c_str(), value), STATUS_OK);
+    ASSERT_EQ(computeFor(dir / "data", value), STATUS_OK);
     EXPECT_EQ(value, 0u);
 }
 
@@ -54,7 +75,7 @@ TEST(ComputeCheckValue, KnownTextGivesSizeAndCrc) {
     ScratchDir dir;
     writeBytes(dir / "data", bytesOf("123456789"));
     uint64_t value = 0;
-    ASSERT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "data").c_str(), value), STATUS_OK);
+    ASSERT_EQ(computeFor(dir / "data", value), STATUS_OK);
     EXPECT_EQ(value, 0xCBF4392600000009ull);
 }
 
@@ -66,7 +87,7 @@ TEST_P(ComputeCheckValueSizes, MatchesTheReferenceLayout) {
     const Bytes data = patternBytes(GetParam(), static_cast<uint32_t>(GetParam()));
     writeBytes(dir / "data", data);
     uint64_t value = 0;
-    ASSERT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "data").c_str(), value), STATUS_OK);
+    ASSERT_EQ(computeFor(dir / "data", value), STATUS_OK);
     EXPECT_EQ(value, littleEndian(expectedCheckFile(data)));
 }
 
@@ -74,27 +95,45 @@ INSTANTIATE_TEST_SUITE_P(Blocks, ComputeCheckValueSizes,
                          ::testing::Values(1, 7, 4095, 4096, 4097, 8192, 12289, 65535, 65536, 65537,
                                            3 * 65536 + 5, 1000000));
 
+// A read error (a directory passed off as a data file) fails the value.
 TEST(ComputeCheckValue, UnreadableDataFails) {
     ScratchDir dir;
-    std::filesystem::create_directory(dir / "data");  // opens, but cannot be read
+    std::filesystem::create_directory(dir / "data");
     uint64_t value = 7;
-    EXPECT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "data").c_str(), value), STATUS_FAILED);
+    EXPECT_EQ(computeFor(dir / "data", value), STATUS_FAILED);
     EXPECT_EQ(value, 7u);
 }
 
-TEST(ComputeCheckValue, DataBelowAFileFails) {
+// Only a size that agrees with the stored one lets the data be read.
+TEST(MatchesCheckValue, AgreesWithTheComputedValue) {
     ScratchDir dir;
-    writeBytes(dir / "file", bytesOf("x"));
-    uint64_t value = 7;
-    EXPECT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "file" / "data").c_str(), value), STATUS_FAILED);
-    EXPECT_EQ(value, 7u);
+    const Bytes data = patternBytes(5000, 4);
+    writeBytes(dir / "data", data);
+    const Opened file = opened(dir / "data");
+    const uint64_t good = littleEndian(expectedCheckFile(data));
+    EXPECT_TRUE(Storage::matchesCheckValue(file.fd.get(), file.status, good));
+    EXPECT_FALSE(Storage::matchesCheckValue(file.fd.get(), file.status, good ^ (uint64_t{1} << 40)));  // the CRC
+    EXPECT_FALSE(Storage::matchesCheckValue(file.fd.get(), file.status, good + 1));                    // the size
+}
+
+// A read would move the file position; a size that cannot match leaves it.
+TEST(MatchesCheckValue, ADifferentSizeIsNotRead) {
+    ScratchDir dir;
+    const Bytes data = patternBytes(5000, 5);
+    writeBytes(dir / "data", data);
+    const Opened file = opened(dir / "data");
+    const uint64_t good = littleEndian(expectedCheckFile(data));
+    EXPECT_FALSE(Storage::matchesCheckValue(file.fd.get(), file.status, good - 1));
+    EXPECT_EQ(::lseek(file.fd.get(), 0, SEEK_CUR), 0);
+    EXPECT_TRUE(Storage::matchesCheckValue(file.fd.get(), file.status, good));
+    EXPECT_EQ(::lseek(file.fd.get(), 0, SEEK_CUR), 5000);
 }
 
 TEST(ReadCheckValue, EightBytesAreLittleEndian) {
     ScratchDir dir;
     writeBytes(dir / "data.chk", {0x01, 0x02, 0x03, 0x04, 0x05, 0x06, 0x07, 0x88});
     uint64_t value = 0;
-    ASSERT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value), STATUS_OK);
+    ASSERT_EQ(readFrom(dir / "data.chk", value), STATUS_OK);
     EXPECT_EQ(value, 0x8807060504030201ull);
 }
 
@@ -102,51 +141,18 @@ TEST(ReadCheckValue, AllOnes) {
     ScratchDir dir;
     writeBytes(dir / "data.chk", absentCheckFile());
     uint64_t value = 0;
-    ASSERT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value), STATUS_OK);
+    ASSERT_EQ(readFrom(dir / "data.chk", value), STATUS_OK);
     EXPECT_EQ(value, Storage::kAbsentBlobCheckValue);
 }
 
-TEST(ReadCheckValue, MissingFileIsNotFound) {
-    ScratchDir dir;
-    uint64_t value = 7;
-    Storage::CheckTime time{true, {1, 1}};
-    EXPECT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value, &time), STATUS_NOT_FOUND);
-    EXPECT_EQ(value, 7u);
-    EXPECT_FALSE(time.known);
-}
-
-TEST(ReadCheckValue, BelowAFileFails) {
-    ScratchDir dir;
-    writeBytes(dir / "file", bytesOf("x"));
-    uint64_t value = 7;
-    EXPECT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "file" / "data.chk").c_str(), value), STATUS_FAILED);
-    EXPECT_EQ(value, 7u);
-}
-
-TEST(ReadCheckValue, ReportsTheModificationTimeToTheNanosecond) {
+TEST(CheckTimeOf, TheModificationTimeToTheNanosecond) {
     ScratchDir dir;
     writeBytes(dir / "data.chk", absentCheckFile());
     setMtimeNs(dir / "data.chk", kPast + 123456789);
-    uint64_t value = 0;
-    Storage::CheckTime time;
-    ASSERT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value, &time), STATUS_OK);
+    const Storage::CheckTime time = Storage::checkTimeOf(opened(dir / "data.chk").status);
     EXPECT_TRUE(time.known);
     EXPECT_EQ(time.time.tv_sec, kPast / kSecond);
     EXPECT_EQ(time.time.tv_nsec, kPast % kSecond + 123456789);
-}
-
-// Opening compares the times of valid copies only, but the time comes with
-// every check file that could be opened.
-TEST(ReadCheckValue, ReportsTheTimeOfABadCheckFileToo) {
-    ScratchDir dir;
-    writeBytes(dir / "data.chk", Bytes(9, 0x00));
-    setMtimeNs(dir / "data.chk", kPast);
-    uint64_t value = 7;
-    Storage::CheckTime time;
-    EXPECT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value, &time), STATUS_FAILED);
-    EXPECT_EQ(value, 7u);
-    EXPECT_TRUE(time.known);
-    EXPECT_EQ(time.time.tv_sec, kPast / kSecond);
 }
 
 struct ClockEdge {
@@ -155,26 +161,23 @@ struct ClockEdge {
     bool known;
 };
 
-class ReadCheckValueClockEdge : public ::testing::TestWithParam<ClockEdge> {};
+class CheckTimeClockEdge : public ::testing::TestWithParam<ClockEdge> {};
 
 // std::filesystem::last_write_time reports an error (and the earliest time)
 // from second 9223372036 on; such a time is unknown here too.
-TEST_P(ReadCheckValueClockEdge, TimesBeyondTheFileClockAreUnknown) {
+TEST_P(CheckTimeClockEdge, TimesBeyondTheFileClockAreUnknown) {
     ScratchDir dir;
     writeBytes(dir / "data.chk", absentCheckFile());
     setMtimeNs(dir / "data.chk", GetParam().mtimeNs);
     if (mtimeNs(dir / "data.chk") != GetParam().mtimeNs) GTEST_SKIP() << "the file system cannot hold this time";
-    uint64_t value = 0;
-    Storage::CheckTime time;
-    ASSERT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value, &time), STATUS_OK);
-    EXPECT_EQ(time.known, GetParam().known);
+    EXPECT_EQ(Storage::checkTimeOf(opened(dir / "data.chk").status).known, GetParam().known);
 
     std::error_code error;
     (void)std::filesystem::last_write_time(dir / "data.chk", error);  // only whether it fails matters
     EXPECT_EQ(!error, GetParam().known) << error.message();
 }
 
-INSTANTIATE_TEST_SUITE_P(Edges, ReadCheckValueClockEdge,
+INSTANTIATE_TEST_SUITE_P(Edges, CheckTimeClockEdge,
                          ::testing::Values(ClockEdge{"epoch", 0, true}, ClockEdge{"before_epoch", -kSecond, true},
                                            ClockEdge{"last_second", 9223372035 * kSecond + 999999999, true},
                                            ClockEdge{"first_second_beyond", 9223372036 * kSecond, false}),
@@ -206,11 +209,12 @@ INSTANTIATE_TEST_SUITE_P(
                       LaterRow{"both_unknown", {false, {2, 0}}, {false, {1, 0}}, false}),
     [](const auto& info) { return std::string(info.param.name); });
 
+// A directory passed off as a check file is not 8 bytes long: not read.
 TEST(ReadCheckValue, DirectoryFails) {
     ScratchDir dir;
     std::filesystem::create_directory(dir / "data.chk");
     uint64_t value = 7;
-    EXPECT_EQ(Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value), STATUS_FAILED);
+    EXPECT_EQ(readFrom(dir / "data.chk", value), STATUS_FAILED);
     EXPECT_EQ(value, 7u);
 }
 
@@ -220,7 +224,7 @@ TEST_P(ReadCheckValueLength, OnlyEightBytesAreGood) {
     ScratchDir dir;
     writeBytes(dir / "data.chk", Bytes(GetParam(), 0x00));
     uint64_t value = 7;
-    const Status status = Storage::readCheckValue(AT_FDCWD, (dir / "data.chk").c_str(), value);
+    const Status status = readFrom(dir / "data.chk", value);
     if (GetParam() == 8) {
         EXPECT_EQ(status, STATUS_OK);
         EXPECT_EQ(value, 0u);
@@ -244,7 +248,7 @@ TEST(EncodeCheckValue, RoundTripsThroughAFile) {
     const Bytes data = patternBytes(300, 3);
     writeBytes(dir / "data", data);
     uint64_t value = 0;
-    ASSERT_EQ(Storage::computeCheckValue(AT_FDCWD, (dir / "data").c_str(), value), STATUS_OK);
+    ASSERT_EQ(computeFor(dir / "data", value), STATUS_OK);
     uint8_t bytes[Storage::kCheckValueSize] = {};
     Storage::encodeCheckValue(value, bytes);
     EXPECT_EQ(Bytes(bytes, bytes + 8), expectedCheckFile(data));

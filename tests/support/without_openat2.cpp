@@ -23,15 +23,15 @@ constexpr uint32_t kArchitecture = AUDIT_ARCH_AARCH64;
 #error "no seccomp architecture for this machine"
 #endif
 
-bool openat2Missing() {
+}  // namespace
+
+bool openat2Available() {
     struct open_how how {};
     how.flags = O_RDONLY | O_CLOEXEC;
     const long fd = ::syscall(SYS_openat2, AT_FDCWD, "/", &how, sizeof how);
     if (fd >= 0) ::close(static_cast<int>(fd));
-    return fd < 0 && errno == ENOSYS;
+    return !(fd < 0 && errno == ENOSYS);
 }
-
-}  // namespace
 
 bool withoutOpenat2() {
     struct sock_filter filter[] = {
@@ -48,7 +48,7 @@ bool withoutOpenat2() {
     program.filter = filter;
     // An emulator may refuse filters; it then usually lacks openat2 anyway.
     (void)(::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0 && ::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program) == 0);
-    return openat2Missing();
+    return !openat2Available();
 }
 
 }  // namespace testing_support

@@ -4,6 +4,10 @@
 
 namespace testing_support {
 
+// Whether this process can use openat2: not under an emulator (or on a
+// kernel) without it.
+bool openat2Available();
+
 // From now on openat2 fails with ENOSYS in this process and in every
 // process it starts (a seccomp filter; call it in a child). False when that
 // cannot be arranged while openat2 still works.

@@ -32,8 +32,9 @@ UniqueFd makeDirectoryAt(int parent, const char* name);
 // `status`, when not null, receives the file's fstat.
 UniqueFd openRegularAt(int directory, const char* name, int flags, mode_t mode = 0, struct stat* status = nullptr);
 
-// openRegularAt for a relative `path` of any number of components below
-// `directory`, in one call that follows no link anywhere on the way:
+// openRegularAt of an existing file (`flags` without O_CREAT) for a
+// relative `path` of any number of components below `directory`, in one
+// call that follows no link anywhere on the way:
 // openat2 with RESOLVE_NO_SYMLINKS and RESOLVE_BENEATH, so a link as any
 // component fails with ELOOP and a way out of `directory` with EXDEV.
 // ENOSYS where the kernel, or an emulator, has no openat2; from then on

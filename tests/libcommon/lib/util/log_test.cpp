@@ -501,6 +501,7 @@ TEST(LogThreads, ConcurrentLinesStayIntact) {
 // Syslog output, observed through a private /dev/log
 
 constexpr int kUnsharePermissionDenied = 77;
+constexpr int kNoMountToMakePrivate = 78;
 
 std::string ident() { return program_invocation_short_name; }
 
@@ -530,7 +531,14 @@ std::string describeDatagram(const std::string& datagram) {
 ProcessResult syslogInChild(int threshold, const std::function<void()>& body) {
     return runInChild([&] {
         if (unshare(CLONE_NEWNS) != 0) return errno == EPERM ? kUnsharePermissionDenied : 90;
-        if (mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) return 91;
+        // The tmpfs on /dev must not show outside. In a chroot "/" is no mount
+        // point; a bind-mounted /dev (as build chroots have) is enough then.
+        if (mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) {
+            if (errno != EINVAL) return 91;
+            if (mount(nullptr, "/dev", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) {
+                return errno == EINVAL ? kNoMountToMakePrivate : 96;
+            }
+        }
         if (mount("tmpfs", "/dev", "tmpfs", 0, nullptr) != 0) return 92;
         const int sock = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
         if (sock < 0) return 93;
@@ -558,9 +566,13 @@ ProcessResult syslogInChild(int threshold, const std::function<void()>& body) {
         GTEST_SKIP() << "needs root to give a child its own /dev/log in a private mount namespace"; \
     }
 
-#define SKIP_IF_UNSHARE_REFUSED(result)                                             \
-    if ((result).exitStatus == kUnsharePermissionDenied) {                         \
-        GTEST_SKIP() << "unshare(CLONE_NEWNS) refused with EPERM in this environment"; \
+#define SKIP_IF_UNSHARE_REFUSED(result)                                                                  \
+    if ((result).exitStatus == kUnsharePermissionDenied) {                                              \
+        GTEST_SKIP() << "unshare(CLONE_NEWNS) refused with EPERM in this environment";                  \
+    }                                                                                                   \
+    if ((result).exitStatus == kNoMountToMakePrivate) {                                                 \
+        GTEST_SKIP() << "neither / nor /dev is a mount point here (a chroot?): a private /dev/log would " \
+                        "show outside the test";                                                        \
     }
 
 TEST(LogSyslog, CriticalGoesToSyslogAndStandardErrorErrorOnlyToSyslog) {

@@ -306,7 +306,7 @@ TEST_F(BootVectorOnDevice, WriteWhenTheDeviceCannotBeOpened) {
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
               "built\n"
-              "libcommon/lib/util/fd:14 Failed to open /dev/mmcblk0: No such file or directory\n"
+              "libcommon/lib/util/fd:N Failed to open /dev/mmcblk0: No such file or directory\n"
               "lib/storage/storage_target:N Failed to write to flash: valid=0 written=0\n"
               "write 52\n"
               "read 0 20 " +

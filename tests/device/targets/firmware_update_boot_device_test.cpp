@@ -382,7 +382,7 @@ TEST_F(FirmwareUpdateBootOnDevice, FiveFailedReadBacks) {
     for (int attempt = 0; attempt < 5; ++attempt) {
         attempts +=
             "Opening \"/media/boot/BOOT0010.BIN\" for write\n"
-            "libcommon/lib/util/fd:14 Failed to open /media/boot/BOOT0010.BIN: Operation not permitted\n"
+            "libcommon/lib/util/fd:N Failed to open /media/boot/BOOT0010.BIN: Operation not permitted\n"
             "lib/storage/storage_target:N Failed to open BOOT.BIN for writing\n";
     }
     EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT0010.BIN", 1000) +

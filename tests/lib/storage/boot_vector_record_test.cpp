@@ -394,10 +394,10 @@ INSTANTIATE_TEST_SUITE_P(
         LocateRow{"Negative", "echo -5", "lib/storage/storage_target:N Boot vector 0 not in range 6291456 to 33554432\n"},
         // In range, so the device is opened next, and it is missing.
         LocateRow{"InRange", "echo ' 30703616 30777343 73728 36M'",
-                  "libcommon/lib/util/fd:14 Failed to open /dev/mmcblk0: No such file or directory\n"
+                  "libcommon/lib/util/fd:N Failed to open /dev/mmcblk0: No such file or directory\n"
                   "lib/storage/storage_target:N Boot vector query failed!\n"},
         LocateRow{"Fraction", "echo 12345678.9",
-                  "libcommon/lib/util/fd:14 Failed to open /dev/mmcblk0: No such file or directory\n"
+                  "libcommon/lib/util/fd:N Failed to open /dev/mmcblk0: No such file or directory\n"
                   "lib/storage/storage_target:N Boot vector query failed!\n"}),
     [](const ::testing::TestParamInfo<LocateRow>& info) { return std::string(info.param.name); });
 

@@ -14,6 +14,7 @@
 #include "files.h"
 #include "lib/util/log.h"
 #include "scratch_dir.h"
+#include "source_lines.h"
 
 namespace {
 
@@ -27,7 +28,7 @@ using testing_support::ScratchDir;
 using testing_support::writeBytes;
 
 // Scripts match the open failure by this fixed line of libcommon/lib/util/fd.
-const std::string kOpenFailurePrefix = "libcommon/lib/util/fd:14 Failed to open ";
+const std::string kOpenFailurePrefix = testing_support::openFailurePrefix();
 
 constexpr size_t kUnset = 0xA5A5A5A5;
 

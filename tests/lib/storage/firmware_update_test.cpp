@@ -17,6 +17,8 @@
 
 #include "child_process.h"
 #include "fake_mount_commands.h"
+#include "fault_injection.h"
+#include "files.h"
 #include "lib/storage/firmware_update_boot_target.h"
 #include "lib/storage/firmware_update_partition_target.h"
 #include "lib/util/log.h"
@@ -29,6 +31,7 @@ using Storage::FirmwareUpdateBootTarget;
 using Storage::FirmwareUpdatePartitionTarget;
 using Storage::TargetSlot;
 using testing_support::FakeMountCommands;
+using testing_support::ProcessResult;
 using testing_support::normalisedStorageLog;
 using testing_support::runInChild;
 
@@ -54,6 +57,12 @@ Bytes pattern(size_t size, uint8_t seed) {
 }
 
 Status writeAt(TargetSlot& slot, int64_t offset, const Bytes& data) { return slot.writeAt(offset, data.data(), data.size()); }
+
+size_t countOf(const std::string& text, const std::string& part) {
+    size_t count = 0;
+    for (size_t at = text.find(part); at != std::string::npos; at = text.find(part, at + part.size())) ++count;
+    return count;
+}
 
 // ---- the boot-file target ----
 
@@ -402,6 +411,76 @@ TEST(FirmwareUpdateBoot, FailedRemountEndsTheUpdate) {
               "Closing #1\n"
               "finalise 52 valid 0\n");
     EXPECT_EQ(fake.calls(), "mount [-o] [remount,rw] [/media/boot]\n");
+}
+
+// Without a boot partition every attempt fails to open the boot file and
+// its read-back finds nothing: five attempts, then the read-only remount.
+TEST(FirmwareUpdateBoot, UnwritableBootFileIsTriedFiveTimes) {
+    if (fs::exists("/media/boot")) GTEST_SKIP() << "this host has a /media/boot";
+    FakeMountCommands fake;
+    const auto result = fake.run(LOG_PRIORITY_INFO, [] {
+        FirmwareUpdateBootTarget target;
+        TargetSlot& slot = *target.getSlot(0).get();
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
+        const Status status = slot.finalise();
+        std::printf("finalise %u valid %d\n", status, slot.isValid() ? 1 : 0);
+        return 0;
+    });
+    std::string attempts;
+    for (int attempt = 0; attempt < 5; ++attempt) {
+        attempts +=
+            "Opening \"/media/boot/BOOT.BIN\" for write\n"
+            "libcommon/lib/util/fd:N Failed to open /media/boot/BOOT.BIN: No such file or directory\n"
+            "lib/storage/storage_target:N Failed to open BOOT.BIN for writing\n";
+    }
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(normalisedStorageLog(result.out),
+              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
+              "Opened #1 for receiving firmware\n"
+              "begin 0\n"
+              "writeAt 0\n"
+              "lib/storage/storage_target:N TODO: Sanity-check the file\n"
+              "\"/media/boot/BOOT.BIN\" update with 10 bytes written\n"
+              "\"/media/boot/BOOT.BIN\" needs updating\n"
+              "Remounting \"/media/boot\" as rw\n" +
+                  attempts +
+                  "Remounting \"/media/boot\" as ro\n"
+                  "Closing #1\n"
+                  "finalise 52 valid 0\n");
+    EXPECT_EQ(fake.calls(), "mount [-o] [remount,rw] [/media/boot]\nmount [-o] [remount,ro] [/media/boot]\n");
+}
+
+// The same seen from outside the process: the shim counts one open of the
+// boot file per attempt, and failing the first one with EIO changes nothing
+// but its message.
+TEST(FirmwareUpdateBootHostFaults, EveryAttemptOpensTheBootFileOnce) {
+    if (!testing_support::programEmulator().empty()) {
+        GTEST_SKIP() << "native builds only: the shim cannot be preloaded under qemu-aarch64";
+    }
+    if (fs::exists("/media/boot")) GTEST_SKIP() << "this host has a /media/boot";
+    FakeMountCommands fake;
+    testing_support::ScratchDir dir;
+    const Bytes data = pattern(5000, 4);
+    testing_support::writeBytes(dir / "data", data);
+    const std::string counts = (dir / "count").string();
+    const auto drive = [&](testing_support::Environment env) {
+        env["PATH"] = fake.searchPath();
+        return testing_support::runProgram({DEVICE_TARGET_DRIVER, "boot-update", "0", (dir / "data").string()}, env);
+    };
+
+    const ProcessResult counted = drive(testing_support::faultCountEnv("open", counts, "/media/boot/BOOT.BIN"));
+    EXPECT_EQ(counted.exitStatus, 0) << counted.err;
+    EXPECT_EQ(testing_support::readFaultCount(counts), 5u);
+    EXPECT_EQ(countOf(counted.out, "Failed to open /media/boot/BOOT.BIN: No such file or directory\n"), 5u);
+    EXPECT_EQ(countOf(counted.out, "finalise 52 valid 0\n"), 1u);
+
+    const ProcessResult failed = drive(testing_support::faultEnv("open", 1, "errno:EIO", "/media/boot/BOOT.BIN", counts));
+    EXPECT_EQ(failed.exitStatus, 0) << failed.err;
+    EXPECT_EQ(testing_support::readFaultCount(counts), 5u);
+    EXPECT_EQ(countOf(failed.out, "Failed to open /media/boot/BOOT.BIN: Input/output error\n"), 1u);
+    EXPECT_EQ(countOf(failed.out, "Failed to open /media/boot/BOOT.BIN: No such file or directory\n"), 4u);
+    EXPECT_EQ(countOf(failed.out, "finalise 52 valid 0\n"), 1u);
 }
 
 // Destroying a slot in the middle of an update closes its temporary file.

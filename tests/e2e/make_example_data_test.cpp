@@ -112,6 +112,19 @@ TEST_F(MakeExampleData, UnwritableFileIsNamedWithTheReason) {
     EXPECT_EQ(result.err, "make_example_data: cannot write '" + missing.string() + "': No such file or directory\n");
 }
 
+// A full device takes what fits in the stream's buffer and fails at the
+// close; a block larger than the buffer fails at the write.
+TEST_F(MakeExampleData, FailedWritesAreNamedWithTheReason) {
+    if (!fs::exists("/dev/full")) GTEST_SKIP() << "needs /dev/full";
+    for (const std::vector<std::string>& args : {std::vector<std::string>{"settings", "/dev/full", "4"},
+                                                 std::vector<std::string>{"lut", "/dev/full"}}) {
+        const ProcessResult result = generate(args);
+        EXPECT_EQ(result.exitStatus, 1) << args[0];
+        EXPECT_EQ(result.out, "") << args[0];
+        EXPECT_EQ(result.err, "make_example_data: cannot write '/dev/full': No space left on device\n") << args[0];
+    }
+}
+
 TEST_F(MakeExampleData, HelpSaysWhatSizeMeansForEachKind) {
     for (const char* option : {"--help", "-h"}) {
         const ProcessResult result = generate({option});

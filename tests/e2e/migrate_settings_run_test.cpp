@@ -9,6 +9,7 @@
 
 #include <gtest/gtest.h>
 
+#include "fault_injection.h"
 #include "scratch_dir.h"
 #include "tool_run.h"
 
@@ -370,6 +371,22 @@ TEST_F(MigrateSettingsExitStatus, FailedWriteOfTheDataFileIsOne) {
     ASSERT_GE(result.out.size(), message.size());
     EXPECT_EQ(result.out.substr(result.out.size() - message.size()), message);
     EXPECT_EQ(result.out.find('\n'), result.out.size() - 1) << "one line only: " << result.out;
+    expectNothingStored();
+}
+
+// The data file can be sized but not opened (the shim fails the open): the
+// run fails without a line, as only sizing failures are logged.
+TEST_F(MigrateSettingsExitStatus, UnopenableDataFileIsOneAndSilent) {
+    if (!testing_support::programEmulator().empty()) {
+        GTEST_SKIP() << "native builds only: the shim cannot be preloaded under qemu-aarch64";
+    }
+    const std::string data = dataFile("block", Bytes{1, 2, 3, 4, 5});
+    const ProcessResult result = e2e::withoutBootVectorFailure(testing_support::runProgram(
+        {e2e::kBinary, "--base", base.string(), "--target", "calib_save", "--type", "simple", "--data", data},
+        testing_support::faultEnv("open", 1, "errno:EACCES", "/block")));
+    EXPECT_EQ(result.exitStatus, 1);
+    EXPECT_EQ(result.out, "");
+    EXPECT_EQ(result.err, "");
     expectNothingStored();
 }
 

@@ -451,6 +451,25 @@ TEST(FirmwareUpdateBoot, UnwritableBootFileIsTriedFiveTimes) {
     EXPECT_EQ(fake.calls(), "mount [-o] [remount,rw] [/media/boot]\nmount [-o] [remount,ro] [/media/boot]\n");
 }
 
+// At the critical threshold the same failing update says nothing, and ends
+// as it does when it talks.
+TEST(FirmwareUpdateBoot, FailingUpdateIsSilentAtTheCriticalThreshold) {
+    if (fs::exists("/media/boot")) GTEST_SKIP() << "this host has a /media/boot";
+    FakeMountCommands fake;
+    const auto result = fake.run(LOG_PRIORITY_CRITICAL, [] {
+        FirmwareUpdateBootTarget target;
+        TargetSlot& slot = *target.getSlot(0).get();
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
+        std::printf("finalise %u\n", slot.finalise());
+        return 0;
+    });
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(result.out, "begin 0\nbegin 0\nwriteAt 0\nfinalise 52\n");
+    EXPECT_EQ(fake.calls(), "mount [-o] [remount,rw] [/media/boot]\nmount [-o] [remount,ro] [/media/boot]\n");
+}
+
 // The same seen from outside the process: the shim counts one open of the
 // boot file per attempt, and failing the first one with EIO changes nothing
 // but its message.
@@ -560,26 +579,32 @@ TEST(FirmwareUpdatePartition, IdleSlot) {
 
 TEST(FirmwareUpdatePartition, BeginWithoutTheBlockDevice) {
     if (fs::exists("/dev/mmcblk0p2")) GTEST_SKIP() << "this host has a /dev/mmcblk0p2";
-    FakeMountCommands fake;
-    const auto result = fake.run(LOG_PRIORITY_DEBUG, [] {
-        FirmwareUpdatePartitionTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
-        {
-            const Status status = slot.beginWrite();
-            std::printf("begin %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
-        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
-        std::printf("finalise %u\n", slot.finalise());
-        return 0;
-    });
-    EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              "lib/storage/storage_target:N Unable to locate block device \"/dev/mmcblk0p2\"\n"
-              "begin 2 valid 0\n"
-              "writeAt 95\n"
-              "finalise 2\n");
-    // Nothing was unmounted.
-    EXPECT_EQ(fake.calls(), "");
+    // The error line shows down to the error threshold only.
+    for (const int threshold : {LOG_PRIORITY_DEBUG, LOG_PRIORITY_ERROR, LOG_PRIORITY_CRITICAL}) {
+        FakeMountCommands fake;
+        const auto result = fake.run(threshold, [] {
+            FirmwareUpdatePartitionTarget target;
+            TargetSlot& slot = *target.getSlot(0).get();
+            {
+                const Status status = slot.beginWrite();
+                std::printf("begin %u valid %d\n", status, slot.isValid() ? 1 : 0);
+            }
+            std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
+            std::printf("finalise %u\n", slot.finalise());
+            return 0;
+        });
+        EXPECT_EQ(result.exitStatus, 0) << threshold;
+        EXPECT_EQ(normalisedStorageLog(result.out),
+                  std::string(threshold >= LOG_PRIORITY_ERROR
+                                  ? "lib/storage/storage_target:N Unable to locate block device \"/dev/mmcblk0p2\"\n"
+                                  : "") +
+                      "begin 2 valid 0\n"
+                      "writeAt 95\n"
+                      "finalise 2\n")
+            << threshold;
+        // Nothing was unmounted.
+        EXPECT_EQ(fake.calls(), "") << threshold;
+    }
 }
 
 }  // namespace

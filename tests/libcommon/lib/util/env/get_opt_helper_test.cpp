@@ -563,6 +563,18 @@ TEST(GetOptHelperUsage, TextRowsAreCopiedVerbatimAndUnknownKindsShowNothing) {
               "  no newline   -b                      B.\n");
 }
 
+// Null texts count as empty ones: no help, no default, no text.
+TEST(GetOptHelperUsage, NullHelpDefaultAndTextShowNothing) {
+    const std::vector<Row> table = {
+        row(0, nullptr, 0, Kind::Text, nullptr),
+        row('a', "alpha", 1, Kind::Plain, nullptr, nullptr),
+        row('b', "beta", 0, Kind::Plain, "Beta help.", nullptr),
+    };
+    EXPECT_EQ(usageOf(table),
+              "  -a, --alpha=arg\n"
+              "  -b, --beta              Beta help.\n");
+}
+
 TEST(GetOptHelperUsage, OptionPartOf24StaysOnTheLineAnd25MovesHelpToTheNextLine) {
     const std::vector<Row> table = {
         row('a', "sixteen-chars-ab", 0, Kind::Plain, "Fits."),          // col 24

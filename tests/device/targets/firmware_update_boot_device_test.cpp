@@ -209,6 +209,20 @@ TEST_F(FirmwareUpdateBootOnDevice, DifferentDataIsWrittenAndReadBack) {
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")) == data, true);
 }
 
+// The size alone does not decide: one byte differing in the last block of
+// a file of the same size is found by the comparison and written.
+TEST_F(FirmwareUpdateBootOnDevice, SameSizeWithOneByteChangedIsWritten) {
+    Bytes data = fileBytes(sd::originalBootFile("BOOT.BIN"));
+    ASSERT_GT(data.size(), 4096u);
+    data.back() = static_cast<uint8_t>(data.back() ^ 0x01);
+    const ProcessResult result = update(0, data);
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(normalisedStorageLog(result.out),
+              receivedLines("BOOT.BIN", data.size()) + rewrittenLines("BOOT.BIN", data.size()));
+    EXPECT_EQ(recorder.calls(), std::string(kRemountRw) + kRemountRo);
+    EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")) == data, true);
+}
+
 TEST_F(FirmwareUpdateBootOnDevice, ShorterDataReplacesTheWholeFile) {
     const Bytes data = pattern(3, 8);
     const ProcessResult result = update(1, data);

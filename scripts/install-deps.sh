@@ -10,6 +10,7 @@
 #                           build for ARM64
 #   install-deps.sh coverage  also what the tests need, and gcovr for the
 #                           coverage report
+#   install-deps.sh format  also clang-format
 #   install-deps.sh fuzz    also clang and its libFuzzer runtime
 #   install-deps.sh bench   also the micro-benchmark library, zlib (the CRC
 #                           reference), sfdisk (run by every registry
@@ -24,6 +25,7 @@ for group in "$@"; do
     tests) packages+=(fdisk e2fsprogs strace make pkgconf) ;;
     coverage) packages+=(fdisk e2fsprogs strace make pkgconf gcovr) ;;
     cross) packages+=(g++-aarch64-linux-gnu qemu-user googletest file) ;;
+    format) packages+=(clang-format) ;;
     fuzz) packages+=(clang libclang-rt-14-dev) ;;
     bench) packages+=(libbenchmark-dev zlib1g-dev fdisk hyperfine libubootenv-tool sqlite3 time python3) ;;
     *) echo "unknown package group: $group" >&2; exit 2 ;;

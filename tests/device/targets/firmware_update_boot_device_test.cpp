@@ -17,6 +17,7 @@
 
 #include <gtest/gtest.h>
 
+#include "boot_update_log.h"
 #include "device_test_support.h"
 #include "fault_injection.h"
 #include "files.h"
@@ -39,8 +40,8 @@ using Storage::TargetSlot;
 using testing_support::normalisedStorageLog;
 using testing_support::ProcessResult;
 
-constexpr const char* kRemountRw = "mount [-o] [remount,rw] [/media/boot]\n";
-constexpr const char* kRemountRo = "mount [-o] [remount,ro] [/media/boot]\n";
+constexpr const char* kRemountRw = testing_support::kBootRemountRwCall;
+constexpr const char* kRemountRo = testing_support::kBootRemountRoCall;
 
 fs::path bootFile(const std::string& name) { return fs::path(sd::kBootMount) / name; }
 
@@ -49,13 +50,7 @@ std::string quoted(const std::string& name) { return "\"/media/boot/" + name + "
 // The log of a begin and a transfer that both succeeded, up to the
 // update-size message of finalise.
 std::string receivedLines(const std::string& name, size_t bytes) {
-    return "Beginning update of /boot file " + quoted(name) +
-           "\n"
-           "Opened #1 for receiving firmware\n"
-           "begin 0\n"
-           "writes 0\n"
-           "lib/storage/storage_target:N TODO: Sanity-check the file\n" +
-           quoted(name) + " update with " + std::to_string(bytes) + " bytes written\n";
+    return testing_support::begunLines(name) + "begin 0\nwrites 0\n" + testing_support::finalisingLines(name, bytes);
 }
 
 const std::string kUpToDateLines =
@@ -64,9 +59,7 @@ const std::string kUpToDateLines =
     "finalise 0 valid 0\n";
 
 std::string rewrittenLines(const std::string& name, size_t bytes) {
-    return quoted(name) +
-           " needs updating\n"
-           "Remounting \"/media/boot\" as rw\n"
+    return testing_support::needsUpdatingLines(name) +
            "Opening " +
            quoted(name) +
            " for write\n"
@@ -369,8 +362,7 @@ TEST_F(FirmwareUpdateBootOnDevice, FailedRemountEndsTheUpdate) {
     const ProcessResult result = update(0, pattern(100, 2), 4096, {{"FAKE_MOUNT_EXIT", "32"}});
     EXPECT_EQ(normalisedStorageLog(result.out),
               receivedLines("BOOT.BIN", 100) +
-                  "\"/media/boot/BOOT.BIN\" needs updating\n"
-                  "Remounting \"/media/boot\" as rw\n"
+                  testing_support::needsUpdatingLines("BOOT.BIN") +
                   "lib/storage/storage_target:N Failed to execute mount\n"
                   "Closing #1\n"
                   "finalise 52 valid 0\n");
@@ -400,8 +392,7 @@ TEST_F(FirmwareUpdateBootOnDevice, FiveFailedReadBacks) {
             "lib/storage/storage_target:N Failed to open BOOT.BIN for writing\n";
     }
     EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT0010.BIN", 1000) +
-                                          "\"/media/boot/BOOT0010.BIN\" needs updating\n"
-                                          "Remounting \"/media/boot\" as rw\n" +
+                                          testing_support::needsUpdatingLines("BOOT0010.BIN") +
                                           attempts +
                                           "Remounting \"/media/boot\" as ro\n"
                                           "Closing #1\n"
@@ -432,8 +423,7 @@ TEST_F(FirmwareUpdateBootFaults, ShortCopyIsRetried) {
     const ProcessResult result = runDriver(testing_support::faultEnv("write", 1, "short:100", "BOOT.BIN"), data);
     EXPECT_EQ(result.exitStatus, 0) << result.err;
     EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 9000) +
-                                          "\"/media/boot/BOOT.BIN\" needs updating\n"
-                                          "Remounting \"/media/boot\" as rw\n"
+                                          testing_support::needsUpdatingLines("BOOT.BIN") +
                                           "Opening \"/media/boot/BOOT.BIN\" for write\n"
                                           "Wrote 100 bytes\n"
                                           "Opening \"/media/boot/BOOT.BIN\" for write\n"
@@ -454,8 +444,7 @@ TEST_F(FirmwareUpdateBootFaults, FailedCopyIsReportedAndRetried) {
     const ProcessResult result = runDriver(testing_support::faultEnv("write", 2, "errno:EIO", "BOOT.BIN"), data);
     EXPECT_EQ(result.exitStatus, 0) << result.err;
     EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 9000) +
-                                          "\"/media/boot/BOOT.BIN\" needs updating\n"
-                                          "Remounting \"/media/boot\" as rw\n"
+                                          testing_support::needsUpdatingLines("BOOT.BIN") +
                                           "Opening \"/media/boot/BOOT.BIN\" for write\n"
                                           "lib/storage/storage_target:N cat: write failed: 5: Input/output error\n"
                                           "Wrote 4096 bytes\n"

@@ -7,6 +7,8 @@
 #include <cstdlib>
 #include <fcntl.h>
 #include <filesystem>
+#include <functional>
+#include <map>
 #include <string>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -15,6 +17,7 @@
 
 #include <gtest/gtest.h>
 
+#include "boot_update_log.h"
 #include "child_process.h"
 #include "fake_mount_commands.h"
 #include "fault_injection.h"
@@ -30,7 +33,12 @@ namespace fs = std::filesystem;
 using Storage::FirmwareUpdateBootTarget;
 using Storage::FirmwareUpdatePartitionTarget;
 using Storage::TargetSlot;
+using testing_support::begunLines;
 using testing_support::FakeMountCommands;
+using testing_support::finalisingLines;
+using testing_support::kBootRemountRoCall;
+using testing_support::kBootRemountRwCall;
+using testing_support::needsUpdatingLines;
 using testing_support::ProcessResult;
 using testing_support::normalisedStorageLog;
 using testing_support::runInChild;
@@ -57,6 +65,30 @@ Bytes pattern(size_t size, uint8_t seed) {
 }
 
 Status writeAt(TargetSlot& slot, int64_t offset, const Bytes& data) { return slot.writeAt(offset, data.data(), data.size()); }
+
+// Runs `body` on slot `index` of a new boot-file target in a child, with
+// the log on standard output at `threshold`; optionally with the stand-in
+// mount commands first on PATH.
+ProcessResult onBootSlot(size_t index, int threshold, const std::function<int(TargetSlot&)>& body) {
+    return runInChild([&] {
+        setLogOutput(LOG_OUTPUT_STDOUT);
+        setLogLevel(threshold);
+        FirmwareUpdateBootTarget target;
+        return body(*target.getSlot(index).get());
+    });
+}
+
+ProcessResult onBootSlot(const FakeMountCommands& fake, size_t index, int threshold,
+                         const std::function<int(TargetSlot&)>& body,
+                         const std::map<std::string, std::string>& env = {}) {
+    return fake.run(
+        threshold,
+        [&] {
+            FirmwareUpdateBootTarget target;
+            return body(*target.getSlot(index).get());
+        },
+        env);
+}
 
 size_t countOf(const std::string& text, const std::string& part) {
     size_t count = 0;
@@ -89,9 +121,7 @@ TEST(FirmwareUpdateBoot, TwoSlotsOnePerBootFile) {
 // said about it.
 TEST(FirmwareUpdateBoot, IdleSlot) {
     FakeMountCommands fake;
-    const auto result = fake.run(LOG_PRIORITY_DEBUG, [] {
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(fake, 0, LOG_PRIORITY_DEBUG, [](TargetSlot& slot) {
         const Bytes data = pattern(10, 1);
         uint8_t buffer[10] = {};
         size_t got = 5;
@@ -121,11 +151,7 @@ TEST(FirmwareUpdateBoot, IdleSlot) {
 }
 
 TEST(FirmwareUpdateBoot, BeginOpensAnUnnamedTemporaryFile) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_DEBUG);
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(0, LOG_PRIORITY_DEBUG, [](TargetSlot& slot) {
         {
             const Status status = slot.beginWrite();
             std::printf("begin %u valid %d\n", status, slot.isValid() ? 1 : 0);
@@ -135,8 +161,7 @@ TEST(FirmwareUpdateBoot, BeginOpensAnUnnamedTemporaryFile) {
     });
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT.BIN", 1) +
               "begin 0 valid 1\n"
               "fd #1 (deleted) cloexec 1\n");
 }
@@ -150,18 +175,13 @@ TEST(FirmwareUpdateBoot, SecondSlotIsBoot0010) {
         return 0;
     });
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT0010.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT0010.BIN", 1) +
               "begin 0\n"
               "slot 0 valid 0\n");
 }
 
 TEST(FirmwareUpdateBoot, NothingBelowWarningPriority) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_ERROR);
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(0, LOG_PRIORITY_ERROR, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("erase %u\n", slot.erase());
@@ -171,11 +191,7 @@ TEST(FirmwareUpdateBoot, NothingBelowWarningPriority) {
 }
 
 TEST(FirmwareUpdateBoot, BeginTwiceRestarts) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_INFO);
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(100, 1)));
         {
@@ -187,14 +203,12 @@ TEST(FirmwareUpdateBoot, BeginTwiceRestarts) {
     });
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT.BIN", 1) +
               "begin 0\n"
               "writeAt 0\n"
               "Restarting firmware update!\n"
-              "Closing #1\n"
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #2 for receiving firmware\n"
+              "Closing #1\n" +
+              begunLines("BOOT.BIN", 2) +
               "begin 0 valid 1\n"
               "fd #2 (deleted) cloexec 1\n");
 }
@@ -202,11 +216,7 @@ TEST(FirmwareUpdateBoot, BeginTwiceRestarts) {
 // The restart's own count starts at 0: nothing received after it means a
 // failed finalise, whatever came before.
 TEST(FirmwareUpdateBoot, RestartForgetsWhatWasReceived) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_INFO);
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         (void)slot.beginWrite();
         (void)writeAt(slot, 0, pattern(100, 1));
         (void)slot.beginWrite();
@@ -216,18 +226,15 @@ TEST(FirmwareUpdateBoot, RestartForgetsWhatWasReceived) {
     });
     const std::string out = normalisedStorageLog(result.out);
     EXPECT_EQ(out.substr(out.find("--\n")),
-              "--\n"
-              "lib/storage/storage_target:N TODO: Sanity-check the file\n"
-              "\"/media/boot/BOOT.BIN\" update with 0 bytes written\n"
+              "--\n" +
+              finalisingLines("BOOT.BIN", 0) +
               "Closing #2\n"
               "finalise 52\n");
 }
 
 TEST(FirmwareUpdateBoot, FinaliseWithNothingReceivedFails) {
     FakeMountCommands fake;
-    const auto result = fake.run(LOG_PRIORITY_INFO, [] {
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(fake, 0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         {
             const Status status = slot.finalise();
@@ -239,11 +246,9 @@ TEST(FirmwareUpdateBoot, FinaliseWithNothingReceivedFails) {
     });
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
-              "begin 0\n"
-              "lib/storage/storage_target:N TODO: Sanity-check the file\n"
-              "\"/media/boot/BOOT.BIN\" update with 0 bytes written\n"
+              begunLines("BOOT.BIN", 1) +
+              "begin 0\n" +
+              finalisingLines("BOOT.BIN", 0) +
               "Closing #1\n"
               "finalise 52 valid 0\n"
               "finalise 2\n");
@@ -253,9 +258,7 @@ TEST(FirmwareUpdateBoot, FinaliseWithNothingReceivedFails) {
 // Empty blocks count nothing either.
 TEST(FirmwareUpdateBoot, EmptyWritesCountNothing) {
     FakeMountCommands fake;
-    const auto result = fake.run(LOG_PRIORITY_ERROR, [] {
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(1).get();
+    const auto result = onBootSlot(fake, 1, LOG_PRIORITY_ERROR, [](TargetSlot& slot) {
         const Bytes none;
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, none));
@@ -273,11 +276,7 @@ TEST(FirmwareUpdateBoot, EmptyWritesCountNothing) {
 }
 
 TEST(FirmwareUpdateBoot, EraseAbandonsTheUpdate) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_INFO);
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(1).get();
+    const auto result = onBootSlot(1, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
         {
@@ -291,8 +290,7 @@ TEST(FirmwareUpdateBoot, EraseAbandonsTheUpdate) {
         return 0;
     });
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT0010.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT0010.BIN", 1) +
               "begin 0\n"
               "writeAt 0\n"
               "Closing #1\n"
@@ -305,11 +303,7 @@ TEST(FirmwareUpdateBoot, EraseAbandonsTheUpdate) {
 // pwrite refuses a negative offset; the errno comes back and the update is
 // over, so the next block is refused.
 TEST(FirmwareUpdateBoot, StreamedWriteAfterAFailedOneIsRefused) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_INFO);
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
         {
@@ -321,8 +315,7 @@ TEST(FirmwareUpdateBoot, StreamedWriteAfterAFailedOneIsRefused) {
         return 0;
     });
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT.BIN", 1) +
               "begin 0\n"
               "writeAt 0\n"
               "Closing #1\n"
@@ -356,15 +349,13 @@ TEST(FirmwareUpdateBoot, ShortOrFailedStreamedWriteEndsTheUpdate) {
     });
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT.BIN", 1) +
               "begin 0\n"
               "writeAt 0\n"
               "Closing #1\n"
               "writeAt 52\n"
-              "writeAt 95\n"
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #2 for receiving firmware\n"
+              "writeAt 95\n" +
+              begunLines("BOOT.BIN", 2) +
               "begin 0\n"
               "Closing #2\n"
               "writeAt 27\n"
@@ -378,39 +369,31 @@ TEST(FirmwareUpdateBoot, ShortOrFailedStreamedWriteEndsTheUpdate) {
 TEST(FirmwareUpdateBoot, FailedRemountEndsTheUpdate) {
     if (fs::exists("/media/boot")) GTEST_SKIP() << "this host has a /media/boot";
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_INFO,
-        [] {
-            FirmwareUpdateBootTarget target;
-            TargetSlot& slot = *target.getSlot(0).get();
-            std::printf("begin %u\n", slot.beginWrite());
-            std::printf("writeAt %u\n", writeAt(slot, 100, pattern(10, 1)));
-            std::printf("writeAt %u\n", writeAt(slot, 0, pattern(7, 2)));
-            std::printf("writeAt %u\n", writeAt(slot, 100, pattern(13, 3)));
-            {
-                const Status status = slot.finalise();
-                std::printf("finalise %u valid %d\n", status, slot.isValid() ? 1 : 0);
-            }
-            printTemporaryDescriptors();
-            return 0;
-        },
-        {{"FAKE_MOUNT_EXIT", "32"}});
+    const auto result = onBootSlot(fake, 0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("writeAt %u\n", writeAt(slot, 100, pattern(10, 1)));
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(7, 2)));
+        std::printf("writeAt %u\n", writeAt(slot, 100, pattern(13, 3)));
+        {
+            const Status status = slot.finalise();
+            std::printf("finalise %u valid %d\n", status, slot.isValid() ? 1 : 0);
+        }
+        printTemporaryDescriptors();
+        return 0;
+    }, {{"FAKE_MOUNT_EXIT", "32"}});
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT.BIN", 1) +
               "begin 0\n"
               "writeAt 0\n"
               "writeAt 0\n"
-              "writeAt 0\n"
-              "lib/storage/storage_target:N TODO: Sanity-check the file\n"
-              "\"/media/boot/BOOT.BIN\" update with 30 bytes written\n"
-              "\"/media/boot/BOOT.BIN\" needs updating\n"
-              "Remounting \"/media/boot\" as rw\n"
+              "writeAt 0\n" +
+              finalisingLines("BOOT.BIN", 30) +
+              needsUpdatingLines("BOOT.BIN") +
               "lib/storage/storage_target:N Failed to execute mount\n"
               "Closing #1\n"
               "finalise 52 valid 0\n");
-    EXPECT_EQ(fake.calls(), "mount [-o] [remount,rw] [/media/boot]\n");
+    EXPECT_EQ(fake.calls(), kBootRemountRwCall);
 }
 
 // Without a boot partition every attempt fails to open the boot file and
@@ -418,9 +401,7 @@ TEST(FirmwareUpdateBoot, FailedRemountEndsTheUpdate) {
 TEST(FirmwareUpdateBoot, UnwritableBootFileIsTriedFiveTimes) {
     if (fs::exists("/media/boot")) GTEST_SKIP() << "this host has a /media/boot";
     FakeMountCommands fake;
-    const auto result = fake.run(LOG_PRIORITY_INFO, [] {
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(fake, 0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
         const Status status = slot.finalise();
@@ -436,19 +417,16 @@ TEST(FirmwareUpdateBoot, UnwritableBootFileIsTriedFiveTimes) {
     }
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT.BIN", 1) +
               "begin 0\n"
-              "writeAt 0\n"
-              "lib/storage/storage_target:N TODO: Sanity-check the file\n"
-              "\"/media/boot/BOOT.BIN\" update with 10 bytes written\n"
-              "\"/media/boot/BOOT.BIN\" needs updating\n"
-              "Remounting \"/media/boot\" as rw\n" +
+              "writeAt 0\n" +
+              finalisingLines("BOOT.BIN", 10) +
+              needsUpdatingLines("BOOT.BIN") +
                   attempts +
                   "Remounting \"/media/boot\" as ro\n"
                   "Closing #1\n"
                   "finalise 52 valid 0\n");
-    EXPECT_EQ(fake.calls(), "mount [-o] [remount,rw] [/media/boot]\nmount [-o] [remount,ro] [/media/boot]\n");
+    EXPECT_EQ(fake.calls(), std::string(kBootRemountRwCall) + kBootRemountRoCall);
 }
 
 // At the critical threshold the same failing update says nothing, and ends
@@ -456,9 +434,7 @@ TEST(FirmwareUpdateBoot, UnwritableBootFileIsTriedFiveTimes) {
 TEST(FirmwareUpdateBoot, FailingUpdateIsSilentAtTheCriticalThreshold) {
     if (fs::exists("/media/boot")) GTEST_SKIP() << "this host has a /media/boot";
     FakeMountCommands fake;
-    const auto result = fake.run(LOG_PRIORITY_CRITICAL, [] {
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(fake, 0, LOG_PRIORITY_CRITICAL, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
@@ -467,7 +443,7 @@ TEST(FirmwareUpdateBoot, FailingUpdateIsSilentAtTheCriticalThreshold) {
     });
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(result.out, "begin 0\nbegin 0\nwriteAt 0\nfinalise 52\n");
-    EXPECT_EQ(fake.calls(), "mount [-o] [remount,rw] [/media/boot]\nmount [-o] [remount,ro] [/media/boot]\n");
+    EXPECT_EQ(fake.calls(), std::string(kBootRemountRwCall) + kBootRemountRoCall);
 }
 
 // The same seen from outside the process: the shim counts one open of the

@@ -413,6 +413,7 @@ TEST_F(MigrateSettingsLogLevel, VerboseListsEveryTargetInRegistrationOrder) {
                                             base.string() + "/app/overlays [8]\n",
                                         0),
               0u);
+    // The shared transcript itself, against the text written out here.
     const std::string lines = registerLines(base);
     EXPECT_EQ(std::count(lines.begin(), lines.end(), '\n'), 14);
     const std::string deviceTargets =

@@ -66,6 +66,12 @@ Bytes pattern(size_t size, uint8_t seed) {
 
 Status writeAt(TargetSlot& slot, int64_t offset, const Bytes& data) { return slot.writeAt(offset, data.data(), data.size()); }
 
+// "<what> <status> valid <0|1>", the slot's validity taken after the call
+// that gave `status`.
+void printWithValidity(const char* what, Status status, TargetSlot& slot) {
+    std::printf("%s %u valid %d\n", what, status, slot.isValid() ? 1 : 0);
+}
+
 // Runs `body` on slot `index` of a new boot-file target in a child, with
 // the log on standard output at `threshold`; optionally with the stand-in
 // mount commands first on PATH.
@@ -152,10 +158,7 @@ TEST(FirmwareUpdateBoot, IdleSlot) {
 
 TEST(FirmwareUpdateBoot, BeginOpensAnUnnamedTemporaryFile) {
     const auto result = onBootSlot(0, LOG_PRIORITY_DEBUG, [](TargetSlot& slot) {
-        {
-            const Status status = slot.beginWrite();
-            std::printf("begin %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
+        printWithValidity("begin", slot.beginWrite(), slot);
         printTemporaryDescriptors();
         return 0;
     });
@@ -194,10 +197,7 @@ TEST(FirmwareUpdateBoot, BeginTwiceRestarts) {
     const auto result = onBootSlot(0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(100, 1)));
-        {
-            const Status status = slot.beginWrite();
-            std::printf("begin %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
+        printWithValidity("begin", slot.beginWrite(), slot);
         printTemporaryDescriptors();
         return 0;
     });
@@ -236,10 +236,7 @@ TEST(FirmwareUpdateBoot, FinaliseWithNothingReceivedFails) {
     FakeMountCommands fake;
     const auto result = onBootSlot(fake, 0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
-        {
-            const Status status = slot.finalise();
-            std::printf("finalise %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
+        printWithValidity("finalise", slot.finalise(), slot);
         printTemporaryDescriptors();
         std::printf("finalise %u\n", slot.finalise());
         return 0;
@@ -279,10 +276,7 @@ TEST(FirmwareUpdateBoot, EraseAbandonsTheUpdate) {
     const auto result = onBootSlot(1, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
-        {
-            const Status status = slot.erase();
-            std::printf("erase %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
+        printWithValidity("erase", slot.erase(), slot);
         printTemporaryDescriptors();
         std::printf("erase %u\n", slot.erase());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
@@ -306,10 +300,7 @@ TEST(FirmwareUpdateBoot, StreamedWriteAfterAFailedOneIsRefused) {
     const auto result = onBootSlot(0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
-        {
-            const Status status = writeAt(slot, -1, pattern(10, 2));
-            std::printf("writeAt %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
+        printWithValidity("writeAt", writeAt(slot, -1, pattern(10, 2)), slot);
         std::printf("writeAt %u\n", writeAt(slot, 10, pattern(10, 3)));
         std::printf("finalise %u\n", slot.finalise());
         return 0;
@@ -374,10 +365,7 @@ TEST(FirmwareUpdateBoot, FailedRemountEndsTheUpdate) {
         std::printf("writeAt %u\n", writeAt(slot, 100, pattern(10, 1)));
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(7, 2)));
         std::printf("writeAt %u\n", writeAt(slot, 100, pattern(13, 3)));
-        {
-            const Status status = slot.finalise();
-            std::printf("finalise %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
+        printWithValidity("finalise", slot.finalise(), slot);
         printTemporaryDescriptors();
         return 0;
     }, {{"FAKE_MOUNT_EXIT", "32"}});
@@ -404,8 +392,7 @@ TEST(FirmwareUpdateBoot, UnwritableBootFileIsTriedFiveTimes) {
     const auto result = onBootSlot(fake, 0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
-        const Status status = slot.finalise();
-        std::printf("finalise %u valid %d\n", status, slot.isValid() ? 1 : 0);
+        printWithValidity("finalise", slot.finalise(), slot);
         return 0;
     });
     std::string attempts;
@@ -561,10 +548,7 @@ TEST(FirmwareUpdatePartition, BeginWithoutTheBlockDevice) {
         const auto result = fake.run(threshold, [] {
             FirmwareUpdatePartitionTarget target;
             TargetSlot& slot = *target.getSlot(0).get();
-            {
-                const Status status = slot.beginWrite();
-                std::printf("begin %u valid %d\n", status, slot.isValid() ? 1 : 0);
-            }
+            printWithValidity("begin", slot.beginWrite(), slot);
             std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
             std::printf("finalise %u\n", slot.finalise());
             return 0;

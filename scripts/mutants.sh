@@ -30,9 +30,11 @@ cmake --build "$build" >/dev/null
 
 backup=$(mktemp -d /tmp/mutants.XXXXXX)
 mutated=
+# Put back with a new time, so that the build replaces the mutant's objects.
 restore() {
   if [ -n "$mutated" ]; then
-    cp -p "$backup/original" "$mutated"
+    cp "$backup/original" "$mutated"
+    touch "$mutated"
     mutated=
   fi
 }
@@ -56,7 +58,7 @@ killed=0 survived=0 unseen_survived=0 stale=0 broken=0
 for number in "${selected[@]}"; do
   IFS=$'\t' read -r file before after rule unseen <<<"${entries[$((number - 1))]}"
   start=$SECONDS
-  cp -p "$file" "$backup/original"
+  cp "$file" "$backup/original"
   mutated=$file
   if ! mutate "$file" "$before" "$after"; then
     restore

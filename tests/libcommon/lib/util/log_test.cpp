@@ -160,24 +160,19 @@ TEST(LogThreshold, StatementBindsItsOwnElse) {
 // ---------------------------------------------------------------------------
 // Output modes
 
-TEST(LogOutput, ModeOneWritesStandardOutput) {
-    const ProcessResult result = logInChild(LOG_OUTPUT_STDOUT, 4, [] {
-        LOGW << "to stdout " << 1;
-        LOG_STATEMENT(2) << "critical";
-        logEmit(3, "emitted %s %d|", "raw", 7);
-    });
-    EXPECT_EQ(result.out, "to stdout 1\ncritical\nemitted raw 7|");
-    EXPECT_EQ(result.err, "");
-}
-
-TEST(LogOutput, ModeTwoWritesStandardError) {
-    const ProcessResult result = logInChild(LOG_OUTPUT_STDERR, 4, [] {
-        LOGW << "to stderr " << 2;
-        LOG_STATEMENT(2) << "critical";
-        logEmit(3, "emitted %s %d|", "raw", 7);
-    });
-    EXPECT_EQ(result.out, "");
-    EXPECT_EQ(result.err, "to stderr 2\ncritical\nemitted raw 7|");
+// Mode 1 writes standard output, mode 2 standard error; nothing goes to
+// the other stream.
+TEST(LogOutput, ModesOneAndTwoWriteTheirStream) {
+    for (const int mode : {LOG_OUTPUT_STDOUT, LOG_OUTPUT_STDERR}) {
+        const ProcessResult result = logInChild(mode, 4, [mode] {
+            LOGW << "to stream " << mode;
+            LOG_STATEMENT(2) << "critical";
+            logEmit(3, "emitted %s %d|", "raw", 7);
+        });
+        const std::string written = "to stream " + std::to_string(mode) + "\ncritical\nemitted raw 7|";
+        EXPECT_EQ(result.out, mode == LOG_OUTPUT_STDOUT ? written : "") << "mode " << mode;
+        EXPECT_EQ(result.err, mode == LOG_OUTPUT_STDERR ? written : "") << "mode " << mode;
+    }
 }
 
 TEST(LogOutput, OtherNonNegativeModesWriteStandardOutput) {

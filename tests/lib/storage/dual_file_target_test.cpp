@@ -26,9 +26,13 @@
 #include "files.h"
 #include "lib/util/log.h"
 #include "scratch_dir.h"
+#include "source_lines.h"
 #include "store_files.h"
 
 namespace {
+
+// How an open failure reported by the descriptor helpers begins.
+const std::string kOpenFailure = testing_support::openFailurePrefix();
 
 namespace fs = std::filesystem;
 using Storage::DualFileTarget;
@@ -1209,18 +1213,18 @@ TEST_F(DualFileStore, UnusableCopyDirectoryFailsEveryUpdate) {
     });
     const std::string dataPath = (copyDir(1) / "data").string();
     EXPECT_EQ(result.out,
-              "lib/storage/storage_target:410 17\n"
-              "libcommon/lib/util/fd:14 Failed to open " + dataPath + ": No such file or directory\n"
+              "lib/storage/storage_target:410 17\n" +
+              kOpenFailure + dataPath + ": No such file or directory\n"
               "write 52\n"
               "[lib/storage/storage_target:192] err_code = 17 (<unknown>)\n"
               "writeAt 17\n"
               "[lib/storage/storage_target:427] err_code = 17 (<unknown>)\n"
               "erase 17\n"
               "beginWrite 0\n"
-              "lib/storage/storage_target:410 17\n"
-              "libcommon/lib/util/fd:14 Failed to open " + dataPath + ": No such file or directory\n"
-              "writeAt 52\n"
-              "libcommon/lib/util/fd:14 Failed to open " + dataPath + ".chk.tmp: No such file or directory\n"
+              "lib/storage/storage_target:410 17\n" +
+              kOpenFailure + dataPath + ": No such file or directory\n"
+              "writeAt 52\n" +
+              kOpenFailure + dataPath + ".chk.tmp: No such file or directory\n"
               "lib/storage/storage_target:461 finalise: write failed: 9: Bad file descriptor\n"
               "finalise 52\n" +
                   hex(bytesOf("current")) + "\n");
@@ -1244,7 +1248,7 @@ TEST_F(DualFileStore, TransientFileThatCannotBeCleanedUp) {
         std::printf("%s\n", hex(contentOf(slot).data).c_str());
         return 0;
     });
-    EXPECT_EQ(result.out, "libcommon/lib/util/fd:14 Failed to open " + (copyDir(0) / "data.chk.tmp").string() +
+    EXPECT_EQ(result.out, kOpenFailure + (copyDir(0) / "data.chk.tmp").string() +
                               ": Is a directory\n"
                               "lib/storage/storage_target:461 finalise: write failed: 9: Bad file descriptor\n"
                               "lib/storage/storage_target:470 Failed to cleanup check file\n"

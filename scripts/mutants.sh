@@ -79,7 +79,7 @@ for number in "${selected[@]}"; do
       survived=$((survived + 1))
     fi
   else
-    first=$(grep -m1 -E 'Test +#[0-9]+: .*\*\*\*' "$backup/test.log" | sed -E 's/.*Test +#[0-9]+: ([^ ]+).*/\1/')
+    first=$(grep -m1 -E 'Test +#[0-9]+: .*\*\*\*(Failed|Timeout|Exception)' "$backup/test.log" | sed -E 's/.*Test +#[0-9]+: ([^ ]+).*/\1/')
     verdict=killed detail="by ${first:-the test run}"
     killed=$((killed + 1))
   fi

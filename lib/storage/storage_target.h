@@ -6,6 +6,10 @@
 // operation a concrete class does not support returns STATUS_NOT_IMPLEMENTED
 // without side effects. Slots have no locks: one operation on a slot at a
 // time.
+//
+// What is declared here is implemented in storage_target_interfaces.cpp;
+// storage_target.cpp holds the concrete targets, whose error lines carry
+// its name.
 #pragma once
 
 #include <cstddef>

@@ -567,8 +567,24 @@ TEST_F(SimulatedDeviceLifecycle, MissingToolsSkipUnlessTheDeviceIsRequired) {
 
 TEST_F(SimulatedDeviceLifecycle, NonRootSkipsUnlessTheDeviceIsRequired) {
     if (!fs::exists("/usr/bin/setpriv")) GTEST_SKIP() << "needs setpriv to drop root";
-    const std::vector<std::string> asNobody{"/usr/bin/setpriv", "--reuid=65534", "--regid=65534", "--clear-groups",
-                                            "/bin/bash", simulated_device::runnerPath().string(), "--", "/bin/true"};
+    const std::vector<std::string> dropRoot{"/usr/bin/setpriv", "--reuid=65534", "--regid=65534", "--clear-groups"};
+    // The checkout may lie below a directory that nobody cannot enter (/root
+    // is mode 700): nobody runs a copy of the runner from a scratch directory
+    // open to all. The refusal comes before the runner needs anything beside it.
+    testing_support::ScratchDir copy;
+    const fs::path runner = copy / "run_on_device.sh";
+    fs::copy_file(simulated_device::runnerPath(), runner);
+    fs::permissions(copy.path(), fs::perms::owner_all | fs::perms::group_read | fs::perms::group_exec |
+                                     fs::perms::others_read | fs::perms::others_exec);
+    fs::permissions(runner, fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read |
+                                fs::perms::others_read);
+    std::vector<std::string> canRead = dropRoot;
+    canRead.insert(canRead.end(), {"/usr/bin/test", "-r", runner.string()});
+    if (runProgram(canRead).exitStatus != 0) {
+        GTEST_SKIP() << "nobody cannot read " << runner << ": a directory above it is closed to other users";
+    }
+    std::vector<std::string> asNobody = dropRoot;
+    asNobody.insert(asNobody.end(), {"/bin/bash", runner.string(), "--", "/bin/true"});
     std::map<std::string, std::string> env = env_;
     const ProcessResult skipped = runProgram(asNobody, env);
     EXPECT_EQ(skipped.exitStatus, 77);

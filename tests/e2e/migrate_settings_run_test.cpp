@@ -9,6 +9,7 @@
 
 #include <gtest/gtest.h>
 
+#include "fault_injection.h"
 #include "scratch_dir.h"
 #include "tool_run.h"
 
@@ -373,6 +374,22 @@ TEST_F(MigrateSettingsExitStatus, FailedWriteOfTheDataFileIsOne) {
     expectNothingStored();
 }
 
+// The data file can be sized but not opened (the shim fails the open): the
+// run fails without a line, as only sizing failures are logged.
+TEST_F(MigrateSettingsExitStatus, UnopenableDataFileIsOneAndSilent) {
+    if (!testing_support::programEmulator().empty()) {
+        GTEST_SKIP() << "native builds only: the shim cannot be preloaded under qemu-aarch64";
+    }
+    const std::string data = dataFile("block", Bytes{1, 2, 3, 4, 5});
+    const ProcessResult result = e2e::withoutBootVectorFailure(testing_support::runProgram(
+        {e2e::kBinary, "--base", base.string(), "--target", "calib_save", "--type", "simple", "--data", data},
+        testing_support::faultEnv("open", 1, "errno:EACCES", "/block")));
+    EXPECT_EQ(result.exitStatus, 1);
+    EXPECT_EQ(result.out, "");
+    EXPECT_EQ(result.err, "");
+    expectNothingStored();
+}
+
 TEST_F(MigrateSettingsExitStatus, SuccessfulWriteIsZeroAndSilent) {
     const Bytes block = settingsBlock(100, 128);
     expectSilentSuccess(run({"--target", "settings", "--type", "checked", "--data", dataFile("block", block)}));
@@ -396,6 +413,7 @@ TEST_F(MigrateSettingsLogLevel, VerboseListsEveryTargetInRegistrationOrder) {
                                             base.string() + "/app/overlays [8]\n",
                                         0),
               0u);
+    // The shared transcript itself, against the text written out here.
     const std::string lines = registerLines(base);
     EXPECT_EQ(std::count(lines.begin(), lines.end(), '\n'), 14);
     const std::string deviceTargets =

@@ -7,6 +7,8 @@
 
 #include <gtest/gtest.h>
 
+#include "registration_log.h"
+
 namespace e2e {
 namespace fs = std::filesystem;
 
@@ -119,35 +121,7 @@ std::vector<std::string> concat(std::vector<std::string> head, const std::vector
     return head;
 }
 
-std::string registerLines(const fs::path& base) {
-    struct Row {
-        const char* name;
-        const char* location;
-        const char* slots;
-    };
-    const Row rows[] = {
-        {"kIpiStorageTargetSettings", "settings", "1"},
-        {"kIpiStorageTargetOverlay", "app/overlays", "8"},
-        {"kIpiStorageTargetLUT", "app/luts", "26"},
-        {"kIpiStorageTargetCalibSave", "app/calibSave", "1"},
-        {"kIpiStorageTargetCalibExtra", "app/calibExtra", "1"},
-        {"kIpiStorageTargetUtilSave", "app/utilSave", "1"},
-        {"kIpiStorageTargetApplicationInternal", "app/internal", "1"},
-        {"kIpiStorageTargetRebootPersistent", "app/rebootPersistent", "1"},
-    };
-    std::string lines;
-    for (const Row& row : rows) {
-        lines += std::string("Register ") + row.name + " = DualFileTarget " + (base / row.location).string() + " [" +
-                 row.slots + "]\n";
-    }
-    return lines +
-           "Register kIpiStorageTargetBootPartition = FileReadTarget /media/boot [0]\n"
-           "Register kIpiStorageTargetResourcePartition = FileReadTarget /media/resources [0]\n" +
-           kLastFileReadRegisterLine +
-           "Register kIpiStorageTargetBootVector = BootVectorTarget [1]\n"
-           "Register kIpiStorageTargetFirmwareUpdateBootFile = FirmwareUpdateBootTarget /media/boot [2]\n"
-           "Register kIpiStorageTargetFirmwareUpdateResourcePartition = FirmwareUpdatePartitionTarget [1]\n";
-}
+std::string registerLines(const fs::path& base) { return testing_support::registerLines(base); }
 
 std::vector<std::string> storedFiles(const fs::path& base) {
     std::vector<std::string> files;

@@ -90,6 +90,11 @@
  *                      futimens are left as they are. Works without
  *                      FAULT_CALL.
  *
+ * Files whose names end in ".gcda" are gcov's counts, which a coverage
+ * build opens as it exits (and writes through stdio): calls that name such
+ * a file are passed through, never counted, failed, recorded or given the
+ * fake time, so that counts stay those of the program under test.
+ *
  * The shim acts only in the process that loaded it: it removes the FAULT_*
  * variables from the environment at load, so programs that process starts
  * run unaffected, and a forked child passes every call through. A bad
@@ -503,6 +508,16 @@ static int targetMatches(const struct Target* target) {
     return descriptorPath(target->fd, path, sizeof path) != 0 && strstr(path, config.pathSubstr) != NULL;
 }
 
+static int isCoverageCounts(const char* path) {
+    static const char suffix[] = ".gcda";
+    const size_t length = path == NULL ? 0 : strlen(path);
+    return length >= sizeof suffix - 1 && strcmp(path + length - (sizeof suffix - 1), suffix) == 0;
+}
+
+static int namesCoverageCounts(const struct Target* target) {
+    return isCoverageCounts(target->path) || isCoverageCounts(target->path2);
+}
+
 static int callMatches(const char* function, enum Family family, int mutating) {
     if (config.allMutating) return mutating;
     if (config.family >= 0) return config.family == (int)family;
@@ -514,7 +529,7 @@ static int callMatches(const char* function, enum Family family, int mutating) {
  * VERDICT_FAIL, which sets it. */
 static enum Verdict decide(const char* function, enum Family family, int mutating, struct Target target) {
     const int saved = errno;
-    if (!enabled() || !config.counting || !callMatches(function, family, mutating) ||
+    if (!enabled() || !config.counting || !callMatches(function, family, mutating) || namesCoverageCounts(&target) ||
         (config.hasPathSubstr && !targetMatches(&target))) {
         errno = saved;
         return VERDICT_PROCEED;
@@ -575,7 +590,8 @@ __attribute__((noreturn)) static void recordFailed(const char* problem) {
 static int watching(const struct Target* target) {
     const int saved = errno;
     const int watched = enabled() && (config.hasRecord || config.hasClock) &&
-                        (target == NULL || !config.hasPathSubstr || targetMatches(target));
+                        (target == NULL || (!namesCoverageCounts(target) &&
+                                            (!config.hasPathSubstr || targetMatches(target))));
     errno = saved;
     return watched;
 }

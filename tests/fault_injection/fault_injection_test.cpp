@@ -363,6 +363,25 @@ TEST_P(FaultInjection, LibraryReportsEachFailedMutatingCall) {
     }
 }
 
+// gcov's count files, which a coverage build opens at exit, are passed
+// through: never failed, counted or recorded.
+TEST_P(FaultInjection, CoverageCountFilesAreNeverFailedCountedOrRecorded) {
+    for (const char* call : {"mutating", "open", "rename", "unlink"}) {
+        ScratchDir dir;
+        const fs::path record = counts_ / "record";
+        const ProcessResult result =
+            runProgram({GetParam(), "gcda", dir.path().string()},
+                       testing_support::recordEnv(record.string(), "", std::nullopt,
+                                                  faultEnv(call, 1, "errno:EIO", "", countFile())));
+        EXPECT_EQ(result.exitStatus, 0) << call;
+        EXPECT_EQ(result.out, "create 0\nfopen 0\nrename 0\nunlink 0\n") << call;
+        EXPECT_EQ(result.err, "") << call;
+        EXPECT_EQ(count(), 0u) << call;
+        EXPECT_EQ(fs::exists(record) ? testing_support::readText(record) : "", "") << call;
+        EXPECT_EQ(snapshot(dir.path()), Snapshot{}) << call;
+    }
+}
+
 INSTANTIATE_TEST_SUITE_P(Probes, FaultInjection, ::testing::Values(FAULT_PROBE, FAULT_PROBE_INSTRUMENTED),
                          [](const ::testing::TestParamInfo<const char*>& info) {
                              return info.index == 0 ? std::string("Plain") : std::string("Instrumented");

@@ -10,6 +10,8 @@
 //   fault_probe spawn DIR    runs "script DIR/child" as a new program, then
 //                            makes DIR/parent-made itself
 //   fault_probe record DIR   every call the shim records (fault_probe.h)
+//   fault_probe gcda DIR     what gcov does to its count files: creates,
+//                            renames and removes DIR/probe.gcda
 #include <cerrno>
 #include <chrono>
 #include <cstdio>
@@ -130,6 +132,26 @@ int runLibrary(const fs::path& dir) {
     return 0;
 }
 
+int runCoverageCounts(const std::string& dir) {
+    const std::string counts = dir + "/probe.gcda";
+    const std::string renamed = dir + "/renamed.gcda";
+    step("create", [&] {
+        const int fd = open(counts.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0666);
+        if (fd < 0) return -1L;
+        close(fd);
+        return 0L;
+    });
+    step("fopen", [&] {
+        FILE* stream = std::fopen(counts.c_str(), "r+e");
+        if (stream == nullptr) return -1L;
+        std::fputs("counts", stream);
+        return succeeded(std::fclose(stream) == 0);
+    });
+    step("rename", [&] { return rename(counts.c_str(), renamed.c_str()); });
+    step("unlink", [&] { return unlink(renamed.c_str()); });
+    return 0;
+}
+
 int runSpawn(const char* self, const std::string& dir) {
     const std::string childDir = dir + "/child";
     std::string script = "script";
@@ -154,7 +176,7 @@ int runSpawn(const char* self, const std::string& dir) {
 int main(int argc, char** argv) {
     std::setvbuf(stdout, nullptr, _IONBF, 0);
     if (argc != 3) {
-        std::fprintf(stderr, "usage: fault_probe script|library|spawn|record DIR\n");
+        std::fprintf(stderr, "usage: fault_probe script|library|spawn|record|gcda DIR\n");
         return 2;
     }
     const std::string mode = argv[1];
@@ -162,6 +184,7 @@ int main(int argc, char** argv) {
     if (mode == "library") return runLibrary(argv[2]);
     if (mode == "spawn") return runSpawn(argv[0], argv[2]);
     if (mode == "record") return fault_probe::runRecord(argv[2]);
+    if (mode == "gcda") return runCoverageCounts(argv[2]);
     std::fprintf(stderr, "unknown mode %s\n", argv[1]);
     return 2;
 }

@@ -1,12 +1,14 @@
 #!/usr/bin/env bash
 # cmake --install of the build tree into a scratch prefix installs exactly
-# the tool, its manual page, the two libraries, their public headers and
-# the package configuration; tests/consumer then configures and builds
-# against that prefix with find_package and runs.
+# the tool, its manual page, the two libraries, their public headers below
+# include/migrate_settings/, the CMake package configuration and the
+# pkg-config file; tests/consumer then builds against that prefix twice,
+# with find_package and with its Makefile through pkg-config, and each
+# program runs.
 # usage: consumer_test.sh SETTINGS   (a shell file written by CMakeLists.txt)
 set -euo pipefail
 # build_dir source_dir generator build_type bindir libdir includedir mandir
-# cache_settings cross emulator=(...)
+# cache_settings cxx_compiler cxx_flags linker_flags cross emulator=(...)
 source "$1"
 
 scratch=$(mktemp -d /tmp/consumer-test.XXXXXX)
@@ -21,11 +23,14 @@ cmake --install "$build_dir" --prefix "$prefix" >"$scratch/install.log" || {
 package=$libdir/cmake/migrate_settings
 {
   printf '%s\n' "$bindir/migrate_settings" "$mandir/man1/migrate_settings.1" \
-    "$libdir/libcommon.a" "$libdir/libstorage.a" \
+    "$libdir/libmigrate_settings_common.a" "$libdir/libmigrate_settings_storage.a" \
     "$package/migrate_settings-config.cmake" "$package/migrate_settings-config-version.cmake" \
-    "$package/migrate_settings-targets.cmake" "$package/migrate_settings-targets-$(tr '[:upper:]' '[:lower:]' <<<"${build_type:-noconfig}").cmake"
-  (cd "$source_dir/libcommon" && find lib/util -name '*.h') | sed "s|^|$includedir/|"
-  (cd "$source_dir" && find lib/storage -maxdepth 1 -name '*.h') | sed "s|^|$includedir/|"
+    "$package/migrate_settings-targets.cmake" "$package/migrate_settings-targets-$(tr '[:upper:]' '[:lower:]' <<<"${build_type:-noconfig}").cmake" \
+    "$libdir/pkgconfig/migrate_settings.pc"
+  # Every header but the private ones: the CRC's choice of implementation
+  # and the store's directory helper.
+  (cd "$source_dir/libcommon" && find lib/util -name '*.h' ! -name crc32_paths.h) | sed "s|^|$includedir/migrate_settings/|"
+  (cd "$source_dir" && find lib/storage -maxdepth 1 -name '*.h' ! -name slot_directories.h ! -name untrusted_tree.h) | sed "s|^|$includedir/migrate_settings/|"
 } | sort >"$scratch/expected"
 (cd "$prefix" && find . -type f -printf '%P\n' | sort) >"$scratch/installed"
 if ! diff -u "$scratch/expected" "$scratch/installed"; then
@@ -43,7 +48,21 @@ cmake -C "$cache_settings" -G "$generator" -S "$source_dir/tests/consumer" -B "$
 }
 cmake --build "$scratch/build"
 
-"${emulator[@]}" "$scratch/build/storage_consumer" "$scratch/store" >"$scratch/output"
-printf '%s\n' "DualFileTarget $scratch/store with 2 slots" 'slot 0: empty' \
-  'slot 1: "settings for another program" crc32 b8eb8420' >"$scratch/expected_output"
-diff -u "$scratch/expected_output" "$scratch/output"
+# Only this package's pkg-config directory, as a sysroot build would see it.
+mkdir "$scratch/make"
+PKG_CONFIG_LIBDIR="$prefix/$libdir/pkgconfig" PKG_CONFIG_PATH= \
+  make -s -f "$source_dir/tests/consumer/Makefile" -C "$scratch/make" \
+  CXX="$cxx_compiler" CXXFLAGS="$cxx_flags" LDFLAGS="$linker_flags" >"$scratch/make.log" 2>&1 || {
+  cat "$scratch/make.log"
+  exit 1
+}
+
+run_consumer() {
+  local program=$1 store=$2
+  "${emulator[@]}" "$program" "$store" >"$scratch/output"
+  printf '%s\n' "DualFileTarget $store with 2 slots" 'slot 0: empty' \
+    'slot 1: "settings for another program" crc32 b8eb8420' >"$scratch/expected_output"
+  diff -u "$scratch/expected_output" "$scratch/output"
+}
+run_consumer "$scratch/build/storage_consumer" "$scratch/store"
+run_consumer "$scratch/make/storage_consumer" "$scratch/make-store"

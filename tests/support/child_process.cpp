@@ -11,6 +11,10 @@
 #include "files.h"
 #include "scratch_dir.h"
 
+#ifdef FLUSH_COVERAGE_BEFORE_EXIT
+extern "C" void __gcov_dump();
+#endif
+
 namespace testing_support {
 namespace {
 
@@ -48,6 +52,9 @@ ProcessResult runInChild(const std::function<int()>& body) {
         const int code = body();
         std::fflush(stdout);
         std::fflush(stderr);
+#ifdef FLUSH_COVERAGE_BEFORE_EXIT
+        __gcov_dump();
+#endif
         _exit(code);
     });
 }

@@ -48,4 +48,12 @@ Bytes fromHex(const std::string& text) {
     return bytes;
 }
 
+Bytes bytesOf(const std::string& text) { return Bytes(text.begin(), text.end()); }
+
+Bytes counting(size_t count) {
+    Bytes bytes(count);
+    for (size_t i = 0; i < count; ++i) bytes[i] = static_cast<uint8_t>(i);
+    return bytes;
+}
+
 }  // namespace testing_support

@@ -8,8 +8,10 @@ namespace testing_support {
 std::string withoutStorageLineNumbers(const std::string& text) {
     static const std::regex prefix(R"(lib/storage/storage_target:[0-9]+ )");
     static const std::regex report(R"(\[lib/storage/storage_target:[0-9]+\] )");
-    const std::string out = std::regex_replace(text, prefix, "lib/storage/storage_target:N ");
-    return std::regex_replace(out, report, "[lib/storage/storage_target:N] ");
+    static const std::regex openFailure(R"(libcommon/lib/util/fd:[0-9]+ Failed to open )");
+    std::string out = std::regex_replace(text, prefix, "lib/storage/storage_target:N ");
+    out = std::regex_replace(out, report, "[lib/storage/storage_target:N] ");
+    return std::regex_replace(out, openFailure, "libcommon/lib/util/fd:N Failed to open ");
 }
 
 std::string normalisedStorageLog(const std::string& text) {

@@ -1,11 +1,7 @@
-// Writes valid example migration data for trying migrate_settings:
-//
-//   make_example_data settings FILE [LENGTH]   settings block of LENGTH bytes
-//                                              (default 4096) padded to a
-//                                              multiple of 4 with 0xFF filler
-//   make_example_data lut FILE                 19784-byte lookup table
-//   make_example_data overlay FILE [PAYLOAD]   overlay header + PAYLOAD bytes
-//                                              (default 1024)
+// Writes valid example migration data for trying migrate_settings; see
+// kHelp below for the kinds and what SIZE means for each.
+#include <cctype>
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -58,45 +54,82 @@ Bytes overlayFile(unsigned long payload) {
     return bytes;
 }
 
-int usage() {
-    std::fputs("Usage: make_example_data settings|lut|overlay FILE [SIZE]\n", stderr);
+constexpr const char* kUsage = "Usage: make_example_data settings|lut|overlay FILE [SIZE]\n";
+constexpr const char* kHelp =
+    "Writes a valid example migration data file for migrate_settings.\n"
+    "\n"
+    "  settings FILE [SIZE]  settings block declaring SIZE bytes (4 to 65535, default\n"
+    "                        4096), padded with 0xFF to a multiple of 4 bytes\n"
+    "  lut FILE              lookup table of 19784 bytes; takes no SIZE\n"
+    "  overlay FILE [SIZE]   overlay: 284-byte header, then SIZE payload bytes\n"
+    "                        (0 to 67108864, default 1024)\n"
+    "\n"
+    "SIZE is decimal, 0x-prefixed hex or 0-prefixed octal.\n";
+
+struct Kind {
+    const char* name;
+    unsigned long defaultSize;  // 0: the kind takes no SIZE
+    unsigned long minSize;
+    unsigned long maxSize;
+    const char* sizeName;
+    Bytes (*make)(unsigned long size);
+};
+
+constexpr Kind kKinds[] = {
+    {"settings", 4096, 4, 0xFFFF, "settings length", settingsBlock},
+    {"lut", 0, 0, 0, nullptr, [](unsigned long) { return lutFile(); }},
+    {"overlay", 1024, 0, 64ul * 1024 * 1024, "overlay payload", overlayFile},
+};
+
+int refuse(const std::string& reason) {
+    std::fprintf(stderr, "make_example_data: %s\n%s", reason.c_str(), kUsage);
+    return 1;
+}
+
+int cannotWrite(const char* path, int error) {
+    std::fprintf(stderr, "make_example_data: cannot write '%s': %s\n", path, std::strerror(error));
     return 1;
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-    if (argc < 3 || argc > 4) return usage();
-    const std::string kind = argv[1];
-    char* end = nullptr;
-    const unsigned long size = argc == 4 ? std::strtoul(argv[3], &end, 0) : 0;
-    if (argc == 4 && (*end != '\0' || end == argv[3])) return usage();
+    if (argc == 2 && (std::strcmp(argv[1], "--help") == 0 || std::strcmp(argv[1], "-h") == 0)) {
+        std::printf("%s\n%s", kUsage, kHelp);
+        return 0;
+    }
+    if (argc < 3) return refuse("expected a kind and a file name");
+    if (argc > 4) return refuse("too many arguments");
+    const std::string name = argv[1];
+    const Kind* kind = nullptr;
+    for (const Kind& candidate : kKinds) {
+        if (name == candidate.name) kind = &candidate;
+    }
+    if (kind == nullptr) return refuse("unknown kind '" + name + "' (settings, lut or overlay)");
 
-    Bytes bytes;
-    if (kind == "settings") {
-        const unsigned long length = argc == 4 ? size : 4096;
-        if (length < 4 || length > 0xFFFF) {
-            std::fputs("settings length must be 4 to 65535\n", stderr);
-            return 1;
+    unsigned long size = kind->defaultSize;
+    if (argc == 4) {
+        if (kind->defaultSize == 0) return refuse(name + " takes no SIZE: a lookup table is always 19784 bytes");
+        const std::string text = argv[3];
+        char* end = nullptr;
+        errno = 0;
+        size = std::strtoul(text.c_str(), &end, 0);
+        // strtoul would skip blanks and wrap a minus sign around.
+        if (!std::isdigit(static_cast<unsigned char>(text[0])) || *end != '\0') {
+            return refuse("SIZE '" + text + "' is not a number");
         }
-        bytes = settingsBlock(length);
-    } else if (kind == "lut" && argc == 3) {
-        bytes = lutFile();
-    } else if (kind == "overlay") {
-        const unsigned long payload = argc == 4 ? size : 1024;
-        if (payload > 64ul * 1024 * 1024) {
-            std::fputs("overlay payload must be at most 64 MiB\n", stderr);
-            return 1;
+        if (errno == ERANGE || size < kind->minSize || size > kind->maxSize) {
+            return refuse(std::string(kind->sizeName) + " must be " + std::to_string(kind->minSize) + " to " +
+                          std::to_string(kind->maxSize) + ", not " + text);
         }
-        bytes = overlayFile(payload);
-    } else {
-        return usage();
     }
 
+    const Bytes bytes = kind->make(size);
     FILE* out = std::fopen(argv[2], "wbe");
-    if (out == nullptr || std::fwrite(bytes.data(), 1, bytes.size(), out) != bytes.size() || std::fclose(out) != 0) {
-        std::perror(argv[2]);
-        return 1;
-    }
+    if (out == nullptr) return cannotWrite(argv[2], errno);
+    const bool written = std::fwrite(bytes.data(), 1, bytes.size(), out) == bytes.size();
+    const int writeError = errno;
+    if (std::fclose(out) != 0) return cannotWrite(argv[2], errno);
+    if (!written) return cannotWrite(argv[2], writeError);
     return 0;
 }

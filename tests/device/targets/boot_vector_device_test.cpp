@@ -306,7 +306,7 @@ TEST_F(BootVectorOnDevice, WriteWhenTheDeviceCannotBeOpened) {
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
               "built\n"
-              "libcommon/lib/util/fd:14 Failed to open /dev/mmcblk0: No such file or directory\n"
+              "libcommon/lib/util/fd:N Failed to open /dev/mmcblk0: No such file or directory\n"
               "lib/storage/storage_target:N Failed to write to flash: valid=0 written=0\n"
               "write 52\n"
               "read 0 20 " +
@@ -383,18 +383,24 @@ const std::string kUnusableProbe =
     "write 2\n"
     "untouched eeeeeeeeeeeeeeeeeeeeeeeeeeeeeeeeeeeeeeee\n";
 
+// The probe of an unusable slot where the image has a free area:
+// construction logs `failure`, every operation is refused, and the
+// record's sector on the image is unchanged.
+void expectUnusable(const std::string& failure) {
+    const Bytes before = sd::readImageBytes(sd::bootVectorOffset(), 512);
+    const ProcessResult result = withTarget(LOG_PRIORITY_DEBUG, probeUnusable);
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(normalisedStorageLog(result.out), failure + kUnusableProbe);
+    EXPECT_EQ(sd::readImageBytes(sd::bootVectorOffset(), 512), before);
+}
+
 class BootVectorLowImage : public BootVectorVariant {
 protected:
     BootVectorLowImage() : BootVectorVariant("low") {}
 };
 
 TEST_F(BootVectorLowImage, FreeAreaBelowTheRangeIsRefused) {
-    const Bytes before = sd::readImageBytes(sd::bootVectorOffset(), 512);
-    const ProcessResult result = withTarget(LOG_PRIORITY_DEBUG, probeUnusable);
-    EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              "lib/storage/storage_target:N Boot vector 2048000 not in range 6291456 to 33554432\n" + kUnusableProbe);
-    EXPECT_EQ(sd::readImageBytes(sd::bootVectorOffset(), 512), before);
+    expectUnusable("lib/storage/storage_target:N Boot vector 2048000 not in range 6291456 to 33554432\n");
 }
 
 class BootVectorBadRecord : public BootVectorVariant {
@@ -403,13 +409,8 @@ protected:
 };
 
 TEST_F(BootVectorBadRecord, InvalidRecordMakesTheSlotUnusable) {
-    const Bytes before = sd::readImageBytes(sd::bootVectorOffset(), 512);
     ASSERT_FALSE(sd::isValidBootVectorRecord(sd::writtenBootVectorRecord()));
-    const ProcessResult result = withTarget(LOG_PRIORITY_DEBUG, probeUnusable);
-    EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              "lib/storage/storage_target:N Boot vector query failed!\n" + kUnusableProbe);
-    EXPECT_EQ(sd::readImageBytes(sd::bootVectorOffset(), 512), before);
+    expectUnusable("lib/storage/storage_target:N Boot vector query failed!\n");
 }
 
 class BootVectorNoRecord : public BootVectorVariant {

@@ -17,6 +17,7 @@
 
 #include <gtest/gtest.h>
 
+#include "boot_update_log.h"
 #include "device_test_support.h"
 #include "fault_injection.h"
 #include "files.h"
@@ -39,8 +40,8 @@ using Storage::TargetSlot;
 using testing_support::normalisedStorageLog;
 using testing_support::ProcessResult;
 
-constexpr const char* kRemountRw = "mount [-o] [remount,rw] [/media/boot]\n";
-constexpr const char* kRemountRo = "mount [-o] [remount,ro] [/media/boot]\n";
+constexpr const char* kRemountRw = testing_support::kBootRemountRwCall;
+constexpr const char* kRemountRo = testing_support::kBootRemountRoCall;
 
 fs::path bootFile(const std::string& name) { return fs::path(sd::kBootMount) / name; }
 
@@ -49,13 +50,7 @@ std::string quoted(const std::string& name) { return "\"/media/boot/" + name + "
 // The log of a begin and a transfer that both succeeded, up to the
 // update-size message of finalise.
 std::string receivedLines(const std::string& name, size_t bytes) {
-    return "Beginning update of /boot file " + quoted(name) +
-           "\n"
-           "Opened #1 for receiving firmware\n"
-           "begin 0\n"
-           "writes 0\n"
-           "lib/storage/storage_target:N TODO: Sanity-check the file\n" +
-           quoted(name) + " update with " + std::to_string(bytes) + " bytes written\n";
+    return testing_support::begunLines(name) + "begin 0\nwrites 0\n" + testing_support::finalisingLines(name, bytes);
 }
 
 const std::string kUpToDateLines =
@@ -64,9 +59,7 @@ const std::string kUpToDateLines =
     "finalise 0 valid 0\n";
 
 std::string rewrittenLines(const std::string& name, size_t bytes) {
-    return quoted(name) +
-           " needs updating\n"
-           "Remounting \"/media/boot\" as rw\n"
+    return testing_support::needsUpdatingLines(name) +
            "Opening " +
            quoted(name) +
            " for write\n"
@@ -206,6 +199,20 @@ TEST_F(FirmwareUpdateBootOnDevice, DifferentDataIsWrittenAndReadBack) {
     // On the partition itself, not only in the cache.
     device_test::mustRun("umount /media/boot && mount /media/boot");
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
+    EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")) == data, true);
+}
+
+// The size alone does not decide: one byte differing in the last block of
+// a file of the same size is found by the comparison and written.
+TEST_F(FirmwareUpdateBootOnDevice, SameSizeWithOneByteChangedIsWritten) {
+    Bytes data = fileBytes(sd::originalBootFile("BOOT.BIN"));
+    ASSERT_GT(data.size(), 4096u);
+    data.back() = static_cast<uint8_t>(data.back() ^ 0x01);
+    const ProcessResult result = update(0, data);
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(normalisedStorageLog(result.out),
+              receivedLines("BOOT.BIN", data.size()) + rewrittenLines("BOOT.BIN", data.size()));
+    EXPECT_EQ(recorder.calls(), std::string(kRemountRw) + kRemountRo);
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")) == data, true);
 }
 
@@ -355,8 +362,7 @@ TEST_F(FirmwareUpdateBootOnDevice, FailedRemountEndsTheUpdate) {
     const ProcessResult result = update(0, pattern(100, 2), 4096, {{"FAKE_MOUNT_EXIT", "32"}});
     EXPECT_EQ(normalisedStorageLog(result.out),
               receivedLines("BOOT.BIN", 100) +
-                  "\"/media/boot/BOOT.BIN\" needs updating\n"
-                  "Remounting \"/media/boot\" as rw\n"
+                  testing_support::needsUpdatingLines("BOOT.BIN") +
                   "lib/storage/storage_target:N Failed to execute mount\n"
                   "Closing #1\n"
                   "finalise 52 valid 0\n");
@@ -382,12 +388,11 @@ TEST_F(FirmwareUpdateBootOnDevice, FiveFailedReadBacks) {
     for (int attempt = 0; attempt < 5; ++attempt) {
         attempts +=
             "Opening \"/media/boot/BOOT0010.BIN\" for write\n"
-            "libcommon/lib/util/fd:14 Failed to open /media/boot/BOOT0010.BIN: Operation not permitted\n"
+            "libcommon/lib/util/fd:N Failed to open /media/boot/BOOT0010.BIN: Operation not permitted\n"
             "lib/storage/storage_target:N Failed to open BOOT.BIN for writing\n";
     }
     EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT0010.BIN", 1000) +
-                                          "\"/media/boot/BOOT0010.BIN\" needs updating\n"
-                                          "Remounting \"/media/boot\" as rw\n" +
+                                          testing_support::needsUpdatingLines("BOOT0010.BIN") +
                                           attempts +
                                           "Remounting \"/media/boot\" as ro\n"
                                           "Closing #1\n"
@@ -418,8 +423,7 @@ TEST_F(FirmwareUpdateBootFaults, ShortCopyIsRetried) {
     const ProcessResult result = runDriver(testing_support::faultEnv("write", 1, "short:100", "BOOT.BIN"), data);
     EXPECT_EQ(result.exitStatus, 0) << result.err;
     EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 9000) +
-                                          "\"/media/boot/BOOT.BIN\" needs updating\n"
-                                          "Remounting \"/media/boot\" as rw\n"
+                                          testing_support::needsUpdatingLines("BOOT.BIN") +
                                           "Opening \"/media/boot/BOOT.BIN\" for write\n"
                                           "Wrote 100 bytes\n"
                                           "Opening \"/media/boot/BOOT.BIN\" for write\n"
@@ -440,8 +444,7 @@ TEST_F(FirmwareUpdateBootFaults, FailedCopyIsReportedAndRetried) {
     const ProcessResult result = runDriver(testing_support::faultEnv("write", 2, "errno:EIO", "BOOT.BIN"), data);
     EXPECT_EQ(result.exitStatus, 0) << result.err;
     EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 9000) +
-                                          "\"/media/boot/BOOT.BIN\" needs updating\n"
-                                          "Remounting \"/media/boot\" as rw\n"
+                                          testing_support::needsUpdatingLines("BOOT.BIN") +
                                           "Opening \"/media/boot/BOOT.BIN\" for write\n"
                                           "lib/storage/storage_target:N cat: write failed: 5: Input/output error\n"
                                           "Wrote 4096 bytes\n"

@@ -262,7 +262,7 @@ TEST_F(FirmwareUpdatePartitionOnDevice, DeviceThatCannotBeOpened) {
     });
     EXPECT_EQ(normalisedStorageLog(result.out),
               "Unmounting \"/media/resources\"\n"
-              "libcommon/lib/util/fd:14 Failed to open /dev/mmcblk0p2: No such device or address\n"
+              "libcommon/lib/util/fd:N Failed to open /dev/mmcblk0p2: No such device or address\n"
               "lib/storage/storage_target:N Failed to open \"/dev/mmcblk0p2\" for writing\n"
               "begin 52 valid 0\n");
     EXPECT_EQ(recorder.calls(), kUnmount);

@@ -14,6 +14,7 @@
 #include "device_test_support.h"
 #include "files.h"
 #include "scratch_dir.h"
+#include "registration_log.h"
 #include "simulated_device.h"
 #include "storage_log.h"
 
@@ -29,27 +30,10 @@ ProcessResult runTool(std::vector<std::string> args) {
     return testing_support::runProgram(args);
 }
 
-std::string dualFileLines(const fs::path& base) {
-    const std::string b = base.string();
-    return "Register kIpiStorageTargetSettings = DualFileTarget " + b + "/settings [1]\n" +
-           "Register kIpiStorageTargetOverlay = DualFileTarget " + b + "/app/overlays [8]\n" +
-           "Register kIpiStorageTargetLUT = DualFileTarget " + b + "/app/luts [26]\n" +
-           "Register kIpiStorageTargetCalibSave = DualFileTarget " + b + "/app/calibSave [1]\n" +
-           "Register kIpiStorageTargetCalibExtra = DualFileTarget " + b + "/app/calibExtra [1]\n" +
-           "Register kIpiStorageTargetUtilSave = DualFileTarget " + b + "/app/utilSave [1]\n" +
-           "Register kIpiStorageTargetApplicationInternal = DualFileTarget " + b + "/app/internal [1]\n" +
-           "Register kIpiStorageTargetRebootPersistent = DualFileTarget " + b + "/app/rebootPersistent [1]\n";
-}
+const std::string kFileReadLines = testing_support::kFileReadRegisterLines;
+const std::string kDeviceTargetLines = testing_support::kDeviceTargetRegisterLines;
 
-const std::string kFileReadLines =
-    "Register kIpiStorageTargetBootPartition = FileReadTarget /media/boot [0]\n"
-    "Register kIpiStorageTargetResourcePartition = FileReadTarget /media/resources [0]\n"
-    "Register kIpiStorageTargetResourceManufacturingPartition = FileReadTarget /media/static [0]\n";
-
-const std::string kDeviceTargetLines =
-    "Register kIpiStorageTargetBootVector = BootVectorTarget [1]\n"
-    "Register kIpiStorageTargetFirmwareUpdateBootFile = FirmwareUpdateBootTarget /media/boot [2]\n"
-    "Register kIpiStorageTargetFirmwareUpdateResourcePartition = FirmwareUpdatePartitionTarget [1]\n";
+std::string dualFileLines(const fs::path& base) { return testing_support::dualFileRegisterLines(base); }
 
 const std::string kParseFailure = "lib/storage/storage_target:N Failed to parse flash size ''\n";
 

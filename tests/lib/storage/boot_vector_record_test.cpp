@@ -357,24 +357,37 @@ protected:
     void SetUp() override {
         if (std::filesystem::exists("/dev/mmcblk0")) GTEST_SKIP() << "this host has a /dev/mmcblk0";
     }
+
+    // Builds the target with the row's stand-in first on PATH and the log
+    // at `threshold`; prints whether the slot is valid.
+    testing_support::ProcessResult build(int threshold) const {
+        testing_support::ScratchDir dir;
+        const std::filesystem::path tail = dir / "tail";
+        testing_support::writeText(tail, std::string("#!/bin/sh\n") + GetParam().tailScript + "\n");
+        std::filesystem::permissions(tail, std::filesystem::perms::owner_all);
+        return runInChild([&] {
+            const char* path = std::getenv("PATH");
+            setenv("PATH", (dir.path().string() + ":" + (path != nullptr ? path : "/usr/bin:/bin")).c_str(), 1);
+            setLogOutput(LOG_OUTPUT_STDOUT);
+            setLogLevel(threshold);
+            BootVectorTarget target;
+            std::printf("valid %d\n", target.getSlot(0)->isValid() ? 1 : 0);
+            return 0;
+        });
+    }
 };
 
 TEST_P(BootVectorLocateWithoutDevice, Row) {
-    const LocateRow& row = GetParam();
-    testing_support::ScratchDir dir;
-    const std::filesystem::path tail = dir / "tail";
-    testing_support::writeText(tail, std::string("#!/bin/sh\n") + row.tailScript + "\n");
-    std::filesystem::permissions(tail, std::filesystem::perms::owner_all);
-    const auto result = runInChild([&] {
-        const char* path = std::getenv("PATH");
-        setenv("PATH", (dir.path().string() + ":" + (path != nullptr ? path : "/usr/bin:/bin")).c_str(), 1);
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        BootVectorTarget target;
-        std::printf("valid %d\n", target.getSlot(0)->isValid() ? 1 : 0);
-        return 0;
-    });
+    const auto result = build(LOG_PRIORITY_WARNING);
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(withoutStorageLineNumbers(result.out), std::string(row.log) + "valid 0\n");
+    EXPECT_EQ(withoutStorageLineNumbers(result.out), std::string(GetParam().log) + "valid 0\n");
+}
+
+// Every failure is an error line: none shows at the critical threshold.
+TEST_P(BootVectorLocateWithoutDevice, SilentAtTheCriticalThreshold) {
+    const auto result = build(LOG_PRIORITY_CRITICAL);
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(result.out, "valid 0\n");
 }
 
 INSTANTIATE_TEST_SUITE_P(
@@ -394,10 +407,10 @@ INSTANTIATE_TEST_SUITE_P(
         LocateRow{"Negative", "echo -5", "lib/storage/storage_target:N Boot vector 0 not in range 6291456 to 33554432\n"},
         // In range, so the device is opened next, and it is missing.
         LocateRow{"InRange", "echo ' 30703616 30777343 73728 36M'",
-                  "libcommon/lib/util/fd:14 Failed to open /dev/mmcblk0: No such file or directory\n"
+                  "libcommon/lib/util/fd:N Failed to open /dev/mmcblk0: No such file or directory\n"
                   "lib/storage/storage_target:N Boot vector query failed!\n"},
         LocateRow{"Fraction", "echo 12345678.9",
-                  "libcommon/lib/util/fd:14 Failed to open /dev/mmcblk0: No such file or directory\n"
+                  "libcommon/lib/util/fd:N Failed to open /dev/mmcblk0: No such file or directory\n"
                   "lib/storage/storage_target:N Boot vector query failed!\n"}),
     [](const ::testing::TestParamInfo<LocateRow>& info) { return std::string(info.param.name); });
 

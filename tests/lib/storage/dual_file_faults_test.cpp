@@ -15,10 +15,14 @@
 #include "files.h"
 #include "lib/storage/dual_file_target.h"
 #include "scratch_dir.h"
+#include "source_lines.h"
 #include "store_files.h"
 #include "without_openat2.h"
 
 namespace {
+
+// How an open failure reported by the descriptor helpers begins.
+const std::string kOpenFailure = testing_support::openFailurePrefix();
 
 namespace fs = std::filesystem;
 using store_test::absentBlob;
@@ -123,7 +127,7 @@ TEST_F(DualFileFaults, TransientFileCannotBeOpened) {
     const ProcessResult result =
         drive({"write", input(new_)}, faultEnv("open", 1, "errno:EIO", path("1/data.chk.tmp")));
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "libcommon/lib/util/fd:14 Failed to open " + path("1/data.chk.tmp") +
+    EXPECT_EQ(result.out, kOpenFailure + path("1/data.chk.tmp") +
                               ": Input/output error\n"
                               "lib/storage/storage_target:461 finalise: write failed: 9: Bad file descriptor\n"
                               "write: 52\n" +
@@ -256,7 +260,7 @@ TEST_F(DualFileFaults, CheckFileCannotBeOpenedForTheSync) {
     prepare();
     const ProcessResult result = drive(steps, faultEnv("open", opens, "errno:EIO", path("1/data.chk")));
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(result.out, "libcommon/lib/util/fd:14 Failed to open " + path("1/data.chk") +
+    EXPECT_EQ(result.out, kOpenFailure + path("1/data.chk") +
                               ": Input/output error\n"
                               "lib/storage/storage_target:516 Failed to open path \"" +
                               path("1/data.chk") + "\" for  fs sync\nwrite: 0\n" + stateLine(holding(new_)));
@@ -429,7 +433,7 @@ TEST_F(DualFileFaults, DataFileCannotBeOpened) {
     const ProcessResult result =
         drive({"write", input(new_)}, faultEnv("open", atOpening + 1, "errno:EIO", path("1/data")));
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "libcommon/lib/util/fd:14 Failed to open " + path("1/data") +
+    EXPECT_EQ(result.out, kOpenFailure + path("1/data") +
                               ": Input/output error\nwrite: 52\n" + stateLine(holding(old_)));
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(older_) + "\n" + copyLines("2", old_));
     expectReopenedAs(holding(old_));

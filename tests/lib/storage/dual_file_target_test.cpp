@@ -26,9 +26,13 @@
 #include "files.h"
 #include "lib/util/log.h"
 #include "scratch_dir.h"
+#include "source_lines.h"
 #include "store_files.h"
 
 namespace {
+
+// How an open failure reported by the descriptor helpers begins.
+const std::string kOpenFailure = testing_support::openFailurePrefix();
 
 namespace fs = std::filesystem;
 using Storage::DualFileTarget;
@@ -1244,7 +1248,7 @@ TEST_F(DualFileStore, TransientFileThatCannotBeCleanedUp) {
         std::printf("%s\n", hex(contentOf(slot).data).c_str());
         return 0;
     });
-    EXPECT_EQ(result.out, "libcommon/lib/util/fd:14 Failed to open " + (copyDir(0) / "data.chk.tmp").string() +
+    EXPECT_EQ(result.out, kOpenFailure + (copyDir(0) / "data.chk.tmp").string() +
                               ": Is a directory\n"
                               "lib/storage/storage_target:461 finalise: write failed: 9: Bad file descriptor\n"
                               "lib/storage/storage_target:470 Failed to cleanup check file\n"

@@ -16,6 +16,7 @@
 #include "files.h"
 #include "lib/util/log.h"
 #include "scratch_dir.h"
+#include "source_lines.h"
 
 namespace {
 
@@ -29,7 +30,7 @@ using testing_support::ScratchDir;
 using testing_support::writeBytes;
 
 // Scripts match the open failure by this fixed line of libcommon/lib/util/fd.
-const std::string kOpenFailurePrefix = "libcommon/lib/util/fd:14 Failed to open ";
+const std::string kOpenFailurePrefix = testing_support::openFailurePrefix();
 
 constexpr size_t kUnset = 0xA5A5A5A5;
 
@@ -238,6 +239,19 @@ TEST_F(FileReadTargetTest, IndexIsTakenModulo2To32) {
     EXPECT_EQ(target.removeSlot(kTwoTo32 + 1), STATUS_OK);
     EXPECT_FALSE(target.getSlot(1));
     EXPECT_EQ(target.getSlotCount(), 1u);
+}
+
+// The same rule seen in the data: a read through an index 2^32 above a
+// slot's reads that slot's file, and 2^33 above too.
+TEST_F(FileReadTargetTest, ReadThroughAWrappedIndexReadsTheSlotsFile) {
+    FileReadTarget target(base());
+    ASSERT_EQ(add(target, "first.bin", first.size()), 0u);
+    ASSERT_EQ(add(target, "second.bin", second.size()), 1u);
+    for (const size_t above : {size_t{1} << 32, size_t{1} << 33}) {
+        SlotHandle slot = target.getSlot(above + 1);
+        ASSERT_TRUE(slot) << above;
+        EXPECT_EQ(readAll(*slot.get(), 8192), second) << above;
+    }
 }
 
 TEST_F(FileReadTargetTest, DirectoryOpensButItsSizeThrows) {

@@ -7,6 +7,8 @@
 #include <cstdlib>
 #include <fcntl.h>
 #include <filesystem>
+#include <functional>
+#include <map>
 #include <string>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -15,8 +17,11 @@
 
 #include <gtest/gtest.h>
 
+#include "boot_update_log.h"
 #include "child_process.h"
 #include "fake_mount_commands.h"
+#include "fault_injection.h"
+#include "files.h"
 #include "lib/storage/firmware_update_boot_target.h"
 #include "lib/storage/firmware_update_partition_target.h"
 #include "lib/util/log.h"
@@ -28,7 +33,13 @@ namespace fs = std::filesystem;
 using Storage::FirmwareUpdateBootTarget;
 using Storage::FirmwareUpdatePartitionTarget;
 using Storage::TargetSlot;
+using testing_support::begunLines;
 using testing_support::FakeMountCommands;
+using testing_support::finalisingLines;
+using testing_support::kBootRemountRoCall;
+using testing_support::kBootRemountRwCall;
+using testing_support::needsUpdatingLines;
+using testing_support::ProcessResult;
 using testing_support::normalisedStorageLog;
 using testing_support::runInChild;
 
@@ -55,6 +66,42 @@ Bytes pattern(size_t size, uint8_t seed) {
 
 Status writeAt(TargetSlot& slot, int64_t offset, const Bytes& data) { return slot.writeAt(offset, data.data(), data.size()); }
 
+// "<what> <status> valid <0|1>", the slot's validity taken after the call
+// that gave `status`.
+void printWithValidity(const char* what, Status status, TargetSlot& slot) {
+    std::printf("%s %u valid %d\n", what, status, slot.isValid() ? 1 : 0);
+}
+
+// Runs `body` on slot `index` of a new boot-file target in a child, with
+// the log on standard output at `threshold`; optionally with the stand-in
+// mount commands first on PATH.
+ProcessResult onBootSlot(size_t index, int threshold, const std::function<int(TargetSlot&)>& body) {
+    return runInChild([&] {
+        setLogOutput(LOG_OUTPUT_STDOUT);
+        setLogLevel(threshold);
+        FirmwareUpdateBootTarget target;
+        return body(*target.getSlot(index).get());
+    });
+}
+
+ProcessResult onBootSlot(const FakeMountCommands& fake, size_t index, int threshold,
+                         const std::function<int(TargetSlot&)>& body,
+                         const std::map<std::string, std::string>& env = {}) {
+    return fake.run(
+        threshold,
+        [&] {
+            FirmwareUpdateBootTarget target;
+            return body(*target.getSlot(index).get());
+        },
+        env);
+}
+
+size_t countOf(const std::string& text, const std::string& part) {
+    size_t count = 0;
+    for (size_t at = text.find(part); at != std::string::npos; at = text.find(part, at + part.size())) ++count;
+    return count;
+}
+
 // ---- the boot-file target ----
 
 TEST(FirmwareUpdateBoot, TwoSlotsOnePerBootFile) {
@@ -80,9 +127,7 @@ TEST(FirmwareUpdateBoot, TwoSlotsOnePerBootFile) {
 // said about it.
 TEST(FirmwareUpdateBoot, IdleSlot) {
     FakeMountCommands fake;
-    const auto result = fake.run(LOG_PRIORITY_DEBUG, [] {
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(fake, 0, LOG_PRIORITY_DEBUG, [](TargetSlot& slot) {
         const Bytes data = pattern(10, 1);
         uint8_t buffer[10] = {};
         size_t got = 5;
@@ -112,22 +157,14 @@ TEST(FirmwareUpdateBoot, IdleSlot) {
 }
 
 TEST(FirmwareUpdateBoot, BeginOpensAnUnnamedTemporaryFile) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_DEBUG);
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
-        {
-            const Status status = slot.beginWrite();
-            std::printf("begin %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
+    const auto result = onBootSlot(0, LOG_PRIORITY_DEBUG, [](TargetSlot& slot) {
+        printWithValidity("begin", slot.beginWrite(), slot);
         printTemporaryDescriptors();
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT.BIN", 1) +
               "begin 0 valid 1\n"
               "fd #1 (deleted) cloexec 1\n");
 }
@@ -141,18 +178,13 @@ TEST(FirmwareUpdateBoot, SecondSlotIsBoot0010) {
         return 0;
     });
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT0010.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT0010.BIN", 1) +
               "begin 0\n"
               "slot 0 valid 0\n");
 }
 
 TEST(FirmwareUpdateBoot, NothingBelowWarningPriority) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_ERROR);
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(0, LOG_PRIORITY_ERROR, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("erase %u\n", slot.erase());
@@ -162,30 +194,21 @@ TEST(FirmwareUpdateBoot, NothingBelowWarningPriority) {
 }
 
 TEST(FirmwareUpdateBoot, BeginTwiceRestarts) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_INFO);
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(100, 1)));
-        {
-            const Status status = slot.beginWrite();
-            std::printf("begin %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
+        printWithValidity("begin", slot.beginWrite(), slot);
         printTemporaryDescriptors();
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT.BIN", 1) +
               "begin 0\n"
               "writeAt 0\n"
               "Restarting firmware update!\n"
-              "Closing #1\n"
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #2 for receiving firmware\n"
+              "Closing #1\n" +
+              begunLines("BOOT.BIN", 2) +
               "begin 0 valid 1\n"
               "fd #2 (deleted) cloexec 1\n");
 }
@@ -193,11 +216,7 @@ TEST(FirmwareUpdateBoot, BeginTwiceRestarts) {
 // The restart's own count starts at 0: nothing received after it means a
 // failed finalise, whatever came before.
 TEST(FirmwareUpdateBoot, RestartForgetsWhatWasReceived) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_INFO);
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         (void)slot.beginWrite();
         (void)writeAt(slot, 0, pattern(100, 1));
         (void)slot.beginWrite();
@@ -207,34 +226,26 @@ TEST(FirmwareUpdateBoot, RestartForgetsWhatWasReceived) {
     });
     const std::string out = normalisedStorageLog(result.out);
     EXPECT_EQ(out.substr(out.find("--\n")),
-              "--\n"
-              "lib/storage/storage_target:N TODO: Sanity-check the file\n"
-              "\"/media/boot/BOOT.BIN\" update with 0 bytes written\n"
+              "--\n" +
+              finalisingLines("BOOT.BIN", 0) +
               "Closing #2\n"
               "finalise 52\n");
 }
 
 TEST(FirmwareUpdateBoot, FinaliseWithNothingReceivedFails) {
     FakeMountCommands fake;
-    const auto result = fake.run(LOG_PRIORITY_INFO, [] {
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(fake, 0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
-        {
-            const Status status = slot.finalise();
-            std::printf("finalise %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
+        printWithValidity("finalise", slot.finalise(), slot);
         printTemporaryDescriptors();
         std::printf("finalise %u\n", slot.finalise());
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
-              "begin 0\n"
-              "lib/storage/storage_target:N TODO: Sanity-check the file\n"
-              "\"/media/boot/BOOT.BIN\" update with 0 bytes written\n"
+              begunLines("BOOT.BIN", 1) +
+              "begin 0\n" +
+              finalisingLines("BOOT.BIN", 0) +
               "Closing #1\n"
               "finalise 52 valid 0\n"
               "finalise 2\n");
@@ -244,9 +255,7 @@ TEST(FirmwareUpdateBoot, FinaliseWithNothingReceivedFails) {
 // Empty blocks count nothing either.
 TEST(FirmwareUpdateBoot, EmptyWritesCountNothing) {
     FakeMountCommands fake;
-    const auto result = fake.run(LOG_PRIORITY_ERROR, [] {
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(1).get();
+    const auto result = onBootSlot(fake, 1, LOG_PRIORITY_ERROR, [](TargetSlot& slot) {
         const Bytes none;
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, none));
@@ -264,17 +273,10 @@ TEST(FirmwareUpdateBoot, EmptyWritesCountNothing) {
 }
 
 TEST(FirmwareUpdateBoot, EraseAbandonsTheUpdate) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_INFO);
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(1).get();
+    const auto result = onBootSlot(1, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
-        {
-            const Status status = slot.erase();
-            std::printf("erase %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
+        printWithValidity("erase", slot.erase(), slot);
         printTemporaryDescriptors();
         std::printf("erase %u\n", slot.erase());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
@@ -282,8 +284,7 @@ TEST(FirmwareUpdateBoot, EraseAbandonsTheUpdate) {
         return 0;
     });
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT0010.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT0010.BIN", 1) +
               "begin 0\n"
               "writeAt 0\n"
               "Closing #1\n"
@@ -296,24 +297,16 @@ TEST(FirmwareUpdateBoot, EraseAbandonsTheUpdate) {
 // pwrite refuses a negative offset; the errno comes back and the update is
 // over, so the next block is refused.
 TEST(FirmwareUpdateBoot, StreamedWriteAfterAFailedOneIsRefused) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_INFO);
-        FirmwareUpdateBootTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
+    const auto result = onBootSlot(0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         std::printf("begin %u\n", slot.beginWrite());
         std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
-        {
-            const Status status = writeAt(slot, -1, pattern(10, 2));
-            std::printf("writeAt %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
+        printWithValidity("writeAt", writeAt(slot, -1, pattern(10, 2)), slot);
         std::printf("writeAt %u\n", writeAt(slot, 10, pattern(10, 3)));
         std::printf("finalise %u\n", slot.finalise());
         return 0;
     });
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT.BIN", 1) +
               "begin 0\n"
               "writeAt 0\n"
               "Closing #1\n"
@@ -347,15 +340,13 @@ TEST(FirmwareUpdateBoot, ShortOrFailedStreamedWriteEndsTheUpdate) {
     });
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT.BIN", 1) +
               "begin 0\n"
               "writeAt 0\n"
               "Closing #1\n"
               "writeAt 52\n"
-              "writeAt 95\n"
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #2 for receiving firmware\n"
+              "writeAt 95\n" +
+              begunLines("BOOT.BIN", 2) +
               "begin 0\n"
               "Closing #2\n"
               "writeAt 27\n"
@@ -369,39 +360,109 @@ TEST(FirmwareUpdateBoot, ShortOrFailedStreamedWriteEndsTheUpdate) {
 TEST(FirmwareUpdateBoot, FailedRemountEndsTheUpdate) {
     if (fs::exists("/media/boot")) GTEST_SKIP() << "this host has a /media/boot";
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_INFO,
-        [] {
-            FirmwareUpdateBootTarget target;
-            TargetSlot& slot = *target.getSlot(0).get();
-            std::printf("begin %u\n", slot.beginWrite());
-            std::printf("writeAt %u\n", writeAt(slot, 100, pattern(10, 1)));
-            std::printf("writeAt %u\n", writeAt(slot, 0, pattern(7, 2)));
-            std::printf("writeAt %u\n", writeAt(slot, 100, pattern(13, 3)));
-            {
-                const Status status = slot.finalise();
-                std::printf("finalise %u valid %d\n", status, slot.isValid() ? 1 : 0);
-            }
-            printTemporaryDescriptors();
-            return 0;
-        },
-        {{"FAKE_MOUNT_EXIT", "32"}});
+    const auto result = onBootSlot(fake, 0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("writeAt %u\n", writeAt(slot, 100, pattern(10, 1)));
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(7, 2)));
+        std::printf("writeAt %u\n", writeAt(slot, 100, pattern(13, 3)));
+        printWithValidity("finalise", slot.finalise(), slot);
+        printTemporaryDescriptors();
+        return 0;
+    }, {{"FAKE_MOUNT_EXIT", "32"}});
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out),
-              "Beginning update of /boot file \"/media/boot/BOOT.BIN\"\n"
-              "Opened #1 for receiving firmware\n"
+              begunLines("BOOT.BIN", 1) +
               "begin 0\n"
               "writeAt 0\n"
               "writeAt 0\n"
-              "writeAt 0\n"
-              "lib/storage/storage_target:N TODO: Sanity-check the file\n"
-              "\"/media/boot/BOOT.BIN\" update with 30 bytes written\n"
-              "\"/media/boot/BOOT.BIN\" needs updating\n"
-              "Remounting \"/media/boot\" as rw\n"
+              "writeAt 0\n" +
+              finalisingLines("BOOT.BIN", 30) +
+              needsUpdatingLines("BOOT.BIN") +
               "lib/storage/storage_target:N Failed to execute mount\n"
               "Closing #1\n"
               "finalise 52 valid 0\n");
-    EXPECT_EQ(fake.calls(), "mount [-o] [remount,rw] [/media/boot]\n");
+    EXPECT_EQ(fake.calls(), kBootRemountRwCall);
+}
+
+// Without a boot partition every attempt fails to open the boot file and
+// its read-back finds nothing: five attempts, then the read-only remount.
+TEST(FirmwareUpdateBoot, UnwritableBootFileIsTriedFiveTimes) {
+    if (fs::exists("/media/boot")) GTEST_SKIP() << "this host has a /media/boot";
+    FakeMountCommands fake;
+    const auto result = onBootSlot(fake, 0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
+        printWithValidity("finalise", slot.finalise(), slot);
+        return 0;
+    });
+    std::string attempts;
+    for (int attempt = 0; attempt < 5; ++attempt) {
+        attempts +=
+            "Opening \"/media/boot/BOOT.BIN\" for write\n"
+            "libcommon/lib/util/fd:N Failed to open /media/boot/BOOT.BIN: No such file or directory\n"
+            "lib/storage/storage_target:N Failed to open BOOT.BIN for writing\n";
+    }
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(normalisedStorageLog(result.out),
+              begunLines("BOOT.BIN", 1) +
+              "begin 0\n"
+              "writeAt 0\n" +
+              finalisingLines("BOOT.BIN", 10) +
+              needsUpdatingLines("BOOT.BIN") +
+                  attempts +
+                  "Remounting \"/media/boot\" as ro\n"
+                  "Closing #1\n"
+                  "finalise 52 valid 0\n");
+    EXPECT_EQ(fake.calls(), std::string(kBootRemountRwCall) + kBootRemountRoCall);
+}
+
+// At the critical threshold the same failing update says nothing, and ends
+// as it does when it talks.
+TEST(FirmwareUpdateBoot, FailingUpdateIsSilentAtTheCriticalThreshold) {
+    if (fs::exists("/media/boot")) GTEST_SKIP() << "this host has a /media/boot";
+    FakeMountCommands fake;
+    const auto result = onBootSlot(fake, 0, LOG_PRIORITY_CRITICAL, [](TargetSlot& slot) {
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("begin %u\n", slot.beginWrite());
+        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
+        std::printf("finalise %u\n", slot.finalise());
+        return 0;
+    });
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(result.out, "begin 0\nbegin 0\nwriteAt 0\nfinalise 52\n");
+    EXPECT_EQ(fake.calls(), std::string(kBootRemountRwCall) + kBootRemountRoCall);
+}
+
+// The same seen from outside the process: the shim counts one open of the
+// boot file per attempt, and failing the first one with EIO changes nothing
+// but its message.
+TEST(FirmwareUpdateBootHostFaults, EveryAttemptOpensTheBootFileOnce) {
+    if (!testing_support::programEmulator().empty()) {
+        GTEST_SKIP() << "native builds only: the shim cannot be preloaded under qemu-aarch64";
+    }
+    if (fs::exists("/media/boot")) GTEST_SKIP() << "this host has a /media/boot";
+    FakeMountCommands fake;
+    testing_support::ScratchDir dir;
+    const Bytes data = pattern(5000, 4);
+    testing_support::writeBytes(dir / "data", data);
+    const std::string counts = (dir / "count").string();
+    const auto drive = [&](testing_support::Environment env) {
+        env["PATH"] = fake.searchPath();
+        return testing_support::runProgram({DEVICE_TARGET_DRIVER, "boot-update", "0", (dir / "data").string()}, env);
+    };
+
+    const ProcessResult counted = drive(testing_support::faultCountEnv("open", counts, "/media/boot/BOOT.BIN"));
+    EXPECT_EQ(counted.exitStatus, 0) << counted.err;
+    EXPECT_EQ(testing_support::readFaultCount(counts), 5u);
+    EXPECT_EQ(countOf(counted.out, "Failed to open /media/boot/BOOT.BIN: No such file or directory\n"), 5u);
+    EXPECT_EQ(countOf(counted.out, "finalise 52 valid 0\n"), 1u);
+
+    const ProcessResult failed = drive(testing_support::faultEnv("open", 1, "errno:EIO", "/media/boot/BOOT.BIN", counts));
+    EXPECT_EQ(failed.exitStatus, 0) << failed.err;
+    EXPECT_EQ(testing_support::readFaultCount(counts), 5u);
+    EXPECT_EQ(countOf(failed.out, "Failed to open /media/boot/BOOT.BIN: Input/output error\n"), 1u);
+    EXPECT_EQ(countOf(failed.out, "Failed to open /media/boot/BOOT.BIN: No such file or directory\n"), 4u);
+    EXPECT_EQ(countOf(failed.out, "finalise 52 valid 0\n"), 1u);
 }
 
 // Destroying a slot in the middle of an update closes its temporary file.
@@ -481,26 +542,29 @@ TEST(FirmwareUpdatePartition, IdleSlot) {
 
 TEST(FirmwareUpdatePartition, BeginWithoutTheBlockDevice) {
     if (fs::exists("/dev/mmcblk0p2")) GTEST_SKIP() << "this host has a /dev/mmcblk0p2";
-    FakeMountCommands fake;
-    const auto result = fake.run(LOG_PRIORITY_DEBUG, [] {
-        FirmwareUpdatePartitionTarget target;
-        TargetSlot& slot = *target.getSlot(0).get();
-        {
-            const Status status = slot.beginWrite();
-            std::printf("begin %u valid %d\n", status, slot.isValid() ? 1 : 0);
-        }
-        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
-        std::printf("finalise %u\n", slot.finalise());
-        return 0;
-    });
-    EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              "lib/storage/storage_target:N Unable to locate block device \"/dev/mmcblk0p2\"\n"
-              "begin 2 valid 0\n"
-              "writeAt 95\n"
-              "finalise 2\n");
-    // Nothing was unmounted.
-    EXPECT_EQ(fake.calls(), "");
+    // The error line shows down to the error threshold only.
+    for (const int threshold : {LOG_PRIORITY_DEBUG, LOG_PRIORITY_ERROR, LOG_PRIORITY_CRITICAL}) {
+        FakeMountCommands fake;
+        const auto result = fake.run(threshold, [] {
+            FirmwareUpdatePartitionTarget target;
+            TargetSlot& slot = *target.getSlot(0).get();
+            printWithValidity("begin", slot.beginWrite(), slot);
+            std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
+            std::printf("finalise %u\n", slot.finalise());
+            return 0;
+        });
+        EXPECT_EQ(result.exitStatus, 0) << threshold;
+        EXPECT_EQ(normalisedStorageLog(result.out),
+                  std::string(threshold >= LOG_PRIORITY_ERROR
+                                  ? "lib/storage/storage_target:N Unable to locate block device \"/dev/mmcblk0p2\"\n"
+                                  : "") +
+                      "begin 2 valid 0\n"
+                      "writeAt 95\n"
+                      "finalise 2\n")
+            << threshold;
+        // Nothing was unmounted.
+        EXPECT_EQ(fake.calls(), "") << threshold;
+    }
 }
 
 }  // namespace

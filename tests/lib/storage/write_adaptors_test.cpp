@@ -571,6 +571,27 @@ TEST_F(PartitionWriteAdaptorTest, RemoveAllSlotsRefusesWithoutRemount) {
                                "slot 1 destroyed", "target destroyed"}));
 }
 
+// The same over the dual-file store, as the registry builds it: its blobs
+// stay where they are.
+TEST_F(PartitionWriteAdaptorTest, RemoveAllSlotsOfADualFileStoreRefusesWithoutRemount) {
+    installFakeMount();
+    {
+        DualFileTarget target(storePath, 2);
+        ASSERT_EQ(target.getSlot(1)->write(blob.data(), blob.size()), STATUS_OK);
+    }
+    const ProcessResult result = run([&] {
+        PartitionWriteAdaptor<DualFileTarget> store(mountPoint, storePath, 2);
+        note(statusLine("removeAllSlots", store.removeAllSlots()));
+        note("count " + std::to_string(store.getSlotCount()));
+    });
+    expectCleanExit(result);
+    EXPECT_EQ(result.out, "");
+    EXPECT_EQ(events(), (Lines{"removeAllSlots -> 38", "count 2"}));
+    DualFileTarget reopened(storePath, 2);
+    EXPECT_EQ(store_test::contentOf(*reopened.getSlot(0).get()), store_test::nothingStored());
+    EXPECT_EQ(store_test::contentOf(*reopened.getSlot(1).get()), store_test::holding(blob));
+}
+
 // A failed remount is logged and the slot operation goes on with its own
 // status; the next transition is tried all the same.
 class FailingRemountTest : public PartitionWriteAdaptorTest, public ::testing::WithParamInterface<Status> {};

@@ -4,6 +4,7 @@
 
 #include "child_process.h"
 #include "lib/util/log.h"
+#include "registration_log.h"
 #include "scratch_dir.h"
 
 namespace {
@@ -97,23 +98,7 @@ TEST(TargetRegistry, RegisterLinesInTableOrder) {
         registerTargets(dir.path(), registry);
         return 0;
     });
-    const std::string base = dir.path().string();
-    std::string expected;
-    const char* names[] = {"kIpiStorageTargetSettings",      "kIpiStorageTargetOverlay",
-                           "kIpiStorageTargetLUT",           "kIpiStorageTargetCalibSave",
-                           "kIpiStorageTargetCalibExtra",    "kIpiStorageTargetUtilSave",
-                           "kIpiStorageTargetApplicationInternal", "kIpiStorageTargetRebootPersistent"};
-    for (size_t i = 0; i < std::size(kStores); ++i) {
-        expected += std::string("Register ") + names[i] + " = DualFileTarget " + base + "/" + kStores[i].location +
-                    " [" + std::to_string(kStores[i].slots) + "]\n";
-    }
-    expected +=
-        "Register kIpiStorageTargetBootPartition = FileReadTarget /media/boot [0]\n"
-        "Register kIpiStorageTargetResourcePartition = FileReadTarget /media/resources [0]\n"
-        "Register kIpiStorageTargetResourceManufacturingPartition = FileReadTarget /media/static [0]\n"
-        "Register kIpiStorageTargetBootVector = BootVectorTarget [1]\n"
-        "Register kIpiStorageTargetFirmwareUpdateBootFile = FirmwareUpdateBootTarget /media/boot [2]\n"
-        "Register kIpiStorageTargetFirmwareUpdateResourcePartition = FirmwareUpdatePartitionTarget [1]\n";
+    const std::string expected = testing_support::registerLines(dir.path());
     // Off the device the boot vector's own failure line is logged too.
     EXPECT_EQ(linesStartingWith(result.out, "Register "), expected);
 }

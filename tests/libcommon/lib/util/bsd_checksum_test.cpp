@@ -6,17 +6,13 @@
 
 #include <gtest/gtest.h>
 
+#include "files.h"
+
 namespace {
 
 using Bytes = std::vector<uint8_t>;
-
-Bytes bytesOf(const std::string& text) { return Bytes(text.begin(), text.end()); }
-
-Bytes counting(size_t count) {
-    Bytes bytes(count);
-    for (size_t i = 0; i < count; ++i) bytes[i] = static_cast<uint8_t>(i);
-    return bytes;
-}
+using testing_support::bytesOf;
+using testing_support::counting;
 
 Bytes pattern(size_t count) {
     Bytes bytes(count);

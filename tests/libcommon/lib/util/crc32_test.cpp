@@ -12,19 +12,14 @@
 #include <gtest/gtest.h>
 
 #include "child_process.h"
+#include "files.h"
 #include "lib/util/crc32_paths.h"
 
 namespace {
 
 using Bytes = std::vector<uint8_t>;
-
-Bytes bytesOf(const std::string& text) { return Bytes(text.begin(), text.end()); }
-
-Bytes counting(size_t count) {
-    Bytes bytes(count);
-    for (size_t i = 0; i < count; ++i) bytes[i] = static_cast<uint8_t>(i);
-    return bytes;
-}
+using testing_support::bytesOf;
+using testing_support::counting;
 
 Bytes repeated(const std::string& text, size_t times) {
     Bytes bytes;

@@ -17,6 +17,7 @@
 #include "files.h"
 #include "lib/util/log.h"
 #include "scratch_dir.h"
+#include "source_lines.h"
 
 namespace {
 
@@ -27,7 +28,7 @@ using testing_support::ScratchDir;
 using testing_support::writeText;
 
 // Line of the LOGE statement in libcommon/lib/util/fd.cpp; scripts match on it.
-const std::string kOpenFailurePrefix = "libcommon/lib/util/fd:14 Failed to open ";
+const std::string kOpenFailurePrefix = testing_support::openFailurePrefix();
 
 static_assert(!std::is_copy_constructible_v<UniqueFd>);
 static_assert(!std::is_copy_assignable_v<UniqueFd>);

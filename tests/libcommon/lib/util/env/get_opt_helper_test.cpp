@@ -164,38 +164,32 @@ TEST(GetOptHelperTables, EmptyTableParseCallsEndOfOptionsThenFinishWithAllArgume
     EXPECT_EQ(helper.eventText(), "option -1 <null>\nfinish one two\n");
 }
 
-TEST(GetOptHelperTables, ShortOptionStringTakesPrintableIdsOfRegisteredRows) {
-    uint8_t seen = 0;
-    const std::vector<Row> table = {
+// Every kind of row, short and long ids, names and none: the rows that
+// both option tables are built from.
+std::vector<Row> mixedTable(uint8_t* seen) {
+    return {
         row('a', "alpha", 0, Kind::Plain),
         row('b', nullptr, 1, Kind::Plain),
         row('c', "gamma", 2, Kind::Plain),  // optional argument: one ':' only
         choiceRow(1000, "thousand", {{"x", 1}}),
-        flagRow('d', "delta", &seen),
+        flagRow('d', "delta", seen),
         row('t', "text", 1, Kind::Text),
         row('u', "unknown", 1, kUnknownKind),
         choiceRow('e', "", {{"y", 2}}),
         row(7, "bell", 0, Kind::Plain),
         row(200, "high", 1, Kind::Plain),
     };
-    RecordingHelper helper(table);
+}
+
+TEST(GetOptHelperTables, ShortOptionStringTakesPrintableIdsOfRegisteredRows) {
+    uint8_t seen = 0;
+    RecordingHelper helper(mixedTable(&seen));
     EXPECT_EQ(helper.shortOptions, "ab:c:de:");
 }
 
 TEST(GetOptHelperTables, LongOptionsHoldNamedRegisteredRowsWithNullFlagAndEndWithTerminator) {
     uint8_t seen = 0;
-    const std::vector<Row> table = {
-        row('a', "alpha", 0, Kind::Plain),
-        row('b', nullptr, 1, Kind::Plain),
-        row('c', "gamma", 2, Kind::Plain),
-        choiceRow(1000, "thousand", {{"x", 1}}),
-        flagRow('d', "delta", &seen),
-        row('t', "text", 1, Kind::Text),
-        row('u', "unknown", 1, kUnknownKind),
-        choiceRow('e', "", {{"y", 2}}),
-        row(7, "bell", 0, Kind::Plain),
-        row(200, "high", 1, Kind::Plain),
-    };
+    const std::vector<Row> table = mixedTable(&seen);
     RecordingHelper helper(table);
     struct Expected {
         const char* name;
@@ -561,6 +555,18 @@ TEST(GetOptHelperUsage, TextRowsAreCopiedVerbatimAndUnknownKindsShowNothing) {
               "Options:\n"
               "  -a, --alpha             Alpha help.\n"
               "  no newline   -b                      B.\n");
+}
+
+// Null texts count as empty ones: no help, no default, no text.
+TEST(GetOptHelperUsage, NullHelpDefaultAndTextShowNothing) {
+    const std::vector<Row> table = {
+        row(0, nullptr, 0, Kind::Text, nullptr),
+        row('a', "alpha", 1, Kind::Plain, nullptr, nullptr),
+        row('b', "beta", 0, Kind::Plain, "Beta help.", nullptr),
+    };
+    EXPECT_EQ(usageOf(table),
+              "  -a, --alpha=arg\n"
+              "  -b, --beta              Beta help.\n");
 }
 
 TEST(GetOptHelperUsage, OptionPartOf24StaysOnTheLineAnd25MovesHelpToTheNextLine) {

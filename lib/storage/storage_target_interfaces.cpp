@@ -1,4 +1,4 @@
-// The parts of the storage model shared by every target: slot handles, the
+// What storage_target.h declares, shared by every target: slot handles, the
 // defaults of optional operations and the observing slot adaptor.
 #include "lib/storage/storage_target.h"
 

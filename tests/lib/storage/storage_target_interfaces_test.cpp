@@ -141,6 +141,15 @@ TEST(SlotHandle, OwnedSlotDiesWithTheHandle) {
     EXPECT_EQ(destroyed, 1);
 }
 
+TEST(SlotHandle, OwningNothingIsANullHandle) {
+    SlotHandle handle = SlotHandle::own(nullptr);
+    EXPECT_FALSE(handle);
+    EXPECT_EQ(handle.get(), nullptr);
+    handle.reset();
+    EXPECT_FALSE(handle);
+    EXPECT_FALSE(handle.ownsSlot());
+}
+
 TEST(SlotHandle, ResetDestroysAnOwnedSlotOnce) {
     Calls calls;
     int destroyed = 0;

@@ -1,10 +1,10 @@
 // CRC-32 throughput on the same buffers: the project's crc32, zlib's crc32
 // and the classic loop over one 256-entry table, one byte per step.
-#include <array>
 #include <benchmark/benchmark.h>
+#include <zlib.h>
+#include <array>
 #include <cstdint>
 #include <vector>
-#include <zlib.h>
 
 #include "lib/util/crc32.h"
 

@@ -1,10 +1,10 @@
 #include "floor_commit.h"
 
-#include <cerrno>
-#include <cstring>
 #include <fcntl.h>
 #include <stdio.h>
 #include <unistd.h>
+#include <cerrno>
+#include <cstring>
 
 namespace bench {
 namespace {

@@ -5,12 +5,12 @@
 // dual-file store does, and the floor that bench/compare.sh measures the
 // tool and its peers against. Exit status 0, or 1 with the reason on
 // standard error.
-#include <cerrno>
-#include <cstdio>
-#include <cstring>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
 #include <vector>
 
 #include "floor_commit.h"
@@ -31,8 +31,10 @@ int readWhole(const char* path, std::vector<uint8_t>& bytes) {
     if (error == 0) {
         bytes.resize(static_cast<size_t>(status.st_size));
         const ssize_t count = ::read(fd, bytes.data(), bytes.size());
-        if (count < 0) error = errno;
-        else if (static_cast<size_t>(count) != bytes.size()) error = EIO;
+        if (count < 0)
+            error = errno;
+        else if (static_cast<size_t>(count) != bytes.size())
+            error = EIO;
     }
     ::close(fd);
     return error;

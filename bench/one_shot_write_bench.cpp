@@ -10,9 +10,9 @@
 // the mean of one long one. The stores live across repetitions and are
 // primed with two writes, so every timed write replaces an existing copy.
 #include <benchmark/benchmark.h>
+#include <unistd.h>
 #include <map>
 #include <memory>
-#include <unistd.h>
 #include <vector>
 
 #include "floor_commit.h"

@@ -7,9 +7,9 @@ namespace bench {
 
 const std::vector<StoreFill>& registryStores() {
     static const std::vector<StoreFill> stores = {
-        {"settings", 1, 4096},         {"app/overlays", 8, 284 + 1024}, {"app/luts", 26, 19784},
-        {"app/calibSave", 1, 4096},    {"app/calibExtra", 1, 4096},     {"app/utilSave", 1, 4096},
-        {"app/internal", 1, 4096},     {"app/rebootPersistent", 1, 4096},
+        {"settings", 1, 4096},      {"app/overlays", 8, 284 + 1024},   {"app/luts", 26, 19784},
+        {"app/calibSave", 1, 4096}, {"app/calibExtra", 1, 4096},       {"app/utilSave", 1, 4096},
+        {"app/internal", 1, 4096},  {"app/rebootPersistent", 1, 4096},
     };
     return stores;
 }

@@ -1,8 +1,8 @@
 #include "quiet_stderr.h"
 
-#include <cstdio>
 #include <fcntl.h>
 #include <unistd.h>
+#include <cstdio>
 
 namespace bench {
 

@@ -1,9 +1,9 @@
 #include "lib/storage/check_value.h"
 
-#include <cerrno>
-#include <chrono>
 #include <sys/stat.h>
 #include <unistd.h>
+#include <cerrno>
+#include <chrono>
 
 #include "lib/util/crc32.h"
 

@@ -3,9 +3,9 @@
 // all ones when the data file does not exist. Stored little-endian.
 #pragma once
 
+#include <sys/stat.h>
 #include <cstdint>
 #include <ctime>
-#include <sys/stat.h>
 
 #include "lib/util/status.h"
 

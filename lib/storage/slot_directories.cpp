@@ -1,11 +1,11 @@
 #include "lib/storage/slot_directories.h"
 
-#include <cerrno>
-#include <cstring>
 #include <fcntl.h>
-#include <iomanip>
 #include <sys/stat.h>
 #include <unistd.h>
+#include <cerrno>
+#include <cstring>
+#include <iomanip>
 #include <utility>
 
 #include "lib/storage/untrusted_tree.h"

@@ -1,13 +1,13 @@
 // The targets. Some error lines carry fixed line numbers (the *_LINE
 // constants) because device scripts match on them.
+#include <sys/stat.h>
+#include <sys/types.h>
+#include <unistd.h>
 #include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <iomanip>
-#include <sys/stat.h>
-#include <sys/types.h>
-#include <unistd.h>
 
 #include "lib/storage/boot_vector_target.h"
 #include "lib/storage/check_value.h"
@@ -78,8 +78,8 @@ bool dataMatches(SlotDirectories& directories, unsigned copy, uint64_t stored) {
     return matchesCheckValue(data.get(), status, stored);
 }
 
-Status readCopy(SlotDirectories& directories, unsigned copy, bool valid, uint8_t* buffer, size_t size,
-                int64_t offset, size_t* bytesRead) {
+Status readCopy(SlotDirectories& directories, unsigned copy, bool valid, uint8_t* buffer, size_t size, int64_t offset,
+                size_t* bytesRead) {
     if (!valid) return directories.open(copy).holds(kDataName) ? STATUS_FAILED : STATUS_NOT_FOUND;
     struct stat status {};
     const UniqueFd fd = directories.openForReading(copy, kDataName, status);
@@ -172,7 +172,8 @@ CheckTime DualFileTarget::Slot::currentCheckTime(SlotDirectories& directories) {
 }
 
 void DualFileTarget::Slot::invalidate(unsigned index, SlotDirectories& directories) {
-    if (const int error = directories.open(index).remove(kCheckName)) LOGE_AT(kInvalidateLine) << "" << errorCode(error);
+    if (const int error = directories.open(index).remove(kCheckName))
+        LOGE_AT(kInvalidateLine) << "" << errorCode(error);
     copies_[index].valid = false;
 }
 
@@ -520,9 +521,7 @@ Status remountBootPartition(bool writable) {
 
 Status mountPartition(const std::string& mountPoint) { return runMountCommand("Mounting ", "mount ", mountPoint); }
 
-Status unmountPartition(const std::string& mountPoint) {
-    return runMountCommand("Unmounting ", "umount ", mountPoint);
-}
+Status unmountPartition(const std::string& mountPoint) { return runMountCommand("Unmounting ", "umount ", mountPoint); }
 
 // ---------------------------------------------------------------------------
 // Firmware-update boot-file target

@@ -1,12 +1,12 @@
 #include "lib/storage/untrusted_tree.h"
 
-#include <atomic>
-#include <cerrno>
 #include <fcntl.h>
 #include <linux/openat2.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
+#include <atomic>
+#include <cerrno>
 
 namespace Storage {
 

@@ -244,8 +244,8 @@ private:
 
     // Every acknowledged update ends with the one syncfs of its commit.
     static void checkOneCommit(const std::vector<FsOp>& ops, char update) {
-        const size_t syncs = static_cast<size_t>(std::count_if(
-            ops.begin(), ops.end(), [](const FsOp& op) { return op.kind == FsOpKind::kSyncfs; }));
+        const size_t syncs = static_cast<size_t>(
+            std::count_if(ops.begin(), ops.end(), [](const FsOp& op) { return op.kind == FsOpKind::kSyncfs; }));
         if (ops.empty() || ops.back().kind != FsOpKind::kSyncfs || syncs != 1) {
             throw std::runtime_error(std::string("update ") + update + " did not end with its one commit's syncfs");
         }
@@ -285,9 +285,9 @@ Totals& Totals::operator+=(const Totals& other) {
 }
 
 std::string describe(const Totals& totals) {
-    return std::to_string(totals.scenarios) + " scenarios, " + std::to_string(totals.crashPoints) +
-           " crash points, " + std::to_string(totals.states) + " crash states (" +
-           std::to_string(totals.openedStates) + " distinct, each opened; " + std::to_string(totals.cleanUps) +
+    return std::to_string(totals.scenarios) + " scenarios, " + std::to_string(totals.crashPoints) + " crash points, " +
+           std::to_string(totals.states) + " crash states (" + std::to_string(totals.openedStates) +
+           " distinct, each opened; " + std::to_string(totals.cleanUps) +
            " with a clean-up cut short and opened again), " + std::to_string(totals.violations) + " violations";
 }
 
@@ -362,8 +362,8 @@ Totals Explorer::explore(const Scenario& scenario) {
             break;
         }
         ++totals.crashPoints;
-        totals.states += forEachCrashState(
-            record.durable, record.ops, crashPoint, scenario.order, [&](const FsImage& image) {
+        totals.states +=
+            forEachCrashState(record.durable, record.ops, crashPoint, scenario.order, [&](const FsImage& image) {
                 const Observation& seen = observe(image, scenario.slotCount, totals);
                 std::string problem = seen.cleanupProblem;
                 for (size_t slot = 0; slot < scenario.slotCount && problem.empty(); ++slot) {

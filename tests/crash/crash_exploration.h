@@ -44,9 +44,9 @@ struct Scenario {
 struct Totals {
     size_t scenarios = 0;
     size_t crashPoints = 0;
-    size_t states = 0;          // enumerated, repeats included
-    size_t openedStates = 0;    // distinct states a store was opened on
-    size_t cleanUps = 0;        // of those, where opening deleted check files
+    size_t states = 0;        // enumerated, repeats included
+    size_t openedStates = 0;  // distinct states a store was opened on
+    size_t cleanUps = 0;      // of those, where opening deleted check files
     size_t violations = 0;
 
     Totals& operator+=(const Totals& other);

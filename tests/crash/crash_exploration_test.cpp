@@ -22,8 +22,7 @@ public:
     void TearDown() override { std::printf("crash exploration totals: %s\n", describe(grandTotals).c_str()); }
 };
 
-const ::testing::Environment* const kPrintGrandTotals =
-    ::testing::AddGlobalTestEnvironment(new PrintGrandTotals);
+const ::testing::Environment* const kPrintGrandTotals = ::testing::AddGlobalTestEnvironment(new PrintGrandTotals);
 
 // Every sequence of three updates: each copy is rewritten at least once
 // more after holding a blob, and shorter sequences are their prefixes.

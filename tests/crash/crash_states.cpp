@@ -24,9 +24,7 @@ bool concernsFile(FsOpKind kind) {
 
 // Operations of one file keep their order in every mode; directories count
 // as files of their own.
-std::string orderKey(const FsOp& op) {
-    return concernsFile(op.kind) ? "f" + std::to_string(op.inode) : "d" + op.path;
-}
+std::string orderKey(const FsOp& op) { return concernsFile(op.kind) ? "f" + std::to_string(op.inode) : "d" + op.path; }
 
 // The name an operation makes appear, if any.
 const std::string* createdName(const FsOp& op) {
@@ -361,8 +359,8 @@ void applyOp(FsImage& image, const FsOp& op) {
     }
 }
 
-size_t forEachCrashState(const FsImage& durable, const std::vector<FsOp>& ops, size_t crashPoint,
-                         MetadataOrder order, const std::function<void(const FsImage&)>& visit) {
+size_t forEachCrashState(const FsImage& durable, const std::vector<FsOp>& ops, size_t crashPoint, MetadataOrder order,
+                         const std::function<void(const FsImage&)>& visit) {
     if (crashPoint > ops.size()) throw std::out_of_range("crash point past the record");
     return Enumeration(durable, ops, crashPoint, order, visit).run();
 }

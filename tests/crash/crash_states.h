@@ -46,7 +46,7 @@ void applyOp(FsImage& image, const FsOp& op);
 // entirely on disk before them. Returns the number of states visited; the
 // same state may come more than once. Throws when the states would number
 // more than a million.
-size_t forEachCrashState(const FsImage& durable, const std::vector<FsOp>& ops, size_t crashPoint,
-                         MetadataOrder order, const std::function<void(const FsImage&)>& visit);
+size_t forEachCrashState(const FsImage& durable, const std::vector<FsOp>& ops, size_t crashPoint, MetadataOrder order,
+                         const std::function<void(const FsImage&)>& visit);
 
 }  // namespace crash

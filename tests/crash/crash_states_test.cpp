@@ -61,8 +61,8 @@ std::set<std::string> statesAfter(const FsImage& durable, const std::vector<FsOp
         for (const auto& [name, inode] : image.names) {
             const FileNode& file = image.files.at(inode);
             if (!state.empty()) state += ' ';
-            state += name + '=' + std::string(file.data.begin(), file.data.end()) + '@' +
-                     std::to_string(file.mtime.tv_sec);
+            state +=
+                name + '=' + std::string(file.data.begin(), file.data.end()) + '@' + std::to_string(file.mtime.tv_sec);
         }
         states.insert(state);
     });
@@ -73,8 +73,8 @@ TEST(CrashStates, AFileRenamedIntoPlaceBeforeItsDataLandedIsEmpty) {
     const std::vector<FsOp> ops = {create("c.tmp", 10, 1), write("c.tmp", 10, 0, "12345678", 2),
                                    rename("c.tmp", "c", 10)};
     const std::set<std::string> states = statesAfter(FsImage{}, ops, ops.size());
-    EXPECT_EQ(states, (std::set<std::string>{"", "c.tmp=@1", "c.tmp=12345678@1", "c.tmp=@2", "c.tmp=12345678@2",
-                                             "c=@2", "c=12345678@2"}));
+    EXPECT_EQ(states, (std::set<std::string>{"", "c.tmp=@1", "c.tmp=12345678@1", "c.tmp=@2", "c.tmp=12345678@2", "c=@2",
+                                             "c=12345678@2"}));
 }
 
 TEST(CrashStates, NothingIsLeftToChanceAfterSyncfs) {
@@ -111,8 +111,8 @@ TEST(CrashStates, EachBlockLandsInAnyOfItsVersionsWithTheSizeThatCoversIt) {
 TEST(CrashStates, DataNeverLandsBeforeTheTruncationThatPrecedesIt) {
     const FsImage durable = withFile("f", 1, "AAAA", 1);
     const std::vector<FsOp> ops = {truncate("f", 1, 0, 2), write("f", 1, 0, "BB", 3)};
-    EXPECT_EQ(statesAfter(durable, ops, ops.size()), (std::set<std::string>{"f=AAAA@1", "f=@2", "f=BB@2", "f=@3",
-                                                                             "f=BB@3"}));
+    EXPECT_EQ(statesAfter(durable, ops, ops.size()),
+              (std::set<std::string>{"f=AAAA@1", "f=@2", "f=BB@2", "f=@3", "f=BB@3"}));
 }
 
 TEST(CrashStates, FsyncPutsOneFileOnDisk) {

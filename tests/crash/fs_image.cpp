@@ -66,9 +66,8 @@ std::string fingerprint(const FsImage& image) {
     for (const auto& [name, inode] : image.names) {
         const FileNode& file = image.files.at(inode);
         const std::string_view data(reinterpret_cast<const char*>(file.data.data()), file.data.size());
-        text += "f " + name + ' ' + std::to_string(file.mtime.tv_sec) + '.' + std::to_string(file.mtime.tv_nsec) +
-                ' ' + std::to_string(file.data.size()) + ' ' + std::to_string(std::hash<std::string_view>{}(data)) +
-                '\n';
+        text += "f " + name + ' ' + std::to_string(file.mtime.tv_sec) + '.' + std::to_string(file.mtime.tv_nsec) + ' ' +
+                std::to_string(file.data.size()) + ' ' + std::to_string(std::hash<std::string_view>{}(data)) + '\n';
     }
     return text;
 }

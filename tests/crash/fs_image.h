@@ -4,8 +4,8 @@
 // that renames and writes through open descriptors land on the right file.
 #pragma once
 
-#include <ctime>
 #include <cstdint>
+#include <ctime>
 #include <filesystem>
 #include <map>
 #include <set>

@@ -191,9 +191,7 @@ std::string formatTime(const struct timespec& time) {
            nanoseconds;
 }
 
-std::string formatHex(const std::vector<uint8_t>& bytes) {
-    return bytes.empty() ? "-" : testing_support::hex(bytes);
-}
+std::string formatHex(const std::vector<uint8_t>& bytes) { return bytes.empty() ? "-" : testing_support::hex(bytes); }
 
 }  // namespace
 

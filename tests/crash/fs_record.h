@@ -16,14 +16,14 @@ enum class FsOpKind { kCreate, kTruncate, kWrite, kUnlink, kRmdir, kMkdir, kRena
 // The fields a line of its kind carries; the others keep their defaults.
 struct FsOp {
     FsOpKind kind;
-    std::string path;              // unescaped; the source of a rename
-    std::string toPath;            // rename
-    uint64_t inode = 0;            // all but rmdir, mkdir, syncfs
-    uint64_t replacedInode = 0;    // rename: what toPath named before, 0 for nothing
-    int64_t offset = 0;            // write
-    uint64_t size = 0;             // truncate
-    std::vector<uint8_t> data;     // write
-    struct timespec mtime {};      // create, truncate, write, utimens
+    std::string path;            // unescaped; the source of a rename
+    std::string toPath;          // rename
+    uint64_t inode = 0;          // all but rmdir, mkdir, syncfs
+    uint64_t replacedInode = 0;  // rename: what toPath named before, 0 for nothing
+    int64_t offset = 0;          // write
+    uint64_t size = 0;           // truncate
+    std::vector<uint8_t> data;   // write
+    struct timespec mtime {};    // create, truncate, write, utimens
 };
 
 // Every line of `text`, which must end in a newline unless empty. Throws

@@ -114,7 +114,8 @@ std::vector<std::string> comparable(const std::vector<FsOp>& ops, const fs::path
                 lines.push_back("truncate " + path + " to " + std::to_string(op.size));
                 break;
             case FsOpKind::kWrite: {
-                const std::vector<uint8_t> head(op.data.begin(), op.data.begin() + std::min<size_t>(16, op.data.size()));
+                const std::vector<uint8_t> head(op.data.begin(),
+                                                op.data.begin() + std::min<size_t>(16, op.data.size()));
                 lines.push_back("write " + path + " at " + std::to_string(op.offset) + ": " +
                                 std::to_string(op.data.size()) + " bytes " + testing_support::hex(head) + "...");
                 break;
@@ -221,7 +222,8 @@ protected:
 
         EXPECT_EQ(recorded.exitStatus, 0) << recorded.out << recorded.err;
         EXPECT_EQ(straced.exitStatus, 0) << straced.out << straced.err;
-        EXPECT_EQ(replaced(recorded.out, shimRoot.string(), "ROOT"), replaced(straced.out, straceRoot.string(), "ROOT"));
+        EXPECT_EQ(replaced(recorded.out, shimRoot.string(), "ROOT"),
+                  replaced(straced.out, straceRoot.string(), "ROOT"));
         EXPECT_EQ(recorded.err, straced.err);
         EXPECT_EQ(snapshot(shimRoot), snapshot(straceRoot));
 
@@ -251,7 +253,8 @@ std::vector<std::string> tool(const fs::path& root, std::vector<std::string> arg
 
 std::vector<std::string> driver(const fs::path& root, const std::vector<std::string>& steps) {
     std::vector<std::string> argv = {DUAL_FILE_DRIVER, (root / "store").string(), "1", "0"};
-    for (const std::string& step : steps) argv.push_back(step.rfind("@", 0) == 0 ? (root / step.substr(1)).string() : step);
+    for (const std::string& step : steps)
+        argv.push_back(step.rfind("@", 0) == 0 ? (root / step.substr(1)).string() : step);
     return argv;
 }
 

@@ -164,9 +164,9 @@ std::string iovecBytes(const std::string& arg) {
 // The mtime of utimensat's "[atime, mtime]"; UTIME_NOW and UTIME_OMIT
 // leave a time that is not in the trace.
 struct timespec modificationTime(const std::string& times) {
-    const std::vector<std::string> both =
-        times.size() > 2 && times.front() == '[' ? splitTopLevel(times.substr(1, times.size() - 2))
-                                                 : std::vector<std::string>{};
+    const std::vector<std::string> both = times.size() > 2 && times.front() == '['
+                                              ? splitTopLevel(times.substr(1, times.size() - 2))
+                                              : std::vector<std::string>{};
     if (both.size() != 2 || both[1].rfind("{tv_sec=", 0) != 0) throw LineError("no explicit mtime: " + times);
     const size_t comma = both[1].find(", tv_nsec=");
     const size_t close = both[1].find('}');
@@ -432,7 +432,8 @@ std::string followingProblem(const Call& call, const Named& named, const std::st
     }
     if (call.name == "openat2") {
         // Any number of components, none of them followed if a link.
-        return hasFlag(field(call.args.at(2), "resolve"), "RESOLVE_NO_SYMLINKS") ? "" : "opens without RESOLVE_NO_SYMLINKS";
+        return hasFlag(field(call.args.at(2), "resolve"), "RESOLVE_NO_SYMLINKS") ? ""
+                                                                                 : "opens without RESOLVE_NO_SYMLINKS";
     }
     if (name.find('/') != std::string::npos) return "names more than one component below a directory";
     if (opens && !hasFlag(flags, "O_NOFOLLOW")) return "opens without O_NOFOLLOW";

@@ -38,8 +38,7 @@ extern const std::vector<std::string> kStraceOptions;
 // for what it cannot follow below `root`: strings strace cut short, a
 // write through a descriptor whose position is unknown (a duplicate or an
 // inherited one) or opened with O_APPEND, a utimensat to the current time.
-std::vector<FsOp> parseStraceTrace(const std::string& trace, const std::string& root,
-                                   std::set<std::string> existing);
+std::vector<FsOp> parseStraceTrace(const std::string& trace, const std::string& root, std::set<std::string> existing);
 
 // The calls in `trace` (failed ones included) that name an entry below
 // `root` (absolute, without a final '/') in a way that could follow a link

@@ -37,58 +37,47 @@ const std::string kCwd = fd("AT_FDCWD", "/r");
 TEST(StraceTrace, FollowsTheCallsBelowTheRoot) {
     const std::string trace =
         "10 openat(" + kCwd + ", " + str("/r/new") + ", O_RDWR|O_CREAT|O_TRUNC|O_CLOEXEC, 0666) = 3" +
-        fd("", "/r/new") + "\n" +
-        "10 write(" + fd("3", "/r/new") + ", " + str("hello") + ", 5) = 5\n" +
-        "10 write(" + fd("3", "/r/new") + ", " + str("abc") + ", 3) = 2\n" +
-        "10 lseek(" + fd("3", "/r/new") + ", 1, SEEK_SET) = 1\n" +
-        "10 read(" + fd("3", "/r/new") + ", " + str("el") + ", 2) = 2\n" +
-        "10 writev(" + fd("3", "/r/new") + ", [{iov_base=" + str("xy") + ", iov_len=2}, {iov_base=" + str("z") +
-        ", iov_len=1}], 2) = 3\n" +
-        "10 pwrite64(" + fd("3", "/r/new") + ", " + str("P") + ", 1, 40) = 1\n" +
+        fd("", "/r/new") + "\n" + "10 write(" + fd("3", "/r/new") + ", " + str("hello") + ", 5) = 5\n" + "10 write(" +
+        fd("3", "/r/new") + ", " + str("abc") + ", 3) = 2\n" + "10 lseek(" + fd("3", "/r/new") +
+        ", 1, SEEK_SET) = 1\n" + "10 read(" + fd("3", "/r/new") + ", " + str("el") + ", 2) = 2\n" + "10 writev(" +
+        fd("3", "/r/new") + ", [{iov_base=" + str("xy") + ", iov_len=2}, {iov_base=" + str("z") +
+        ", iov_len=1}], 2) = 3\n" + "10 pwrite64(" + fd("3", "/r/new") + ", " + str("P") + ", 1, 40) = 1\n" +
         "10 pwritev(" + fd("3", "/r/new") + ", [{iov_base=" + str("Q") + ", iov_len=1}], 1, 50) = 1\n" +
-        "10 ftruncate(" + fd("3", "/r/new") + ", 7) = 0\n" +
-        "10 fdatasync(" + fd("3", "/r/new") + ") = 0\n" +
+        "10 ftruncate(" + fd("3", "/r/new") + ", 7) = 0\n" + "10 fdatasync(" + fd("3", "/r/new") + ") = 0\n" +
         // Another process starts a call that ends later.
-        "11 openat(" + kCwd + ", " + str("old") + ", O_WRONLY|O_TRUNC <unfinished ...>\n" +
-        "10 openat(" + kCwd + ", " + str("/r/new") + ", O_WRONLY|O_CREAT|O_CLOEXEC, 0666) = 4" + fd("", "/r/new") +
-        "\n" +
-        "11 <... openat resumed>) = 5" + fd("", "/r/old") + "\n" +
-        "10 write(" + fd("1", "/elsewhere/log") + ", " + str("x") + ", 1) = 1\n" +
-        "10 unlink(" + str("/r/missing") + ") = -1 ENOENT (No such file or directory)\n" +
-        "10 mkdirat(" + fd("7", "/r") + ", " + str("d") + ", 0777) = 0\n" +
-        "10 rename(" + str("/r/d") + ", " + str("/r/e") + ") = 0\n" +
-        "10 openat(" + kCwd + ", " + str("/r/e/f") + ", O_WRONLY|O_CREAT, 0666) = 6" + fd("", "/r/e/f") + "\n" +
-        "10 renameat2(" + kCwd + ", " + str("/r/e/f") + ", " + kCwd + ", " + str("/r/old") +
-        ", RENAME_NOREPLACE) = 0\n" +
-        "10 utimensat(" + kCwd + ", " + str("/r/old") + ", [UTIME_OMIT, {tv_sec=4102444802, tv_nsec=7} /* " +
-        "2100-01-01T00:00:02.000000007+0000 */], 0) = 0\n" +
-        "10 utimensat(" + kCwd + ", " + str("/elsewhere") + ", NULL, 0) = 0\n" +
-        "10 unlinkat(" + kCwd + ", " + str("e") + ", AT_REMOVEDIR) = 0\n" +
-        "10 unlinkat(" + fd("7", "/r") + ", " + str("new") + ", 0) = 0\n" +
-        "10 fchmodat(" + fd("7", "/r") + ", " + str("old") + ", 0644) = 0\n" +
-        "10 syncfs(" + fd("8", "/elsewhere") + ") = 0\n" +
-        "10 --- SIGCHLD {si_signo=SIGCHLD} ---\n";
-    EXPECT_EQ(described(parseStraceTrace(trace, "/r", {"/r", "/r/old"})),
-              (std::vector<std::string>{
-                  "create /r/new 0 0.000000000",
-                  "write /r/new 0 0 68656c6c6f 0.000000000",
-                  "write /r/new 0 5 6162 0.000000000",
-                  "write /r/new 0 3 78797a 0.000000000",
-                  "write /r/new 0 40 50 0.000000000",
-                  "write /r/new 0 50 51 0.000000000",
-                  "truncate /r/new 0 7 0.000000000",
-                  "fsync /r/new 0",
-                  "truncate /r/old 0 0 0.000000000",
-                  "mkdir /r/d",
-                  "rename /r/d /r/e 0 0",
-                  "create /r/e/f 0 0.000000000",
-                  "rename /r/e/f /r/old 0 0",
-                  "utimens /r/old 0 4102444802.000000007",
-                  "rmdir /r/e",
-                  "unlink /r/new 0",
-                  "chmod /r/old 0",
-                  "syncfs",
-              }));
+        "11 openat(" + kCwd + ", " + str("old") + ", O_WRONLY|O_TRUNC <unfinished ...>\n" + "10 openat(" + kCwd + ", " +
+        str("/r/new") + ", O_WRONLY|O_CREAT|O_CLOEXEC, 0666) = 4" + fd("", "/r/new") + "\n" +
+        "11 <... openat resumed>) = 5" + fd("", "/r/old") + "\n" + "10 write(" + fd("1", "/elsewhere/log") + ", " +
+        str("x") + ", 1) = 1\n" + "10 unlink(" + str("/r/missing") + ") = -1 ENOENT (No such file or directory)\n" +
+        "10 mkdirat(" + fd("7", "/r") + ", " + str("d") + ", 0777) = 0\n" + "10 rename(" + str("/r/d") + ", " +
+        str("/r/e") + ") = 0\n" + "10 openat(" + kCwd + ", " + str("/r/e/f") + ", O_WRONLY|O_CREAT, 0666) = 6" +
+        fd("", "/r/e/f") + "\n" + "10 renameat2(" + kCwd + ", " + str("/r/e/f") + ", " + kCwd + ", " + str("/r/old") +
+        ", RENAME_NOREPLACE) = 0\n" + "10 utimensat(" + kCwd + ", " + str("/r/old") +
+        ", [UTIME_OMIT, {tv_sec=4102444802, tv_nsec=7} /* " + "2100-01-01T00:00:02.000000007+0000 */], 0) = 0\n" +
+        "10 utimensat(" + kCwd + ", " + str("/elsewhere") + ", NULL, 0) = 0\n" + "10 unlinkat(" + kCwd + ", " +
+        str("e") + ", AT_REMOVEDIR) = 0\n" + "10 unlinkat(" + fd("7", "/r") + ", " + str("new") + ", 0) = 0\n" +
+        "10 fchmodat(" + fd("7", "/r") + ", " + str("old") + ", 0644) = 0\n" + "10 syncfs(" + fd("8", "/elsewhere") +
+        ") = 0\n" + "10 --- SIGCHLD {si_signo=SIGCHLD} ---\n";
+    EXPECT_EQ(described(parseStraceTrace(trace, "/r", {"/r", "/r/old"})), (std::vector<std::string>{
+                                                                              "create /r/new 0 0.000000000",
+                                                                              "write /r/new 0 0 68656c6c6f 0.000000000",
+                                                                              "write /r/new 0 5 6162 0.000000000",
+                                                                              "write /r/new 0 3 78797a 0.000000000",
+                                                                              "write /r/new 0 40 50 0.000000000",
+                                                                              "write /r/new 0 50 51 0.000000000",
+                                                                              "truncate /r/new 0 7 0.000000000",
+                                                                              "fsync /r/new 0",
+                                                                              "truncate /r/old 0 0 0.000000000",
+                                                                              "mkdir /r/d",
+                                                                              "rename /r/d /r/e 0 0",
+                                                                              "create /r/e/f 0 0.000000000",
+                                                                              "rename /r/e/f /r/old 0 0",
+                                                                              "utimens /r/old 0 4102444802.000000007",
+                                                                              "rmdir /r/e",
+                                                                              "unlink /r/new 0",
+                                                                              "chmod /r/old 0",
+                                                                              "syncfs",
+                                                                          }));
 }
 
 TEST(StraceTrace, RejectsWhatItCannotFollowNamingTheLine) {
@@ -140,20 +129,17 @@ std::vector<std::string> following(const std::string& line) {
 // path.
 TEST(LinkFollowingCalls, TheStoresOwnCallsPass) {
     const std::string trace =
-        "10 mkdir(" + str("/r/s") + ", 0777) = 0\n" +
-        "10 openat(" + kCwd + ", " + str("/r/s") + ", O_RDONLY|O_CLOEXEC|O_DIRECTORY) = 4" + fd("", "/r/s") + "\n" +
-        "10 openat(" + fd("4", "/r/s") + ", " + str("1") + ", O_RDONLY|O_NOFOLLOW|O_CLOEXEC|O_DIRECTORY) = 5" +
-        fd("", "/r/s/1") + "\n" +
-        "10 mkdirat(" + fd("4", "/r/s") + ", " + str("2") + ", 0777) = 0\n" +
-        "10 openat(" + kStoreDir + ", " + str("data") + ", O_RDWR|O_CREAT|O_TRUNC|O_NOFOLLOW|O_CLOEXEC, 0666) = 6" +
-        fd("", "/r/s/1/data") + "\n" +
-        "10 unlinkat(" + kStoreDir + ", " + str("data.chk") + ", 0) = -1 ENOENT (No such file or directory)\n" +
-        "10 openat2(" + fd("4", "/r/s") + ", " + str("1/data.chk") +
+        "10 mkdir(" + str("/r/s") + ", 0777) = 0\n" + "10 openat(" + kCwd + ", " + str("/r/s") +
+        ", O_RDONLY|O_CLOEXEC|O_DIRECTORY) = 4" + fd("", "/r/s") + "\n" + "10 openat(" + fd("4", "/r/s") + ", " +
+        str("1") + ", O_RDONLY|O_NOFOLLOW|O_CLOEXEC|O_DIRECTORY) = 5" + fd("", "/r/s/1") + "\n" + "10 mkdirat(" +
+        fd("4", "/r/s") + ", " + str("2") + ", 0777) = 0\n" + "10 openat(" + kStoreDir + ", " + str("data") +
+        ", O_RDWR|O_CREAT|O_TRUNC|O_NOFOLLOW|O_CLOEXEC, 0666) = 6" + fd("", "/r/s/1/data") + "\n" + "10 unlinkat(" +
+        kStoreDir + ", " + str("data.chk") + ", 0) = -1 ENOENT (No such file or directory)\n" + "10 openat2(" +
+        fd("4", "/r/s") + ", " + str("1/data.chk") +
         ", {flags=O_RDONLY|O_NOFOLLOW|O_CLOEXEC, resolve=RESOLVE_NO_SYMLINKS|RESOLVE_BENEATH}, 24) = 9" +
-        fd("", "/r/s/1/data.chk") + "\n" +
-        "10 utimensat(" + fd("7", "/r/s/1/data.chk.tmp") + ", NULL, [UTIME_OMIT, {tv_sec=5, tv_nsec=0}], 0) = 0\n" +
-        "10 renameat(" + kStoreDir + ", " + str("data.chk.tmp") + ", " + kStoreDir + ", " + str("data.chk") +
-        ") = 0\n" +
+        fd("", "/r/s/1/data.chk") + "\n" + "10 utimensat(" + fd("7", "/r/s/1/data.chk.tmp") +
+        ", NULL, [UTIME_OMIT, {tv_sec=5, tv_nsec=0}], 0) = 0\n" + "10 renameat(" + kStoreDir + ", " +
+        str("data.chk.tmp") + ", " + kStoreDir + ", " + str("data.chk") + ") = 0\n" +
         // Outside the stores anything goes.
         "10 openat(" + kCwd + ", " + str("/r/input") + ", O_RDONLY) = 8" + fd("", "/r/input") + "\n";
     EXPECT_EQ(crash::linkFollowingCalls(trace, "/r/s"), std::vector<std::string>{});

@@ -1,15 +1,15 @@
 #include "simulated_device.h"
 
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <unistd.h>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
-#include <fcntl.h>
 #include <fstream>
-#include <linux/fs.h>
 #include <sstream>
 #include <stdexcept>
-#include <sys/ioctl.h>
-#include <unistd.h>
 
 #include "files.h"
 
@@ -186,9 +186,12 @@ MountState mountState(const std::string& mountPoint) {
 
 const char* toString(MountState state) {
     switch (state) {
-        case MountState::kNotMounted: return "not mounted";
-        case MountState::kReadOnly: return "read-only";
-        case MountState::kReadWrite: return "read-write";
+        case MountState::kNotMounted:
+            return "not mounted";
+        case MountState::kReadOnly:
+            return "read-only";
+        case MountState::kReadWrite:
+            return "read-write";
     }
     return "?";
 }

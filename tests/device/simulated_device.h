@@ -36,10 +36,9 @@ inline constexpr const char* kResourcesMarkerText = "simulated resource partitio
 bool onSimulatedDevice();
 
 // Ends the current test (or SetUp) as skipped when not on the device.
-#define SKIP_UNLESS_ON_SIMULATED_DEVICE()                                                  \
-    do {                                                                                   \
-        if (!::simulated_device::onSimulatedDevice())                                      \
-            GTEST_SKIP() << ::simulated_device::kNotOnDeviceReason;                        \
+#define SKIP_UNLESS_ON_SIMULATED_DEVICE()                                                                     \
+    do {                                                                                                      \
+        if (!::simulated_device::onSimulatedDevice()) GTEST_SKIP() << ::simulated_device::kNotOnDeviceReason; \
     } while (0)
 
 // "normal", "low", "badrecord", "norecord" or "nofree".

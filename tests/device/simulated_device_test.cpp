@@ -3,20 +3,20 @@
 // of their own from outside and check what is left afterwards.
 #include "simulated_device.h"
 
-#include <atomic>
-#include <cerrno>
-#include <chrono>
-#include <csignal>
-#include <cstdlib>
 #include <fcntl.h>
-#include <fstream>
 #include <linux/fs.h>
 #include <spawn.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
-#include <thread>
 #include <unistd.h>
+#include <atomic>
+#include <cerrno>
+#include <chrono>
+#include <csignal>
+#include <cstdlib>
+#include <fstream>
+#include <thread>
 
 #include <gtest/gtest.h>
 
@@ -41,9 +41,7 @@ constexpr uint64_t kLowestBootVectorSector = 6291456;
 // Inside the third partition in every variant and used by nothing.
 constexpr uint64_t kUnusedOffset = 300ull * 1024 * 1024;
 
-uint64_t firstNumber(const std::string& text) {
-    return std::strtoull(text.c_str(), nullptr, 10);
-}
+uint64_t firstNumber(const std::string& text) { return std::strtoull(text.c_str(), nullptr, 10); }
 
 dev_t deviceNumber(const std::string& path) {
     struct stat st {};
@@ -104,7 +102,8 @@ TEST_F(SimulatedDevice, LastFreeAreaIsWhereTheRunnerPutIt) {
 
 TEST_F(SimulatedDevice, RecordSectorHoldsWhatWasWritten) {
     if (variantIs({"nofree"})) GTEST_SKIP() << "no free area, no record";
-    const Bytes onDisk = simulated_device::readDeviceBytes(simulated_device::kDisk, simulated_device::bootVectorOffset(), 20);
+    const Bytes onDisk =
+        simulated_device::readDeviceBytes(simulated_device::kDisk, simulated_device::bootVectorOffset(), 20);
     EXPECT_EQ(onDisk, simulated_device::readImageBytes(simulated_device::bootVectorOffset(), 20));
     if (variantIs({"norecord"})) {
         EXPECT_EQ(simulated_device::writtenBootVectorRecord(), Bytes{});
@@ -138,7 +137,9 @@ TEST_F(SimulatedDevice, PartitionNodesCoverTheirRangesOfTheDisk) {
     const Bytes resources = simulated_device::readDeviceBytes(simulated_device::kResourcePartition, 1024, 136);
     EXPECT_EQ(ext4Label(boot), "boot");
     EXPECT_EQ(ext4Label(resources), "resources");
-    EXPECT_EQ(simulated_device::readDeviceBytes(simulated_device::kDisk, simulated_device::bootPartitionOffset() + 1024, 136), boot);
+    EXPECT_EQ(
+        simulated_device::readDeviceBytes(simulated_device::kDisk, simulated_device::bootPartitionOffset() + 1024, 136),
+        boot);
     EXPECT_EQ(simulated_device::readImageBytes(simulated_device::resourcesPartitionOffset() + 1024, 136), resources);
     EXPECT_EQ(simulated_device::bootPartitionSize(), 64u * 1024 * 1024);
     EXPECT_EQ(simulated_device::resourcesPartitionSize(), 128u * 1024 * 1024);
@@ -158,7 +159,8 @@ TEST_F(SimulatedDevice, ImageAndDiskSeeEachOthersWrites) {
     EXPECT_EQ(simulated_device::readImageBytes(kUnusedOffset, second.size()), second);
 
     simulated_device::writeImageBytes(kUnusedOffset, Bytes(first.size(), 0));
-    EXPECT_EQ(simulated_device::readDeviceBytes(simulated_device::kDisk, kUnusedOffset, first.size()), Bytes(first.size(), 0));
+    EXPECT_EQ(simulated_device::readDeviceBytes(simulated_device::kDisk, kUnusedOffset, first.size()),
+              Bytes(first.size(), 0));
 }
 
 TEST_F(SimulatedDevice, BootPartitionIsMountedReadOnlyWithTheBootFiles) {
@@ -208,7 +210,8 @@ TEST_F(SimulatedDevice, ResourcePartitionUnmountsAndMountsThroughFstab) {
 
     const ProcessResult up = runShell("mount /media/resources");
     ASSERT_EQ(up.exitStatus, 0) << up.err;
-    const std::optional<simulated_device::MountEntry> resources = simulated_device::findMount(simulated_device::kResourcesMount);
+    const std::optional<simulated_device::MountEntry> resources =
+        simulated_device::findMount(simulated_device::kResourcesMount);
     ASSERT_TRUE(resources.has_value());
     EXPECT_EQ(resources->source, simulated_device::kResourcePartition);
     EXPECT_EQ(resources->type, "ext4");
@@ -358,12 +361,9 @@ protected:
         env_ = {{"TMPDIR", tmp_.path().string()}, {"REQUIRE_SIMULATED_DEVICE", ""}};
     }
 
-    void TearDown() override {
-        EXPECT_EQ(loopsBackedUnder(tmp_.path()), std::vector<std::string>{});
-    }
+    void TearDown() override { EXPECT_EQ(loopsBackedUnder(tmp_.path()), std::vector<std::string>{}); }
 
-    ProcessResult run(const std::vector<std::string>& args,
-                      const std::map<std::string, std::string>& extraEnv = {}) {
+    ProcessResult run(const std::vector<std::string>& args, const std::map<std::string, std::string>& extraEnv = {}) {
         std::vector<std::string> argv{"/bin/bash", simulated_device::runnerPath().string()};
         argv.insert(argv.end(), args.begin(), args.end());
         std::map<std::string, std::string> env = env_;
@@ -381,7 +381,8 @@ protected:
         std::vector<std::string> envStrings;
         for (char** entry = environ; *entry != nullptr; ++entry) {
             const std::string text = *entry;
-            if (text.rfind("TMPDIR=", 0) != 0 && text.rfind("REQUIRE_SIMULATED_DEVICE=", 0) != 0) envStrings.push_back(text);
+            if (text.rfind("TMPDIR=", 0) != 0 && text.rfind("REQUIRE_SIMULATED_DEVICE=", 0) != 0)
+                envStrings.push_back(text);
         }
         envStrings.push_back("TMPDIR=" + tmp_.path().string());
         std::vector<char*> envPointers;
@@ -394,10 +395,13 @@ protected:
 
     // A command that names its run directory in `ready`, then waits for `go`.
     std::vector<std::string> waitingCommand(const fs::path& ready, const fs::path& go) {
-        return {"--", "/bin/sh", "-c",
+        return {"--",
+                "/bin/sh",
+                "-c",
                 "echo \"$SIMULATED_DEVICE_DIR\" > \"$0.tmp\" && mv \"$0.tmp\" \"$0\"; "
                 "while [ ! -e \"$1\" ]; do sleep 0.05; done",
-                ready.string(), go.string()};
+                ready.string(),
+                go.string()};
     }
 
     testing_support::ScratchDir tmp_;
@@ -453,7 +457,8 @@ TEST_F(SimulatedDeviceLifecycle, NothingIsVisibleOutsideWhileItRuns) {
         EXPECT_EQ(testing_support::readText("/etc/fstab"), fstabBefore);
         EXPECT_EQ(fs::exists(simulated_device::kDisk), diskExistedOutside);
         for (const simulated_device::MountEntry& entry : simulated_device::readMounts()) {
-            EXPECT_EQ(entry.source.rfind("/dev/mmcblk0", 0), std::string::npos) << entry.source << " " << entry.mountPoint;
+            EXPECT_EQ(entry.source.rfind("/dev/mmcblk0", 0), std::string::npos)
+                << entry.source << " " << entry.mountPoint;
             EXPECT_NE(entry.source, "simulated-dev");
             EXPECT_NE(entry.source, "simulated-media");
         }
@@ -530,11 +535,11 @@ TEST_F(SimulatedDeviceLifecycle, BootFilesAndRecordCanBeChosen) {
     testing_support::writeText(boot, "chosen BOOT.BIN\n");
     testing_support::writeText(boot0010, "chosen BOOT0010.BIN\n");
     const Bytes record = simulated_device::makeBootVectorRecord(0x00000102, 42);
-    const ProcessResult result = run(
-        {"--boot-bin", boot.string(), "--boot0010-bin", boot0010.string(), "--record", testing_support::hex(record), "--",
-         "/bin/sh", "-c",
-         "cat /media/boot/BOOT.BIN /media/boot/BOOT0010.BIN; echo \"$SIMULATED_DEVICE_BOOT_VECTOR_RECORD\"; "
-         "dd if=/dev/mmcblk0 bs=512 skip=30703616 count=1 status=none | head -c 20 | od -An -tx1 | tr -d ' \\n'"});
+    const ProcessResult result =
+        run({"--boot-bin", boot.string(), "--boot0010-bin", boot0010.string(), "--record", testing_support::hex(record),
+             "--", "/bin/sh", "-c",
+             "cat /media/boot/BOOT.BIN /media/boot/BOOT0010.BIN; echo \"$SIMULATED_DEVICE_BOOT_VECTOR_RECORD\"; "
+             "dd if=/dev/mmcblk0 bs=512 skip=30703616 count=1 status=none | head -c 20 | od -An -tx1 | tr -d ' \\n'"});
     EXPECT_EQ(result.exitStatus, 0) << result.err;
     EXPECT_EQ(result.out, "chosen BOOT.BIN\nchosen BOOT0010.BIN\n" + testing_support::hex(record) + "\n" +
                               testing_support::hex(record));
@@ -576,8 +581,8 @@ TEST_F(SimulatedDeviceLifecycle, NonRootSkipsUnlessTheDeviceIsRequired) {
     fs::copy_file(simulated_device::runnerPath(), runner);
     fs::permissions(copy.path(), fs::perms::owner_all | fs::perms::group_read | fs::perms::group_exec |
                                      fs::perms::others_read | fs::perms::others_exec);
-    fs::permissions(runner, fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read |
-                                fs::perms::others_read);
+    fs::permissions(runner,
+                    fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read | fs::perms::others_read);
     std::vector<std::string> canRead = dropRoot;
     canRead.insert(canRead.end(), {"/usr/bin/test", "-r", runner.string()});
     if (runProgram(canRead).exitStatus != 0) {

@@ -99,9 +99,8 @@ INSTANTIATE_TEST_SUITE_P(
         Refused{"SizeOverflows",
                 {"settings", "FILE", "99999999999999999999999"},
                 "settings length must be 4 to 65535, not 99999999999999999999999"},
-        Refused{"OverlayTooLarge",
-                {"overlay", "FILE", "67108865"},
-                "overlay payload must be 0 to 67108864, not 67108865"}),
+        Refused{
+            "OverlayTooLarge", {"overlay", "FILE", "67108865"}, "overlay payload must be 0 to 67108864, not 67108865"}),
     [](const ::testing::TestParamInfo<Refused>& info) { return std::string(info.param.name); });
 
 TEST_F(MakeExampleData, UnwritableFileIsNamedWithTheReason) {
@@ -116,8 +115,8 @@ TEST_F(MakeExampleData, UnwritableFileIsNamedWithTheReason) {
 // close; a block larger than the buffer fails at the write.
 TEST_F(MakeExampleData, FailedWritesAreNamedWithTheReason) {
     if (!fs::exists("/dev/full")) GTEST_SKIP() << "needs /dev/full";
-    for (const std::vector<std::string>& args : {std::vector<std::string>{"settings", "/dev/full", "4"},
-                                                 std::vector<std::string>{"lut", "/dev/full"}}) {
+    for (const std::vector<std::string>& args :
+         {std::vector<std::string>{"settings", "/dev/full", "4"}, std::vector<std::string>{"lut", "/dev/full"}}) {
         const ProcessResult result = generate(args);
         EXPECT_EQ(result.exitStatus, 1) << args[0];
         EXPECT_EQ(result.out, "") << args[0];
@@ -130,18 +129,17 @@ TEST_F(MakeExampleData, HelpSaysWhatSizeMeansForEachKind) {
         const ProcessResult result = generate({option});
         EXPECT_EQ(result.exitStatus, 0) << option;
         EXPECT_EQ(result.err, "") << option;
-        EXPECT_EQ(result.out,
-                  kUsage +
-                      "\n"
-                      "Writes a valid example migration data file for migrate_settings.\n"
-                      "\n"
-                      "  settings FILE [SIZE]  settings block declaring SIZE bytes (4 to 65535, default\n"
-                      "                        4096), padded with 0xFF to a multiple of 4 bytes\n"
-                      "  lut FILE              lookup table of 19784 bytes; takes no SIZE\n"
-                      "  overlay FILE [SIZE]   overlay: 284-byte header, then SIZE payload bytes\n"
-                      "                        (0 to 67108864, default 1024)\n"
-                      "\n"
-                      "SIZE is decimal, 0x-prefixed hex or 0-prefixed octal.\n")
+        EXPECT_EQ(result.out, kUsage +
+                                  "\n"
+                                  "Writes a valid example migration data file for migrate_settings.\n"
+                                  "\n"
+                                  "  settings FILE [SIZE]  settings block declaring SIZE bytes (4 to 65535, default\n"
+                                  "                        4096), padded with 0xFF to a multiple of 4 bytes\n"
+                                  "  lut FILE              lookup table of 19784 bytes; takes no SIZE\n"
+                                  "  overlay FILE [SIZE]   overlay: 284-byte header, then SIZE payload bytes\n"
+                                  "                        (0 to 67108864, default 1024)\n"
+                                  "\n"
+                                  "SIZE is decimal, 0x-prefixed hex or 0-prefixed octal.\n")
             << option;
     }
 }

@@ -102,8 +102,8 @@ TEST_F(BootVectorFailureFilter, AnySourceLineNumberIsAccepted) {
 TEST_F(BootVectorFailureFilter, EveryKnownComplaintIsRemovedAndOnlyIt) {
     for (const std::string& complaint : kSfdiskComplaints) {
         SCOPED_TRACE(complaint);
-        const ProcessResult filtered = withoutBootVectorFailure(
-            result(kFailureLine, "before\n" + complaint + "\nafter\n"), Host::kWithoutDevice);
+        const ProcessResult filtered =
+            withoutBootVectorFailure(result(kFailureLine, "before\n" + complaint + "\nafter\n"), Host::kWithoutDevice);
         EXPECT_EQ(filtered.err, "before\nafter\n");
     }
 }
@@ -111,8 +111,7 @@ TEST_F(BootVectorFailureFilter, EveryKnownComplaintIsRemovedAndOnlyIt) {
 TEST_F(BootVectorFailureFilter, WithoutDeviceAMissingLineFails) {
     EXPECT_NONFATAL_FAILURE(withoutBootVectorFailure(result(lines, kComplaint), Host::kWithoutDevice),
                             "found it 0 times");
-    EXPECT_NONFATAL_FAILURE(withoutBootVectorFailure(result("", kComplaint), Host::kWithoutDevice),
-                            "found it 0 times");
+    EXPECT_NONFATAL_FAILURE(withoutBootVectorFailure(result("", kComplaint), Host::kWithoutDevice), "found it 0 times");
 }
 
 TEST_F(BootVectorFailureFilter, WithoutDeviceALineTwiceFails) {
@@ -215,9 +214,9 @@ TEST_F(MigrateSettingsWithoutDevice, StoresWorkAndTheBootVectorFailureIsLoggedOn
     EXPECT_EQ(migrated.exitStatus, 0);
     ASSERT_EQ(migrated.out, kFailureLine);
     // sfdisk's own words, or the shell's when sfdisk is not installed.
-    EXPECT_TRUE(std::any_of(kSfdiskComplaints.begin(), kSfdiskComplaints.end(),
-                            [&](const std::string& complaint) { return migrated.err == complaint + "\n"; }))
-        << migrated.err;
+    EXPECT_TRUE(std::any_of(kSfdiskComplaints.begin(), kSfdiskComplaints.end(), [&](const std::string& complaint) {
+        return migrated.err == complaint + "\n";
+    })) << migrated.err;
     expectOnlySettings(Bytes(block.begin(), block.begin() + 24));
     const std::string failure = kFailureLine;
 

@@ -134,8 +134,8 @@ const std::vector<std::string> kValidQuery = {"--target", "settings", "--query-p
 using MigrateSettingsHelp = CliRun;
 
 TEST_F(MigrateSettingsHelp, PrintsTheUsageAndExitsZero) {
-    for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
-             {"-h"}, {"--help"}, {"-vh"}, {"pos", "-h"}}) {
+    for (const std::vector<std::string>& args :
+         std::vector<std::vector<std::string>>{{"-h"}, {"--help"}, {"-vh"}, {"pos", "-h"}}) {
         SCOPED_TRACE(describe(args));
         const ProcessResult result = runUnparsed(args);
         EXPECT_EQ(result.exitStatus, 0);
@@ -222,9 +222,8 @@ TEST_F(MigrateSettingsRequired, CompleteMigrationLinesAreAccepted) {
 TEST_F(MigrateSettingsRequired, EqualsFormsAndTheLastBaseWin) {
     const fs::path x = scratch / "x";
     const fs::path y = scratch / "y";
-    const ProcessResult result =
-        runAccepted({"--target=settings", "--type=checked", "--data=" + a, "--if-not-present", "--base=" + x.string(),
-                 "-b", y.string(), "-i", "0", "--check=settings"});
+    const ProcessResult result = runAccepted({"--target=settings", "--type=checked", "--data=" + a, "--if-not-present",
+                                              "--base=" + x.string(), "-b", y.string(), "-i", "0", "--check=settings"});
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(result.out, "");
     EXPECT_EQ(result.err, "");
@@ -404,8 +403,8 @@ TEST_F(MigrateSettingsIndex, RejectedFormsPrintOnlyTheUsage) {
 using MigrateSettingsLevel = CliRun;
 
 TEST_F(MigrateSettingsLevel, VerboseOrDebugListsTheStores) {
-    for (const std::vector<std::string>& levels : std::vector<std::vector<std::string>>{
-             {"--verbose"}, {"-v"}, {"--debug"}, {"--debug", "--verbose"}}) {
+    for (const std::vector<std::string>& levels :
+         std::vector<std::vector<std::string>>{{"--verbose"}, {"-v"}, {"--debug"}, {"--debug", "--verbose"}}) {
         SCOPED_TRACE(describe(levels));
         const ProcessResult result = run(concat(kValidQuery, levels));
         EXPECT_EQ(result.exitStatus, 10);

@@ -2,11 +2,11 @@
 // program has planted links, FIFOs, sockets, device nodes and directories:
 // no run writes outside the base directory or waits, and each one either
 // stores the blob or fails.
+#include <sys/stat.h>
 #include <csignal>
 #include <filesystem>
 #include <iterator>
 #include <string>
-#include <sys/stat.h>
 #include <tuple>
 #include <vector>
 
@@ -100,9 +100,9 @@ TEST_F(HostileStores, FifoInOneStoreNeverHoldsUpARun) {
     const ProcessResult into = run({"--target", "application_internal", "--type", "simple", "--data", blob});
     expectFinished(into);
     EXPECT_EQ(into.exitStatus, 1);
-    EXPECT_NE(into.out.find("Failed to open " + (base / "app/internal/2/data").string() +
-                            ": No such device or address\n"),
-              std::string::npos)
+    EXPECT_NE(
+        into.out.find("Failed to open " + (base / "app/internal/2/data").string() + ": No such device or address\n"),
+        std::string::npos)
         << into.out;
     EXPECT_EQ(outside(), before);
 }
@@ -178,7 +178,7 @@ TEST_P(HostileStoreSweep, MigrationsStayInsideTheBaseAndNeverWait) {
 
 std::string caseName(const ::testing::TestParamInfo<HostileStoreSweep::ParamType>& info) {
     return std::string(kPlaces[std::get<0>(info.param)].name) + "_" +
-                       testing_support::plantName(std::get<1>(info.param));
+           testing_support::plantName(std::get<1>(info.param));
 }
 
 INSTANTIATE_TEST_SUITE_P(Planted, HostileStoreSweep,

@@ -145,8 +145,8 @@ TEST_F(MigrateSettingsExitStatus, IndexAboveTheSlotCountIsOne) {
         SCOPED_TRACE(std::string(c.target) + " " + c.index);
         const std::string outOfRange = std::string("index is out of range of available slots ") + c.count + "\n";
         // The missing data file is never looked at: the range test comes first.
-        const std::vector<std::string> migration = {"--target", c.target, "--index", c.index, "--type", "simple",
-                                                    "--data", inScratch("absent")};
+        const std::vector<std::string> migration = {"--target", c.target, "--index", c.index,
+                                                    "--type",   "simple", "--data",  inScratch("absent")};
         const std::vector<std::string> query = {"--target", c.target, "--index", c.index, "--query-present"};
         expectOutcome(run(concat(migration, {"--verbose"})), 1, registerLines(base) + outOfRange);
         expectOutcome(run(concat(query, {"--verbose"})), 1, registerLines(base) + outOfRange);
@@ -195,8 +195,8 @@ TEST_F(MigrateSettingsExitStatus, QueryOfAnAbsentBlobIsTenAndIfNotPresentMigrate
     expectOutcome(run({"--target", "settings", "--query-present"}), 10, "");
 
     const Bytes block = settingsBlock(8, 8);
-    expectSilentSuccess(run({"--target", "settings", "--if-not-present", "--type", "checked", "--data",
-                             dataFile("block", block)}));
+    expectSilentSuccess(
+        run({"--target", "settings", "--if-not-present", "--type", "checked", "--data", dataFile("block", block)}));
     EXPECT_EQ(storedFiles(base), (Files{"settings/1/data.chk", "settings/2/data", "settings/2/data.chk"}));
     EXPECT_EQ(readBytes(base / "settings/1/data.chk"), Bytes(8, 0xFF));
     EXPECT_EQ(readBytes(base / "settings/2/data"), block);
@@ -216,17 +216,17 @@ TEST_F(MigrateSettingsExitStatus, QueryAtAnIndexEqualToTheCountIsTen) {
 }
 
 TEST_F(MigrateSettingsExitStatus, QueryNeverReadsTheDataFiles) {
-    expectOutcome(run({"--target", "settings", "--query-present", "--type", "redundant", "--data",
-                       inScratch("absent1"), "--data2", inScratch("absent2")}),
+    expectOutcome(run({"--target", "settings", "--query-present", "--type", "redundant", "--data", inScratch("absent1"),
+                       "--data2", inScratch("absent2")}),
                   10, "");
     expectNothingStored();
 }
 
 TEST_F(MigrateSettingsExitStatus, QueryDecidesWhenBothFlagsAreGiven) {
     const std::string data = dataFile("block", settingsBlock(16, 16));
-    expectOutcome(run({"--target", "settings", "--if-not-present", "--query-present", "--type", "checked", "--data",
-                       data}),
-                  10, "");
+    expectOutcome(
+        run({"--target", "settings", "--if-not-present", "--query-present", "--type", "checked", "--data", data}), 10,
+        "");
     expectNothingStored();
 }
 
@@ -235,8 +235,7 @@ TEST_F(MigrateSettingsExitStatus, IfNotPresentOnAPresentSlotIsZeroWithoutReading
     expectSilentSuccess(run({"--target", "settings", "--type", "checked", "--data", dataFile("first", first)}));
 
     // A warning: printed at the default level.
-    expectOutcome(run({"--target", "settings", "--if-not-present", "--type", "simple", "--data",
-                       inScratch("absent")}),
+    expectOutcome(run({"--target", "settings", "--if-not-present", "--type", "simple", "--data", inScratch("absent")}),
                   0, "No update required\n");
     expectOutcome(run({"--target", "settings", "--if-not-present", "--type", "checked", "--data",
                        dataFile("second", settingsBlock(20, 20, 9)), "--verbose"}),
@@ -301,9 +300,9 @@ TEST_F(MigrateSettingsExitStatus, RejectedDataIsOneAndNothingIsWritten) {
         SCOPED_TRACE(c.check);
         const std::string data = dataFile("data", c.data);
         expectOutcome(run({"--target", c.target, "--type", "checked", "--check", c.check, "--data", data}), 1, "");
-        expectOutcome(run({"--target", c.target, "--type", "redundant", "--check", c.check, "--data", data,
-                           "--data2", data}),
-                      1, "");
+        expectOutcome(
+            run({"--target", c.target, "--type", "redundant", "--check", c.check, "--data", data, "--data2", data}), 1,
+            "");
     }
     expectNothingStored();
 }
@@ -325,10 +324,8 @@ TEST_F(MigrateSettingsExitStatus, NoSlotAtAnIndexEqualToTheCountIsOneAndWritesNo
         {"util_save", "1", "settings", settings},
     };
     for (const Case& c : cases) {
-        for (const std::vector<std::string>& typeArgs :
-             std::vector<std::vector<std::string>>{{"--type", "simple"},
-                                                   {"--type", "checked"},
-                                                   {"--type", "redundant", "--data2", c.data}}) {
+        for (const std::vector<std::string>& typeArgs : std::vector<std::vector<std::string>>{
+                 {"--type", "simple"}, {"--type", "checked"}, {"--type", "redundant", "--data2", c.data}}) {
             SCOPED_TRACE(std::string(c.target) + e2e::describe(typeArgs));
             const std::vector<std::string> args =
                 concat({"--target", c.target, "--index", c.count, "--check", c.check, "--data", c.data}, typeArgs);
@@ -365,8 +362,7 @@ TEST_F(MigrateSettingsExitStatus, FailedWriteOfTheDataFileIsOne) {
     const std::string data = dataFile("block", Bytes{1, 2, 3, 4, 5});
     const ProcessResult result = run({"--target", "calib_save", "--type", "simple", "--data", data});
     EXPECT_EQ(result.exitStatus, 1);
-    const std::string message =
-        " Failed to open " + (base / "app/calibSave/2/data").string() + ": Is a directory\n";
+    const std::string message = " Failed to open " + (base / "app/calibSave/2/data").string() + ": Is a directory\n";
     EXPECT_EQ(result.out.rfind("libcommon/lib/util/fd:", 0), 0u) << result.out;
     ASSERT_GE(result.out.size(), message.size());
     EXPECT_EQ(result.out.substr(result.out.size() - message.size()), message);
@@ -447,9 +443,9 @@ TEST_F(MigrateSettingsLogLevel, DefaultLevelShowsWarningsAndErrorsOnly) {
     const std::string data = dataFile("lut", newer);
     expectOutcome(run({"--target", "lut", "--index", "17", "--type", "checked", "--check", "lut", "--data", data}), 1,
                   "Unable to parse LUT header at index 17\n");
-    expectOutcome(run({"--target", "lut", "--index", "17", "--type", "checked", "--check", "lut", "--data", data,
-                       "--verbose"}),
-                  1, registerLines(base) + "Unable to parse LUT header at index 17\n");
+    expectOutcome(
+        run({"--target", "lut", "--index", "17", "--type", "checked", "--check", "lut", "--data", data, "--verbose"}),
+        1, registerLines(base) + "Unable to parse LUT header at index 17\n");
     expectNothingStored();
 }
 
@@ -490,9 +486,9 @@ TEST_F(MigrateSettingsPlacement, BaseOptionPlacesTheStores) {
     expectSilentSuccess(e2e::runAccepted(
         {"--base", x.string(), "--target", "settings", "--type", "checked", "--data", dataFile("s", settings)}));
     expectSilentSuccess(e2e::runAccepted({"--target", "lut", "--type", "checked", "--check", "lut", "--index", "3",
-                                      "--data", dataFile("l", lut), "-b", x.string()}));
-    EXPECT_EQ(storedFiles(x), (Files{"app/luts/3/2/data", "app/luts/3/2/data.chk", "settings/2/data",
-                                     "settings/2/data.chk"}));
+                                          "--data", dataFile("l", lut), "-b", x.string()}));
+    EXPECT_EQ(storedFiles(x),
+              (Files{"app/luts/3/2/data", "app/luts/3/2/data.chk", "settings/2/data", "settings/2/data.chk"}));
     EXPECT_EQ(readBytes(x / "settings/2/data"), settings);
     EXPECT_EQ(readBytes(x / "app/luts/3/2/data"), lut);
     EXPECT_TRUE(fs::is_directory(x / "app/luts/25/1"));
@@ -510,8 +506,8 @@ TEST_F(MigrateSettingsPlacement, LutIndicesZeroToTwentyFiveAreRealSlots) {
         const std::string slot = std::to_string(index);
         expectOutcome(run({"--target", "lut", "--index", slot, "--query-present"}), 10, "");
         const std::string data = dataFile("lut", lutFile(19784, static_cast<uint8_t>(index)));
-        expectSilentSuccess(run({"--target", "lut", "--index", slot, "--type", "checked", "--check", "lut", "--data",
-                                 data}));
+        expectSilentSuccess(
+            run({"--target", "lut", "--index", slot, "--type", "checked", "--check", "lut", "--data", data}));
         expectSilentSuccess(run({"--target", "lut", "--index", slot, "--query-present"}));
         expected.push_back("app/luts/" + slot + "/2/data");
         expected.push_back("app/luts/" + slot + "/2/data.chk");
@@ -560,9 +556,9 @@ TEST_F(MigrateSettingsPlacement, HexadecimalIndexOnTheLutTarget) {
     const Bytes lut = lutFile(19784);
     const std::string data = dataFile("lut", lut);
     // 0x1f is 31, beyond the 26 slots.
-    expectOutcome(run({"--target", "lut", "--index", "0x1f", "--type", "checked", "--check", "lut", "--data", data,
-                       "--verbose"}),
-                  1, registerLines(base) + "index is out of range of available slots 26\n");
+    expectOutcome(
+        run({"--target", "lut", "--index", "0x1f", "--type", "checked", "--check", "lut", "--data", data, "--verbose"}),
+        1, registerLines(base) + "index is out of range of available slots 26\n");
     expectNothingStored();
     expectSilentSuccess(
         run({"--target", "lut", "--index", "0x19", "--type", "checked", "--check", "lut", "--data", data}));
@@ -599,10 +595,10 @@ TEST_F(MigrateSettingsStoredBytes, LutAndOverlayStoreTheWholeFile) {
     const Bytes lut = lutFile(20001);
     // Bytes after the payload are kept too.
     const Bytes overlay = overlayFile(100, 284 + 100 + 13);
-    expectSilentSuccess(run({"--target", "lut", "--index", "9", "--type", "checked", "--check", "lut", "--data",
-                             dataFile("lut", lut)}));
-    expectSilentSuccess(run({"--target", "overlay", "--index", "2", "--type", "checked", "--check", "overlay",
-                             "--data", dataFile("overlay", overlay)}));
+    expectSilentSuccess(run(
+        {"--target", "lut", "--index", "9", "--type", "checked", "--check", "lut", "--data", dataFile("lut", lut)}));
+    expectSilentSuccess(run({"--target", "overlay", "--index", "2", "--type", "checked", "--check", "overlay", "--data",
+                             dataFile("overlay", overlay)}));
     EXPECT_EQ(storedFiles(base), (Files{"app/luts/9/2/data", "app/luts/9/2/data.chk", "app/overlays/2/2/data",
                                         "app/overlays/2/2/data.chk"}));
     EXPECT_EQ(readBytes(base / "app/luts/9/2/data"), lut);
@@ -613,8 +609,8 @@ TEST_F(MigrateSettingsStoredBytes, LutAndOverlayStoreTheWholeFile) {
 
 TEST_F(MigrateSettingsStoredBytes, SimpleStoresTheFileUncheckedEvenWithACheckGiven) {
     const Bytes odd = {0x80, 0x11, 0x03, 0x00, 0x42, 0x43, 0x44};
-    expectSilentSuccess(run({"--target", "calib_extra", "--type", "simple", "--check", "lut", "--data",
-                             dataFile("odd", odd)}));
+    expectSilentSuccess(
+        run({"--target", "calib_extra", "--type", "simple", "--check", "lut", "--data", dataFile("odd", odd)}));
     expectOnlyCopy("app/calibExtra", "2", odd);
 }
 
@@ -672,8 +668,8 @@ TEST_F(MigrateSettingsRedundant, BadFirstBlockStoresTheSecond) {
 TEST_F(MigrateSettingsRedundant, GoodFirstBlockWinsWithoutComparison) {
     const Bytes first = overlayFile(3, 290, 1);
     const Bytes second = overlayFile(9, 300, 2);
-    expectSilentSuccess(run({"--target", "overlay", "--index", "7", "--type", "redundant", "--check", "overlay",
-                             "-m", dataFile("first", first), "-n", dataFile("second", second)}));
+    expectSilentSuccess(run({"--target", "overlay", "--index", "7", "--type", "redundant", "--check", "overlay", "-m",
+                             dataFile("first", first), "-n", dataFile("second", second)}));
     expectOnlyCopy("app/overlays/7", "2", first);
 }
 
@@ -752,15 +748,15 @@ std::vector<CheckRow> checkRows() {
         {"SettingsDeclaredZero", "settings", "0", "settings", Bytes{0, 0, 0, 0}, 1, "", "", 0},
         {"SettingsBadChecksum", "settings", "0", "settings", withByte(settings64, 62, settings64[62] ^ 1), 1, "", "",
          0},
-        {"SettingsChangedContents", "settings", "0", "settings", withByte(settings64, 20, settings64[20] ^ 0x80), 1,
-         "", "", 0},
+        {"SettingsChangedContents", "settings", "0", "settings", withByte(settings64, 20, settings64[20] ^ 0x80), 1, "",
+         "", 0},
         {"LutOneByteShort", "lut", "5", "lut", lutFile(19783), 1, "", "", 0},
         {"LutExactMinimum", "lut", "5", "lut", lut, 0, "", "app/luts/5", 19784},
         {"LutFirstWordZero", "lut", "5", "lut", withByte(withByte(withByte(lut, 0, 0), 1, 0), 2, 0), 1, "", "", 0},
         {"LutVersionThree", "lut", "5", "lut", withByte(lut, 2, 3), 1, "Unable to parse LUT header at index 5\n", "",
          0},
-        {"LutVersionHighByte", "lut", "0", "lut", withByte(lut, 3, 1), 1, "Unable to parse LUT header at index 0\n",
-         "", 0},
+        {"LutVersionHighByte", "lut", "0", "lut", withByte(lut, 3, 1), 1, "Unable to parse LUT header at index 0\n", "",
+         0},
         {"LutWrongTypeByte", "lut", "5", "lut", withByte(lut, 0, 0x00), 1, "", "", 0},
         {"LutWrongSecondByte", "lut", "5", "lut", withByte(lut, 1, 0x12), 1, "", "", 0},
         {"LutThreeBytes", "lut", "5", "lut", Bytes{0x80, 0x11, 0x02}, 1, "", "", 0},
@@ -813,10 +809,10 @@ TEST_F(MigrateSettingsExampleData, GeneratedFilesMigrate) {
     ASSERT_EQ(settings.size(), 4096u);
 
     expectSilentSuccess(run({"--target", "settings", "--type", "checked", "--data", inScratch("settings.bin")}));
-    expectSilentSuccess(run({"--target", "lut", "--index", "25", "--type", "checked", "--check", "lut", "--data",
-                             inScratch("lut.bin")}));
-    expectSilentSuccess(run({"--target", "overlay", "--index", "1", "--type", "checked", "--check", "overlay",
-                             "--data", inScratch("overlay.bin")}));
+    expectSilentSuccess(run(
+        {"--target", "lut", "--index", "25", "--type", "checked", "--check", "lut", "--data", inScratch("lut.bin")}));
+    expectSilentSuccess(run({"--target", "overlay", "--index", "1", "--type", "checked", "--check", "overlay", "--data",
+                             inScratch("overlay.bin")}));
     EXPECT_EQ(readBytes(base / "settings/2/data"), head(settings, 4093));
     EXPECT_EQ(readBytes(base / "app/luts/25/2/data"), lut);
     EXPECT_EQ(readBytes(base / "app/overlays/1/2/data"), overlay);

@@ -98,8 +98,7 @@ ProcessResult withoutBootVectorFailure(ProcessResult result, Host host) {
     const auto complaint = std::find_if(errLines.begin(), errLines.end(), isSfdiskComplaint);
     const std::ptrdiff_t complaints = std::count_if(errLines.begin(), errLines.end(), isSfdiskComplaint);
     if (complaints != 1) {
-        ADD_FAILURE() << "expected one complaint about /dev/mmcblk0 on standard error, found " << complaints
-                      << " in:\n"
+        ADD_FAILURE() << "expected one complaint about /dev/mmcblk0 on standard error, found " << complaints << " in:\n"
                       << result.err;
         return result;
     }

@@ -30,8 +30,7 @@ Environment faultEnv(const std::string& call, unsigned long nth, const std::stri
                      const std::string& pathSubstr = "", const std::string& countFile = "");
 
 // Only counts the calls matching `call` into `countFile` (absolute).
-Environment faultCountEnv(const std::string& call, const std::string& countFile,
-                          const std::string& pathSubstr = "");
+Environment faultCountEnv(const std::string& call, const std::string& countFile, const std::string& pathSubstr = "");
 
 // Adds recording to `base` (preloadEnv(), faultEnv(...), ...): every
 // successful mutating call on a path containing `pathSubstr` (any path when

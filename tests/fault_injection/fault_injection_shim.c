@@ -159,21 +159,16 @@ struct Function {
 };
 
 static const struct Function kFunctions[] = {
-    {"open", FAMILY_OPEN},         {"openat", FAMILY_OPEN},       {"openat2", FAMILY_OPEN},
-    {"creat", FAMILY_OPEN},        {"fopen", FAMILY_OPEN},
-    {"write", FAMILY_WRITE},       {"writev", FAMILY_WRITE},
-    {"pwrite", FAMILY_PWRITE},     {"pwritev", FAMILY_PWRITE},
-    {"sendfile", FAMILY_COPY},     {"copy_file_range", FAMILY_COPY},
-    {"rename", FAMILY_RENAME},     {"renameat", FAMILY_RENAME},
-    {"renameat2", FAMILY_RENAME},  {"unlink", FAMILY_UNLINK},
-    {"unlinkat", FAMILY_UNLINK},   {"remove", FAMILY_UNLINK},
-    {"rmdir", FAMILY_UNLINK},      {"ftruncate", FAMILY_TRUNCATE},
-    {"truncate", FAMILY_TRUNCATE}, {"utimensat", FAMILY_UTIMENS},
-    {"futimens", FAMILY_UTIMENS},  {"syncfs", FAMILY_SYNC},
-    {"fsync", FAMILY_SYNC},        {"fdatasync", FAMILY_SYNC},
-    {"mkdir", FAMILY_MKDIR},       {"mkdirat", FAMILY_MKDIR},
-    {"chmod", FAMILY_CHMOD},       {"fchmod", FAMILY_CHMOD},
-    {"fchmodat", FAMILY_CHMOD},
+    {"open", FAMILY_OPEN},          {"openat", FAMILY_OPEN},          {"openat2", FAMILY_OPEN},
+    {"creat", FAMILY_OPEN},         {"fopen", FAMILY_OPEN},           {"write", FAMILY_WRITE},
+    {"writev", FAMILY_WRITE},       {"pwrite", FAMILY_PWRITE},        {"pwritev", FAMILY_PWRITE},
+    {"sendfile", FAMILY_COPY},      {"copy_file_range", FAMILY_COPY}, {"rename", FAMILY_RENAME},
+    {"renameat", FAMILY_RENAME},    {"renameat2", FAMILY_RENAME},     {"unlink", FAMILY_UNLINK},
+    {"unlinkat", FAMILY_UNLINK},    {"remove", FAMILY_UNLINK},        {"rmdir", FAMILY_UNLINK},
+    {"ftruncate", FAMILY_TRUNCATE}, {"truncate", FAMILY_TRUNCATE},    {"utimensat", FAMILY_UTIMENS},
+    {"futimens", FAMILY_UTIMENS},   {"syncfs", FAMILY_SYNC},          {"fsync", FAMILY_SYNC},
+    {"fdatasync", FAMILY_SYNC},     {"mkdir", FAMILY_MKDIR},          {"mkdirat", FAMILY_MKDIR},
+    {"chmod", FAMILY_CHMOD},        {"fchmod", FAMILY_CHMOD},         {"fchmodat", FAMILY_CHMOD},
 };
 
 struct ErrnoName {
@@ -568,13 +563,9 @@ static int openMutates(int flags) {
     return (flags & (O_WRONLY | O_RDWR | O_CREAT | O_TRUNC)) != 0 || (flags & O_TMPFILE) == O_TMPFILE;
 }
 
-static int openNeedsMode(int flags) {
-    return (flags & O_CREAT) != 0 || (flags & O_TMPFILE) == O_TMPFILE;
-}
+static int openNeedsMode(int flags) { return (flags & O_CREAT) != 0 || (flags & O_TMPFILE) == O_TMPFILE; }
 
-static size_t shortened(size_t count) {
-    return count < config.shortLength ? count : config.shortLength;
-}
+static size_t shortened(size_t count) { return count < config.shortLength ? count : config.shortLength; }
 
 /* ---- recording and the fake clock ---- */
 
@@ -589,9 +580,9 @@ __attribute__((noreturn)) static void recordFailed(const char* problem) {
  * NULL target passes any path filter. Keeps errno. */
 static int watching(const struct Target* target) {
     const int saved = errno;
-    const int watched = enabled() && (config.hasRecord || config.hasClock) &&
-                        (target == NULL || (!namesCoverageCounts(target) &&
-                                            (!config.hasPathSubstr || targetMatches(target))));
+    const int watched =
+        enabled() && (config.hasRecord || config.hasClock) &&
+        (target == NULL || (!namesCoverageCounts(target) && (!config.hasPathSubstr || targetMatches(target))));
     errno = saved;
     return watched;
 }
@@ -666,9 +657,7 @@ static int changedRegularFile(const struct Target* target, struct stat* status) 
 
 /* An open that can create or truncate: whether to look at it after the
  * call, and whether its name existed before. */
-static int openChanges(int flags) {
-    return (flags & (O_CREAT | O_TRUNC)) != 0 && (flags & O_TMPFILE) != O_TMPFILE;
-}
+static int openChanges(int flags) { return (flags & (O_CREAT | O_TRUNC)) != 0 && (flags & O_TMPFILE) != O_TMPFILE; }
 
 static int watchOpen(const struct Target* target, int flags, int* existed) {
     if (!openChanges(flags) || !watching(target)) return 0;
@@ -730,8 +719,7 @@ static void afterWrite(int fd, off_t offset, const struct iovec* buffers, int bu
     if (changedRegularFile(&written, &status) && config.hasRecord) {
         char name[NAME_CAPACITY];
         nameOf(&written, name);
-        recordWrite(name, &status, writtenAt(fd, offset, (size_t)done, &status), buffers, bufferCount, (size_t)done,
-                    1);
+        recordWrite(name, &status, writtenAt(fd, offset, (size_t)done, &status), buffers, bufferCount, (size_t)done, 1);
     }
     errno = saved;
 }

@@ -36,9 +36,9 @@ struct ScriptStep {
 };
 
 const std::vector<ScriptStep> kScript = {
-    {"mkdir", "0", true},     {"create", "0", true},    {"write", "11", true},     {"pwrite", "2", true},
-    {"ftruncate", "0", true}, {"fsync", "0", true},     {"open-read", "0", false}, {"syncfs", "0", true},
-    {"utimensat", "0", true}, {"rename", "0", true},    {"unlink", "0", true},     {"fopen", "0", true},
+    {"mkdir", "0", true},     {"create", "0", true}, {"write", "11", true},     {"pwrite", "2", true},
+    {"ftruncate", "0", true}, {"fsync", "0", true},  {"open-read", "0", false}, {"syncfs", "0", true},
+    {"utimensat", "0", true}, {"rename", "0", true}, {"unlink", "0", true},     {"fopen", "0", true},
     {"remove", "0", true},
 };
 
@@ -131,9 +131,9 @@ void prepareScriptDir(const fs::path& dir) {
 // The steps of "fault_probe library"; owner of each mutating call in turn.
 const std::vector<std::string> kLibrarySteps = {"create_directory", "copy_file", "last_write_time", "resize_file",
                                                 "rename",           "remove",    "remove_all"};
-const std::vector<std::string> kLibraryMutatingCallOwners = {
-    "create_directory", "copy_file", "copy_file", "copy_file", "last_write_time",
-    "resize_file",      "rename",    "remove",    "remove_all"};
+const std::vector<std::string> kLibraryMutatingCallOwners = {"create_directory", "copy_file",       "copy_file",
+                                                             "copy_file",        "last_write_time", "resize_file",
+                                                             "rename",           "remove",          "remove_all"};
 
 std::string libraryOutput(const std::string& failing = "", int error = 0) {
     std::string out;
@@ -188,9 +188,9 @@ struct FaultRow {
     unsigned long nth;
     const char* action;
     const char* pathSubstr;
-    const char* step;    // the step that sees the fault; "" for none
-    const char* result;  // what that step prints
-    unsigned long count; // matching calls in the whole run
+    const char* step;     // the step that sees the fault; "" for none
+    const char* result;   // what that step prints
+    unsigned long count;  // matching calls in the whole run
 };
 
 TEST_P(FaultInjection, ActsOnExactlyTheNthMatchingCall) {
@@ -223,8 +223,8 @@ TEST_P(FaultInjection, ActsOnExactlyTheNthMatchingCall) {
         {"write", 1, "errno:EIO", "no-such-name", "", "", 0},
     };
     for (const FaultRow& row : rows) {
-        const std::string label = std::string(row.call) + " #" + std::to_string(row.nth) + " " + row.action + " [" +
-                                  row.pathSubstr + "]";
+        const std::string label =
+            std::string(row.call) + " #" + std::to_string(row.nth) + " " + row.action + " [" + row.pathSubstr + "]";
         ScratchDir dir;
         prepareScriptDir(dir.path());
         const ProcessResult result =
@@ -242,7 +242,7 @@ TEST_P(FaultInjection, ActsOnExactlyTheNthMatchingCall) {
 
 TEST_P(FaultInjection, CountsWithoutActing) {
     const std::vector<std::pair<const char*, unsigned long>> rows = {
-        {"mutating", 12}, {"open", 3}, {"openat", 0},   {"write", 1},  {"pwrite", 1}, {"truncate", 1},
+        {"mutating", 12}, {"open", 3},    {"openat", 0}, {"write", 1},  {"pwrite", 1}, {"truncate", 1},
         {"sync", 2},      {"utimens", 1}, {"rename", 1}, {"unlink", 2}, {"mkdir", 1},  {"copy", 0},
     };
     for (const auto& [call, expected] : rows) {
@@ -335,14 +335,14 @@ TEST_P(FaultInjection, BadSettingsEndTheProcessAtLoad) {
 // removal helpers reach the shim.
 TEST_P(FaultInjection, LibraryCallsAreCountedByFamily) {
     const std::vector<std::pair<const char*, unsigned long>> rows = {
-        {"mkdir", 1},   {"open", 3},   {"chmod", 1},  {"copy", 1},  {"utimens", 1}, {"truncate", 1},
-        {"rename", 1},  {"unlink", 2}, {"write", 0},  {"sync", 0},  {"mutating", 9},
+        {"mkdir", 1},  {"open", 3},   {"chmod", 1}, {"copy", 1}, {"utimens", 1},  {"truncate", 1},
+        {"rename", 1}, {"unlink", 2}, {"write", 0}, {"sync", 0}, {"mutating", 9},
     };
     for (const auto& [call, expected] : rows) {
         ScratchDir dir;
         writeText(dir / "source", "source\n");
-        const ProcessResult result = runProgram({GetParam(), "library", dir.path().string()},
-                                                faultCountEnv(call, countFile()));
+        const ProcessResult result =
+            runProgram({GetParam(), "library", dir.path().string()}, faultCountEnv(call, countFile()));
         EXPECT_EQ(result.exitStatus, 0) << call;
         EXPECT_EQ(result.out, libraryOutput()) << call;
         EXPECT_EQ(count(), expected) << call;

@@ -164,8 +164,7 @@ int runSpawn(const char* self, const std::string& dir) {
         return 1;
     }
     int status = 0;
-    while (waitpid(child, &status, 0) < 0) {
-    }
+    while (waitpid(child, &status, 0) < 0) {}
     std::printf("child exit %d\n", WIFEXITED(status) ? WEXITSTATUS(status) : -1);
     step("mkdir", [&] { return mkdir((dir + "/parent-made").c_str(), 0777); });
     return 0;

@@ -30,8 +30,7 @@ void dataSteps(const std::string& dir, int dirFd) {
     int subFd = -1;
     step("mkdir", [&] { return mkdir("sub", 0777); });
     openStep("open-sub", subFd, [&] { return open("sub", O_RDONLY | O_DIRECTORY | O_CLOEXEC); });
-    openStep("openat-create", fd,
-             [&] { return openat(subFd, "a.dat", O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0666); });
+    openStep("openat-create", fd, [&] { return openat(subFd, "a.dat", O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0666); });
     step("write", [&] { return static_cast<long>(write(fd, "hello", 5)); });
     step("writev", [&] {
         char ab[] = "ab";
@@ -96,8 +95,7 @@ void copySteps() {
         loff_t to = 100;
         return static_cast<long>(copy_file_range(in, &from, out, &to, 4, 0));
     });
-    openStep("create-write-only", writeOnly,
-             [&] { return open("copy2.dat", O_WRONLY | O_CREAT | O_CLOEXEC, 0666); });
+    openStep("create-write-only", writeOnly, [&] { return open("copy2.dat", O_WRONLY | O_CREAT | O_CLOEXEC, 0666); });
     step("sendfile-offset", [&] {
         off_t from = 2;
         return static_cast<long>(sendfile(writeOnly, in, &from, 5));

@@ -91,8 +91,8 @@ Lines splitFields(const std::string& line) {
 // made their files anew.
 Lines withoutInodes(Lines lines) {
     static const std::map<std::string, std::vector<size_t>> kInodeFields = {
-        {"create", {2}}, {"truncate", {2}}, {"write", {2}}, {"unlink", {2}},    {"utimens", {2}},
-        {"fsync", {2}},  {"chmod", {2}},    {"rename", {3, 4}}, {"mkdir", {}}, {"rmdir", {}}, {"syncfs", {}}};
+        {"create", {2}}, {"truncate", {2}},  {"write", {2}}, {"unlink", {2}}, {"utimens", {2}}, {"fsync", {2}},
+        {"chmod", {2}},  {"rename", {3, 4}}, {"mkdir", {}},  {"rmdir", {}},   {"syncfs", {}}};
     for (std::string& line : lines) {
         Lines fields = splitFields(line);
         for (const size_t i : kInodeFields.at(fields.at(0))) fields.at(i) = "#";
@@ -331,7 +331,9 @@ TEST_P(FaultRecording, CallsTheShimFailsOrCrashesOnAreNotRecorded) {
             EXPECT_EQ(result.signal, crash ? SIGKILL : 0) << nth << action;
             EXPECT_EQ(readFaultCount(countFile()), crash ? nth : full.size()) << nth << action;
             // A failed create leaves no target.dat for the calls after it.
-            const auto onTarget = [](const std::string& line) { return line.find("/target.dat ") != std::string::npos; };
+            const auto onTarget = [](const std::string& line) {
+                return line.find("/target.dat ") != std::string::npos;
+            };
             const bool createFailed = !crash && full[nth - 1].rfind("create ", 0) == 0 && onTarget(full[nth - 1]);
             Lines expected;
             for (size_t i = 0; i < full.size() && !(crash && i + 1 == nth); ++i) {

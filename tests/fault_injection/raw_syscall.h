@@ -39,6 +39,6 @@ static inline long rawSyscall6(long number, long a, long b, long c, long d, long
 }
 
 /* Up to six arguments, as for syscall(); missing ones are passed as 0. */
-#define RAW_SYSCALL_PICK(n, a, b, c, d, e, f, ...) rawSyscall6((long)(n), (long)(a), (long)(b), (long)(c), \
-                                                                (long)(d), (long)(e), (long)(f))
+#define RAW_SYSCALL_PICK(n, a, b, c, d, e, f, ...) \
+    rawSyscall6((long)(n), (long)(a), (long)(b), (long)(c), (long)(d), (long)(e), (long)(f))
 #define rawSyscall(...) RAW_SYSCALL_PICK(__VA_ARGS__, 0, 0, 0, 0, 0, 0, 0)

@@ -19,9 +19,8 @@ void checkRecord(const uint8_t* data, size_t size) {
 
     uint8_t headerSum = 0;
     for (size_t i = 0; i < 8; ++i) headerSum = static_cast<uint8_t>(headerSum + record[i]);
-    const bool expectedValid =
-        headerSum == record[8] &&
-        fuzz_support::referenceBsd16(record.get(), 18) == static_cast<uint16_t>(record[18] | record[19] << 8);
+    const bool expectedValid = headerSum == record[8] && fuzz_support::referenceBsd16(record.get(), 18) ==
+                                                             static_cast<uint16_t>(record[18] | record[19] << 8);
     FUZZ_CHECK(Storage::isValidBootVectorRecord(record.get()) == expectedValid);
 
     const uint32_t expectedValue = static_cast<uint32_t>(record[0]) << 24 | static_cast<uint32_t>(record[1]) << 16 |

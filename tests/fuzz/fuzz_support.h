@@ -9,12 +9,12 @@
 
 // abort() rather than a return value: libFuzzer and the replay driver both
 // treat the signal as a finding and keep the input.
-#define FUZZ_CHECK(condition)                                                           \
-    do {                                                                                \
-        if (!(condition)) {                                                             \
+#define FUZZ_CHECK(condition)                                                                      \
+    do {                                                                                           \
+        if (!(condition)) {                                                                        \
             std::fprintf(stderr, "%s:%d: invariant failed: %s\n", __FILE__, __LINE__, #condition); \
-            std::abort();                                                               \
-        }                                                                               \
+            std::abort();                                                                          \
+        }                                                                                          \
     } while (0)
 
 namespace fuzz_support {

@@ -63,8 +63,7 @@ void sleepUntilNs(int64_t deadline) {
     timespec until{};
     until.tv_sec = deadline / 1000000000;
     until.tv_nsec = deadline % 1000000000;
-    while (clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &until, nullptr) == EINTR) {
-    }
+    while (clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &until, nullptr) == EINTR) {}
 }
 
 struct RunOutcome {
@@ -87,8 +86,7 @@ RunOutcome runTool(const std::vector<std::string>& args, const fs::path& outputP
 
     posix_spawn_file_actions_t actions;
     posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_addopen(&actions, 1, outputPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC,
-                                     0644);
+    posix_spawn_file_actions_addopen(&actions, 1, outputPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
     posix_spawn_file_actions_adddup2(&actions, 1, 2);
 
     RunOutcome outcome;
@@ -105,8 +103,7 @@ RunOutcome runTool(const std::vector<std::string>& args, const fs::path& outputP
         kill(pid, SIGKILL);
     }
     int status = 0;
-    while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
-    }
+    while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {}
     outcome.durationNs = nowNs() - start;
     if (WIFEXITED(status)) {
         outcome.exitStatus = WEXITSTATUS(status);
@@ -153,8 +150,9 @@ std::string describeBlob(const std::optional<Bytes>& blob) {
     std::ostringstream text;
     text << blob->size() << " bytes";
     if (blob->size() >= 4) {
-        text << " tagged run " << (uint32_t{(*blob)[0]} | uint32_t{(*blob)[1]} << 8 | uint32_t{(*blob)[2]} << 16 |
-                                   uint32_t{(*blob)[3]} << 24);
+        text << " tagged run "
+             << (uint32_t{(*blob)[0]} | uint32_t{(*blob)[1]} << 8 | uint32_t{(*blob)[2]} << 16 |
+                 uint32_t{(*blob)[3]} << 24);
     }
     return text.str();
 }
@@ -192,9 +190,9 @@ TEST(MigrateSettingsSoak, KilledRunsLeaveTheOldOrTheNewBlob) {
         std::optional<int64_t> delay;
         if (run >= kTimedRuns && kill) delay = static_cast<int64_t>(typicalNs * fraction / 1000000);
 
-        const RunOutcome outcome = runTool(
-            {"--base", base.string(), "--target", "settings", "--type", "simple", "--data", blobPath.string()},
-            outputPath, delay);
+        const RunOutcome outcome =
+            runTool({"--base", base.string(), "--target", "settings", "--type", "simple", "--data", blobPath.string()},
+                    outputPath, delay);
         if (delay && !outcome.killed) ++late;
         if (!outcome.killed && outcome.exitStatus == 0) {
             recentDurations.push_back(outcome.durationNs);
@@ -217,13 +215,12 @@ TEST(MigrateSettingsSoak, KilledRunsLeaveTheOldOrTheNewBlob) {
                 ++killedOld;
             } else {
                 violation(run, "killed after " + std::to_string(*delay / 1000) + " us; store holds " +
-                                   describeBlob(stored) + ", expected " + describeBlob(acknowledged) +
-                                   " or " + describeBlob(blob));
+                                   describeBlob(stored) + ", expected " + describeBlob(acknowledged) + " or " +
+                                   describeBlob(blob));
             }
         } else if (outcome.exitStatus == 0) {
             if (stored != blob) {
-                violation(run, "exited 0; store holds " + describeBlob(stored) + ", expected " +
-                                   describeBlob(blob));
+                violation(run, "exited 0; store holds " + describeBlob(stored) + ", expected " + describeBlob(blob));
             }
             acknowledged = blob;
         } else {
@@ -242,8 +239,8 @@ TEST(MigrateSettingsSoak, KilledRunsLeaveTheOldOrTheNewBlob) {
 
     std::cout << "soak: " << runs << " runs, " << killed << " killed (" << killedOld << " old, " << killedNew
               << " new), " << violations << " violations" << std::endl;
-    std::cout << "soak: " << late << " kills came after the run had ended; typical run at the end "
-              << typicalNs / 1000 << " us" << std::endl;
+    std::cout << "soak: " << late << " kills came after the run had ended; typical run at the end " << typicalNs / 1000
+              << " us" << std::endl;
     EXPECT_EQ(violations, 0u);
     // A soak whose kills all came too late proved nothing about them.
     if (runs >= 100) {

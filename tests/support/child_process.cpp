@@ -1,12 +1,12 @@
 #include "child_process.h"
 
-#include <cstdio>
-#include <cstdlib>
 #include <fcntl.h>
-#include <sstream>
-#include <stdexcept>
 #include <sys/wait.h>
 #include <unistd.h>
+#include <cstdio>
+#include <cstdlib>
+#include <sstream>
+#include <stdexcept>
 
 #include "files.h"
 #include "scratch_dir.h"
@@ -35,8 +35,7 @@ ProcessResult runCaptured(const std::function<void()>& inChild) {
         _exit(127);
     }
     int status = 0;
-    while (waitpid(pid, &status, 0) < 0) {
-    }
+    while (waitpid(pid, &status, 0) < 0) {}
     ProcessResult result;
     if (WIFEXITED(status)) result.exitStatus = WEXITSTATUS(status);
     if (WIFSIGNALED(status)) result.signal = WTERMSIG(status);

@@ -27,8 +27,8 @@ const std::vector<std::string>& programEmulator();
 // Runs a program (argv[0] is its path) with extra environment variables,
 // through programEmulator(). With a time limit, a program still running
 // after that many seconds is ended by SIGALRM (result.signal).
-ProcessResult runProgram(const std::vector<std::string>& argv,
-                         const std::map<std::string, std::string>& extraEnv = {}, unsigned timeLimitSeconds = 0);
+ProcessResult runProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& extraEnv = {},
+                         unsigned timeLimitSeconds = 0);
 
 // Runs `command` with /bin/sh -c; the result as it came.
 ProcessResult runShell(const std::string& command);

@@ -1,8 +1,8 @@
 #include "fake_mount_commands.h"
 
+#include <unistd.h>
 #include <cstdlib>
 #include <stdexcept>
-#include <unistd.h>
 
 #include "files.h"
 #include "lib/util/log.h"

@@ -1,15 +1,15 @@
 #include "hostile_tree.h"
 
-#include <algorithm>
-#include <cerrno>
-#include <cstring>
 #include <fcntl.h>
-#include <stdexcept>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <sys/un.h>
 #include <unistd.h>
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <stdexcept>
 
 #include "files.h"
 
@@ -60,22 +60,30 @@ std::string entryLine(const fs::path& path, const std::string& relative) {
 }  // namespace
 
 const std::vector<Plant>& allPlants() {
-    static const std::vector<Plant> plants = {Plant::kLinkToFile, Plant::kLinkToDirectory, Plant::kDanglingLink,
-                                              Plant::kLinkLoop,   Plant::kFifo,            Plant::kSocket,
-                                              Plant::kDirectory,  Plant::kDeviceNode};
+    static const std::vector<Plant> plants = {
+        Plant::kLinkToFile, Plant::kLinkToDirectory, Plant::kDanglingLink, Plant::kLinkLoop,
+        Plant::kFifo,       Plant::kSocket,          Plant::kDirectory,    Plant::kDeviceNode};
     return plants;
 }
 
 std::string plantName(Plant plant) {
     switch (plant) {
-        case Plant::kLinkToFile: return "link_to_file";
-        case Plant::kLinkToDirectory: return "link_to_directory";
-        case Plant::kDanglingLink: return "dangling_link";
-        case Plant::kLinkLoop: return "link_loop";
-        case Plant::kFifo: return "fifo";
-        case Plant::kSocket: return "socket";
-        case Plant::kDirectory: return "directory";
-        case Plant::kDeviceNode: return "device_node";
+        case Plant::kLinkToFile:
+            return "link_to_file";
+        case Plant::kLinkToDirectory:
+            return "link_to_directory";
+        case Plant::kDanglingLink:
+            return "dangling_link";
+        case Plant::kLinkLoop:
+            return "link_loop";
+        case Plant::kFifo:
+            return "fifo";
+        case Plant::kSocket:
+            return "socket";
+        case Plant::kDirectory:
+            return "directory";
+        case Plant::kDeviceNode:
+            return "device_node";
     }
     return "unknown";
 }

@@ -1,8 +1,5 @@
 #include "without_openat2.h"
 
-#include <cerrno>
-#include <cstddef>
-#include <cstdint>
 #include <fcntl.h>
 #include <linux/audit.h>
 #include <linux/filter.h>
@@ -11,6 +8,9 @@
 #include <sys/prctl.h>
 #include <sys/syscall.h>
 #include <unistd.h>
+#include <cerrno>
+#include <cstddef>
+#include <cstdint>
 
 namespace testing_support {
 namespace {
@@ -47,7 +47,8 @@ bool withoutOpenat2() {
     program.len = sizeof filter / sizeof filter[0];
     program.filter = filter;
     // An emulator may refuse filters; it then usually lacks openat2 anyway.
-    (void)(::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0 && ::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program) == 0);
+    (void)(::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0 &&
+           ::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program) == 0);
     return !openat2Available();
 }
 

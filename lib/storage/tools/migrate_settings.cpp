@@ -1,10 +1,10 @@
 // migrate_settings: carries one block of settings data (or the first valid
 // of two) from a file into a slot of a storage target. The outcome is the
 // exit status; the reasons go to the log.
+#include <unistd.h>
 #include <cerrno>
 #include <filesystem>
 #include <string>
-#include <unistd.h>
 
 #include "lib/util/fd.h"
 #include "lib/util/log.h"

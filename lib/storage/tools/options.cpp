@@ -62,16 +62,25 @@ std::array<GetOptHelper::OptionSpec, kOptionCount> optionTable() {
         {kOptionTarget, "target", "", 1, "Target to assign result to", Kind::Choice, targetChoices(), nullptr},
         {kOptionCheck, "check", "settings", 1, "Check to apply in checked/redundant mode", Kind::Choice,
          choices(kCheckWords), nullptr},
-        {kOptionQueryPresent, "query-present", "", 0,
-         "Don't migrate, return success if target exists, failure otherwise.  For scripting.", Kind::Plain, {},
+        {kOptionQueryPresent,
+         "query-present",
+         "",
+         0,
+         "Don't migrate, return success if target exists, failure otherwise.  For scripting.",
+         Kind::Plain,
+         {},
          nullptr},
-        {kOptionIfNotPresent, "if-not-present", "", 0, "Only migrate if not already present", Kind::Plain, {},
-         nullptr},
+        {kOptionIfNotPresent, "if-not-present", "", 0, "Only migrate if not already present", Kind::Plain, {}, nullptr},
         {kOptionIndex, "index", "0", 1, "Slot index within target.", Kind::Plain, {}, nullptr},
         {kOptionData, "data", "", 1, "Path to file to read for migration data.", Kind::Plain, {}, nullptr},
-        {kOptionData2, "data2", "", 1,
+        {kOptionData2,
+         "data2",
+         "",
+         1,
          "Path to file to read for 2nd block of migration data.  Required for 'redundant' migration type.",
-         Kind::Plain, {}, nullptr},
+         Kind::Plain,
+         {},
+         nullptr},
         {kOptionVerbose, "verbose", "", 0, "Runs with extra logging.", Kind::Plain, {}, nullptr},
         {kOptionDebug, "debug", "", 0, "Runs with extra debug logging.", Kind::Plain, {}, nullptr},
         {kOptionHelp, "help", "", 0, "Print usage instructions.", Kind::Plain, {}, nullptr},
@@ -101,16 +110,33 @@ Options::~Options() = default;
 
 Status Options::handleOption(int id, const char* argument) {
     switch (id) {
-        case -1: return STATUS_OK;
-        case kOptionBase: basePath = argument; return STATUS_OK;
-        case kOptionHelp: printUsage(0);
-        case kOptionIndex: return parseSlotIndex(argument, slotIndex);
-        case kOptionData: dataPath = argument; return STATUS_OK;
-        case kOptionData2: data2Path = argument; return STATUS_OK;
-        case kOptionVerbose: verbose = true; return STATUS_OK;
-        case kOptionDebug: debug = true; return STATUS_OK;
-        case kOptionIfNotPresent: ifNotPresent = true; return STATUS_OK;
-        case kOptionQueryPresent: queryPresent = true; return STATUS_OK;
+        case -1:
+            return STATUS_OK;
+        case kOptionBase:
+            basePath = argument;
+            return STATUS_OK;
+        case kOptionHelp:
+            printUsage(0);
+        case kOptionIndex:
+            return parseSlotIndex(argument, slotIndex);
+        case kOptionData:
+            dataPath = argument;
+            return STATUS_OK;
+        case kOptionData2:
+            data2Path = argument;
+            return STATUS_OK;
+        case kOptionVerbose:
+            verbose = true;
+            return STATUS_OK;
+        case kOptionDebug:
+            debug = true;
+            return STATUS_OK;
+        case kOptionIfNotPresent:
+            ifNotPresent = true;
+            return STATUS_OK;
+        case kOptionQueryPresent:
+            queryPresent = true;
+            return STATUS_OK;
         default:
             // getopt_long has already explained '?' on standard error.
             std::printf("Unexpected option %d %c\n", id, id);
@@ -140,10 +166,18 @@ Status Options::handleChoice(int id, const char*, int value) {
 
 Status Options::invalidChoice(int id, const char* argument) {
     switch (id) {
-        case kOptionType: std::printf("Invalid migration type '%s'\n", argument); break;
-        case kOptionTarget: std::printf("Invalid target type '%s'\n", argument); break;
-        case kOptionCheck: std::printf("Invalid check type '%s'\n", argument); break;
-        default: std::printf("Invalid option %d\n", id); break;
+        case kOptionType:
+            std::printf("Invalid migration type '%s'\n", argument);
+            break;
+        case kOptionTarget:
+            std::printf("Invalid target type '%s'\n", argument);
+            break;
+        case kOptionCheck:
+            std::printf("Invalid check type '%s'\n", argument);
+            break;
+        default:
+            std::printf("Invalid option %d\n", id);
+            break;
     }
     return STATUS_INVALID_PARAMETER;
 }

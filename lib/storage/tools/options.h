@@ -11,9 +11,9 @@
 #include <cstdint>
 #include <string>
 
-#include "storage_target_id.h"
 #include "lib/util/env/get_opt_helper.h"
 #include "lib/util/status.h"
+#include "storage_target_id.h"
 
 // The values index tables elsewhere and are fixed.
 enum class MigrationType : uint32_t { simple = 0, checked = 1, redundant = 2 };

@@ -30,14 +30,23 @@ constexpr uint32_t kStorageTargetCount = kIpiStorageTargetFirmwareUpdateResource
 // null for targets that cannot be chosen there (and for unused values).
 constexpr const char* commandLineName(StorageTarget target) {
     switch (target) {
-        case kIpiStorageTargetSettings: return "settings";
-        case kIpiStorageTargetLUT: return "lut";
-        case kIpiStorageTargetOverlay: return "overlay";
-        case kIpiStorageTargetCalibSave: return "calib_save";
-        case kIpiStorageTargetCalibExtra: return "calib_extra";
-        case kIpiStorageTargetUtilSave: return "util_save";
-        case kIpiStorageTargetApplicationInternal: return "application_internal";
-        case kIpiStorageTargetRebootPersistent: return "reboot_persistent";
-        default: return nullptr;
+        case kIpiStorageTargetSettings:
+            return "settings";
+        case kIpiStorageTargetLUT:
+            return "lut";
+        case kIpiStorageTargetOverlay:
+            return "overlay";
+        case kIpiStorageTargetCalibSave:
+            return "calib_save";
+        case kIpiStorageTargetCalibExtra:
+            return "calib_extra";
+        case kIpiStorageTargetUtilSave:
+            return "util_save";
+        case kIpiStorageTargetApplicationInternal:
+            return "application_internal";
+        case kIpiStorageTargetRebootPersistent:
+            return "reboot_persistent";
+        default:
+            return nullptr;
     }
 }

@@ -43,26 +43,40 @@ constexpr PartitionRow kPartitionRows[] = {
 
 const char* storageTargetName(StorageTarget id) {
     switch (id) {
-        case kIpiStorageTargetLUT: return "kIpiStorageTargetLUT";
-        case kIpiStorageTargetOverlay: return "kIpiStorageTargetOverlay";
-        case kIpiStorageTargetCalibSave: return "kIpiStorageTargetCalibSave";
-        case kIpiStorageTargetCalibExtra: return "kIpiStorageTargetCalibExtra";
-        case kIpiStorageTargetUtilSave: return "kIpiStorageTargetUtilSave";
-        case kIpiStorageTargetApplicationInternal: return "kIpiStorageTargetApplicationInternal";
-        case kIpiStorageTargetRebootPersistent: return "kIpiStorageTargetRebootPersistent";
-        case kIpiStorageTargetBootPartition: return "kIpiStorageTargetBootPartition";
-        case kIpiStorageTargetResourcePartition: return "kIpiStorageTargetResourcePartition";
-        case kIpiStorageTargetResourceManufacturingPartition: return "kIpiStorageTargetResourceManufacturingPartition";
-        case kIpiStorageTargetBootVector: return "kIpiStorageTargetBootVector";
-        case kIpiStorageTargetFirmwareUpdateBootFile: return "kIpiStorageTargetFirmwareUpdateBootFile";
-        case kIpiStorageTargetFirmwareUpdateResourcePartition: return "kIpiStorageTargetFirmwareUpdateResourcePartition";
-        default: return "kIpiStorageTargetSettings";
+        case kIpiStorageTargetLUT:
+            return "kIpiStorageTargetLUT";
+        case kIpiStorageTargetOverlay:
+            return "kIpiStorageTargetOverlay";
+        case kIpiStorageTargetCalibSave:
+            return "kIpiStorageTargetCalibSave";
+        case kIpiStorageTargetCalibExtra:
+            return "kIpiStorageTargetCalibExtra";
+        case kIpiStorageTargetUtilSave:
+            return "kIpiStorageTargetUtilSave";
+        case kIpiStorageTargetApplicationInternal:
+            return "kIpiStorageTargetApplicationInternal";
+        case kIpiStorageTargetRebootPersistent:
+            return "kIpiStorageTargetRebootPersistent";
+        case kIpiStorageTargetBootPartition:
+            return "kIpiStorageTargetBootPartition";
+        case kIpiStorageTargetResourcePartition:
+            return "kIpiStorageTargetResourcePartition";
+        case kIpiStorageTargetResourceManufacturingPartition:
+            return "kIpiStorageTargetResourceManufacturingPartition";
+        case kIpiStorageTargetBootVector:
+            return "kIpiStorageTargetBootVector";
+        case kIpiStorageTargetFirmwareUpdateBootFile:
+            return "kIpiStorageTargetFirmwareUpdateBootFile";
+        case kIpiStorageTargetFirmwareUpdateResourcePartition:
+            return "kIpiStorageTargetFirmwareUpdateResourcePartition";
+        default:
+            return "kIpiStorageTargetSettings";
     }
 }
 
 void registerTarget(TargetRegistry& registry, StorageTarget id, std::unique_ptr<Storage::Target>&& target) {
-    LOGI << "Register " << storageTargetName(id) << " = " << target->getDescription() << " ["
-         << target->getSlotCount() << "]";
+    LOGI << "Register " << storageTargetName(id) << " = " << target->getDescription() << " [" << target->getSlotCount()
+         << "]";
     registry[id] = std::move(target);
 }
 

@@ -18,6 +18,4 @@ uint32_t crc32Update(uint32_t state, const uint8_t* data, size_t length) {
     return update(state, data, length);
 }
 
-uint32_t crc32(const uint8_t* data, size_t length) {
-    return crc32Finish(crc32Update(kCrc32Initial, data, length));
-}
+uint32_t crc32(const uint8_t* data, size_t length) { return crc32Finish(crc32Update(kCrc32Initial, data, length)); }

@@ -7,8 +7,8 @@
 
 #include <arm_acle.h>
 #include <asm/hwcap.h>
-#include <cstring>
 #include <sys/auxv.h>
+#include <cstring>
 
 namespace Crc32Paths {
 

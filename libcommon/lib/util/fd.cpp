@@ -1,7 +1,7 @@
 #include "lib/util/fd.h"
 
-#include <cstring>
 #include <unistd.h>
+#include <cstring>
 
 #include "lib/util/log.h"
 
@@ -10,6 +10,4 @@ void UniqueFd::reset(int fd) {
     fd_ = fd;
 }
 
-void logOpenFailure(const char* path, int error) {
-    LOGE << "Failed to open " << path << ": " << std::strerror(error);
-}
+void logOpenFailure(const char* path, int error) { LOGE << "Failed to open " << path << ": " << std::strerror(error); }

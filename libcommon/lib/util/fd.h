@@ -1,9 +1,9 @@
 // Owning file descriptors and the logged open.
 #pragma once
 
-#include <cerrno>
 #include <fcntl.h>
 #include <sys/types.h>
+#include <cerrno>
 
 // Owns one descriptor; -1 means none. Destruction closes it and ignores the
 // result of close. Movable, not copyable.

@@ -1,9 +1,9 @@
 #include "lib/util/log.h"
 
+#include <syslog.h>
 #include <cstdarg>
 #include <cstdio>
 #include <cstring>
-#include <syslog.h>
 
 namespace Syslog {
 
@@ -25,9 +25,7 @@ LogStream& threadLogStream() {
     return logStream;
 }
 
-void emit(int priority, const char* data, size_t length) {
-    logEmit(priority, "%.*s", static_cast<int>(length), data);
-}
+void emit(int priority, const char* data, size_t length) { logEmit(priority, "%.*s", static_cast<int>(length), data); }
 
 }  // namespace
 
@@ -91,10 +89,8 @@ LogLine::~LogLine() {
     stream_.flags(savedFlags_);
     const std::ios_base::iostate state = stream_.rdstate();
     if (state != std::ios_base::goodbit) {
-        logEmit(LOG_PRIORITY_CRITICAL,
-                "*-*-*ERROR*-*-* LOG stream has failed: good=%d bad=%d fail=%d eof=%d\n", 0,
-                (state & std::ios_base::badbit) != 0,
-                (state & (std::ios_base::badbit | std::ios_base::failbit)) != 0,
+        logEmit(LOG_PRIORITY_CRITICAL, "*-*-*ERROR*-*-* LOG stream has failed: good=%d bad=%d fail=%d eof=%d\n", 0,
+                (state & std::ios_base::badbit) != 0, (state & (std::ios_base::badbit | std::ios_base::failbit)) != 0,
                 (state & std::ios_base::eofbit) != 0);
         stream_.clear();
     }

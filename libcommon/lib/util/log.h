@@ -119,9 +119,8 @@ struct Voidify {
 
 // Nothing is formatted unless the threshold admits the priority. An
 // expression, so it nests safely under an unbraced if.
-#define LOG_STATEMENT(priority)      \
-    !::logEnabled(priority) ? (void)0 \
-                            : ::Syslog::Voidify() & ::Syslog::LogLine(priority).stream()
+#define LOG_STATEMENT(priority) \
+    !::logEnabled(priority) ? (void)0 : ::Syslog::Voidify() & ::Syslog::LogLine(priority).stream()
 
 // An error line carrying a fixed line number that scripts match on.
 #define LOGE_AT(line) LOG_STATEMENT(LOG_PRIORITY_ERROR) << LOG_SOURCE_PATH << ':' << (line) << ' '

@@ -14,20 +14,20 @@
 using Status = uint32_t;
 
 constexpr Status STATUS_OK = 0;
-constexpr Status STATUS_NOT_FOUND = 2;            // ENOENT
-constexpr Status STATUS_NOT_ENOUGH_SPACE = 12;    // ENOMEM
-constexpr Status STATUS_NOT_AVAILABLE = 16;       // EBUSY
-constexpr Status STATUS_INVALID_PARAMETER = 22;   // EINVAL
-constexpr Status STATUS_OUT_OF_RANGE = 34;        // ERANGE
-constexpr Status STATUS_NOT_IMPLEMENTED = 38;     // ENOSYS
-constexpr Status STATUS_FAILED = 52;              // EBADE
-constexpr Status STATUS_OVERFLOW = 75;            // EOVERFLOW
-constexpr Status STATUS_INVALID_OPERATION = 95;   // EOPNOTSUPP
-constexpr Status STATUS_DISCONNECTED = 107;       // ENOTCONN
-constexpr Status STATUS_EXIT = 108;               // ESHUTDOWN
-constexpr Status STATUS_TIMEOUT = 110;            // ETIMEDOUT
-constexpr Status STATUS_NOTHING_TO_DO = 114;      // EALREADY
-constexpr Status STATUS_NOT_READY = 115;          // EINPROGRESS
+constexpr Status STATUS_NOT_FOUND = 2;           // ENOENT
+constexpr Status STATUS_NOT_ENOUGH_SPACE = 12;   // ENOMEM
+constexpr Status STATUS_NOT_AVAILABLE = 16;      // EBUSY
+constexpr Status STATUS_INVALID_PARAMETER = 22;  // EINVAL
+constexpr Status STATUS_OUT_OF_RANGE = 34;       // ERANGE
+constexpr Status STATUS_NOT_IMPLEMENTED = 38;    // ENOSYS
+constexpr Status STATUS_FAILED = 52;             // EBADE
+constexpr Status STATUS_OVERFLOW = 75;           // EOVERFLOW
+constexpr Status STATUS_INVALID_OPERATION = 95;  // EOPNOTSUPP
+constexpr Status STATUS_DISCONNECTED = 107;      // ENOTCONN
+constexpr Status STATUS_EXIT = 108;              // ESHUTDOWN
+constexpr Status STATUS_TIMEOUT = 110;           // ETIMEDOUT
+constexpr Status STATUS_NOTHING_TO_DO = 114;     // EALREADY
+constexpr Status STATUS_NOT_READY = 115;         // EINPROGRESS
 
 // The constant's own name ("STATUS_OK", ...), or "<unknown>" for any other
 // value. The string is static.

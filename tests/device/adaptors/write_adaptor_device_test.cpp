@@ -49,8 +49,9 @@ protected:
     void SetUp() override {
         SKIP_UNLESS_ON_SIMULATED_DEVICE();
         ASSERT_EQ(bootState(), "read-only");
-        const ProcessResult made = runShell("mount -o remount,rw /media/boot && rm -rf /media/boot/store && "
-                                            "mkdir /media/boot/store && mount -o remount,ro /media/boot");
+        const ProcessResult made = runShell(
+            "mount -o remount,rw /media/boot && rm -rf /media/boot/store && "
+            "mkdir /media/boot/store && mount -o remount,ro /media/boot");
         ASSERT_EQ(made.exitStatus, 0) << made.err;
         ASSERT_EQ(bootState(), "read-only");
     }

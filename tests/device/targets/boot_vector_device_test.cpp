@@ -1,14 +1,14 @@
 // The boot-vector target on the simulated device: located through the real
 // partitioning tool, read from and written to the raw eMMC image. One suite
 // per image variant; each runs only in its own variant.
+#include <sys/stat.h>
+#include <unistd.h>
 #include <algorithm>
 #include <cstdint>
 #include <cstdio>
 #include <filesystem>
 #include <functional>
 #include <string>
-#include <sys/stat.h>
-#include <unistd.h>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -325,8 +325,7 @@ protected:
 
 TEST_F(BootVectorWriteFaults, FailedWrite) {
     const Bytes record = sd::makeBootVectorRecord(0x11223344u, 8);
-    const ProcessResult result =
-        runDriver(testing_support::faultEnv("write", 1, "errno:EIO", "mmcblk0"), record);
+    const ProcessResult result = runDriver(testing_support::faultEnv("write", 1, "errno:EIO", "mmcblk0"), record);
     EXPECT_EQ(result.exitStatus, 0) << result.err;
     EXPECT_EQ(normalisedStorageLog(result.out),
               "lib/storage/storage_target:N BootVector write failed: 5: Input/output error\n"
@@ -364,8 +363,7 @@ TEST_F(BootVectorWriteFaults, DriverWithoutFaultsWrites) {
 
 // Every operation of an unusable slot, after construction has said why.
 int probeUnusable(BootVectorTarget& target, TargetSlot& slot) {
-    std::printf("exists %d valid %d count %zu\n", slot.exists() ? 1 : 0, slot.isValid() ? 1 : 0,
-                target.getSlotCount());
+    std::printf("exists %d valid %d count %zu\n", slot.exists() ? 1 : 0, slot.isValid() ? 1 : 0, target.getSlotCount());
     Bytes buffer(20, 0xEE);
     std::printf("read %u\n", slot.read(buffer.data(), 20, 0));
     const Bytes record = sd::makeBootVectorRecord(0x01020304u, 1);

@@ -1,15 +1,15 @@
 #include "device_test_support.h"
 
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
-#include <fcntl.h>
-#include <linux/fs.h>
 #include <stdexcept>
-#include <sys/ioctl.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include "files.h"
 #include "simulated_device.h"
@@ -21,8 +21,8 @@ namespace fs = std::filesystem;
 void mustRun(const std::string& command) {
     const ProcessResult result = testing_support::runShell(command);
     if (result.exitStatus != 0) {
-        throw std::runtime_error("'" + command + "' failed (" + std::to_string(result.exitStatus) +
-                                 "): " + result.out + result.err);
+        throw std::runtime_error("'" + command + "' failed (" + std::to_string(result.exitStatus) + "): " + result.out +
+                                 result.err);
     }
 }
 

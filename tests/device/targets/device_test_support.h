@@ -3,11 +3,11 @@
 // device-node chores.
 #pragma once
 
+#include <sys/types.h>
 #include <cstdint>
 #include <filesystem>
 #include <functional>
 #include <string>
-#include <sys/types.h>
 #include <vector>
 
 #include "child_process.h"

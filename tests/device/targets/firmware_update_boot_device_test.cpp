@@ -1,18 +1,18 @@
 // The firmware-update boot-file target on the simulated device, with the
 // real read-only ext4 boot partition at /media/boot and the real mount
 // command behind a recorder.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <algorithm>
 #include <cerrno>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
-#include <fcntl.h>
 #include <filesystem>
 #include <functional>
 #include <map>
 #include <string>
-#include <sys/stat.h>
-#include <unistd.h>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -59,9 +59,7 @@ const std::string kUpToDateLines =
     "finalise 0 valid 0\n";
 
 std::string rewrittenLines(const std::string& name, size_t bytes) {
-    return testing_support::needsUpdatingLines(name) +
-           "Opening " +
-           quoted(name) +
+    return testing_support::needsUpdatingLines(name) + "Opening " + quoted(name) +
            " for write\n"
            "Wrote " +
            std::to_string(bytes) +
@@ -360,12 +358,11 @@ TEST_F(FirmwareUpdateBootOnDevice, BeginTwiceRestarts) {
 // and no read-only remount follows.
 TEST_F(FirmwareUpdateBootOnDevice, FailedRemountEndsTheUpdate) {
     const ProcessResult result = update(0, pattern(100, 2), 4096, {{"FAKE_MOUNT_EXIT", "32"}});
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              receivedLines("BOOT.BIN", 100) +
-                  testing_support::needsUpdatingLines("BOOT.BIN") +
-                  "lib/storage/storage_target:N Failed to execute mount\n"
-                  "Closing #1\n"
-                  "finalise 52 valid 0\n");
+    EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 100) +
+                                                    testing_support::needsUpdatingLines("BOOT.BIN") +
+                                                    "lib/storage/storage_target:N Failed to execute mount\n"
+                                                    "Closing #1\n"
+                                                    "finalise 52 valid 0\n");
     EXPECT_EQ(recorder.calls(), kRemountRw);
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")), fileBytes(sd::originalBootFile("BOOT.BIN")));
@@ -392,12 +389,11 @@ TEST_F(FirmwareUpdateBootOnDevice, FiveFailedReadBacks) {
             "lib/storage/storage_target:N Failed to open BOOT.BIN for writing\n";
     }
     EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT0010.BIN", 1000) +
-                                          testing_support::needsUpdatingLines("BOOT0010.BIN") +
-                                          attempts +
-                                          "Remounting \"/media/boot\" as ro\n"
-                                          "Closing #1\n"
-                                          "finalise 52 valid 0\n"
-                                          "finalise 2\n");
+                                                    testing_support::needsUpdatingLines("BOOT0010.BIN") + attempts +
+                                                    "Remounting \"/media/boot\" as ro\n"
+                                                    "Closing #1\n"
+                                                    "finalise 52 valid 0\n"
+                                                    "finalise 2\n");
     EXPECT_EQ(recorder.calls(), std::string(kRemountRw) + kRemountRo);
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
     EXPECT_EQ(fileBytes(bootFile("BOOT0010.BIN")), fileBytes(sd::originalBootFile("BOOT0010.BIN")));
@@ -423,15 +419,15 @@ TEST_F(FirmwareUpdateBootFaults, ShortCopyIsRetried) {
     const ProcessResult result = runDriver(testing_support::faultEnv("write", 1, "short:100", "BOOT.BIN"), data);
     EXPECT_EQ(result.exitStatus, 0) << result.err;
     EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 9000) +
-                                          testing_support::needsUpdatingLines("BOOT.BIN") +
-                                          "Opening \"/media/boot/BOOT.BIN\" for write\n"
-                                          "Wrote 100 bytes\n"
-                                          "Opening \"/media/boot/BOOT.BIN\" for write\n"
-                                          "Wrote 9000 bytes\n"
-                                          "Readback successful for \"/media/boot/BOOT.BIN\"\n"
-                                          "Remounting \"/media/boot\" as ro\n"
-                                          "Closing #1\n"
-                                          "finalise 0 valid 0\n");
+                                                    testing_support::needsUpdatingLines("BOOT.BIN") +
+                                                    "Opening \"/media/boot/BOOT.BIN\" for write\n"
+                                                    "Wrote 100 bytes\n"
+                                                    "Opening \"/media/boot/BOOT.BIN\" for write\n"
+                                                    "Wrote 9000 bytes\n"
+                                                    "Readback successful for \"/media/boot/BOOT.BIN\"\n"
+                                                    "Remounting \"/media/boot\" as ro\n"
+                                                    "Closing #1\n"
+                                                    "finalise 0 valid 0\n");
     EXPECT_EQ(recorder.calls(), std::string(kRemountRw) + kRemountRo);
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")), data);
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
@@ -443,17 +439,17 @@ TEST_F(FirmwareUpdateBootFaults, FailedCopyIsReportedAndRetried) {
     const Bytes data = pattern(9000, 9);
     const ProcessResult result = runDriver(testing_support::faultEnv("write", 2, "errno:EIO", "BOOT.BIN"), data);
     EXPECT_EQ(result.exitStatus, 0) << result.err;
-    EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 9000) +
-                                          testing_support::needsUpdatingLines("BOOT.BIN") +
-                                          "Opening \"/media/boot/BOOT.BIN\" for write\n"
-                                          "lib/storage/storage_target:N cat: write failed: 5: Input/output error\n"
-                                          "Wrote 4096 bytes\n"
-                                          "Opening \"/media/boot/BOOT.BIN\" for write\n"
-                                          "Wrote 9000 bytes\n"
-                                          "Readback successful for \"/media/boot/BOOT.BIN\"\n"
-                                          "Remounting \"/media/boot\" as ro\n"
-                                          "Closing #1\n"
-                                          "finalise 0 valid 0\n");
+    EXPECT_EQ(normalisedStorageLog(result.out),
+              receivedLines("BOOT.BIN", 9000) + testing_support::needsUpdatingLines("BOOT.BIN") +
+                  "Opening \"/media/boot/BOOT.BIN\" for write\n"
+                  "lib/storage/storage_target:N cat: write failed: 5: Input/output error\n"
+                  "Wrote 4096 bytes\n"
+                  "Opening \"/media/boot/BOOT.BIN\" for write\n"
+                  "Wrote 9000 bytes\n"
+                  "Readback successful for \"/media/boot/BOOT.BIN\"\n"
+                  "Remounting \"/media/boot\" as ro\n"
+                  "Closing #1\n"
+                  "finalise 0 valid 0\n");
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")), data);
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
 }

@@ -2,15 +2,15 @@
 // resource partition "/dev/mmcblk0p2" at /media/resources, mounted and
 // unmounted through the real commands behind a recorder. Every test leaves
 // a freshly made resource partition behind.
-#include <cstdint>
-#include <cstdio>
 #include <fcntl.h>
-#include <filesystem>
-#include <functional>
-#include <string>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <unistd.h>
+#include <cstdint>
+#include <cstdio>
+#include <filesystem>
+#include <functional>
+#include <string>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -53,7 +53,9 @@ Bytes deviceBytes(uint64_t offset, size_t size) {
     return bytes;
 }
 
-Status writeAt(TargetSlot& slot, int64_t offset, const Bytes& data) { return slot.writeAt(offset, data.data(), data.size()); }
+Status writeAt(TargetSlot& slot, int64_t offset, const Bytes& data) {
+    return slot.writeAt(offset, data.data(), data.size());
+}
 
 class FirmwareUpdatePartitionOnDevice : public ::testing::Test {
 protected:
@@ -149,13 +151,13 @@ TEST_F(FirmwareUpdatePartitionOnDevice, TwoBlocksThenTheMountResult) {
     });
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(result.out), kBegun +
-                                          "begin 0\n"
-                                          "writeAt 0\n"
-                                          "writeAt 0\n"
-                                          "Wrote 8192 bytes to \"/dev/mmcblk0p2\"\n"
-                                          "Mounting \"/media/resources\"\n"
-                                          "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\n"
-                                          "finalise 52\n");
+                                                    "begin 0\n"
+                                                    "writeAt 0\n"
+                                                    "writeAt 0\n"
+                                                    "Wrote 8192 bytes to \"/dev/mmcblk0p2\"\n"
+                                                    "Mounting \"/media/resources\"\n"
+                                                    "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\n"
+                                                    "finalise 52\n");
     EXPECT_EQ(recorder.calls(), std::string(kUnmount) + kMount);
     EXPECT_EQ(sd::mountState(sd::kResourcesMount), sd::MountState::kNotMounted);
     EXPECT_EQ(sd::readDeviceBytes(sd::kResourcePartition, 0, 4096), first);
@@ -179,19 +181,20 @@ TEST_F(FirmwareUpdatePartitionOnDevice, BeginTwiceRestarts) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalisedStorageLog(result.out), kBegun +
-                                          "begin 0\n"
-                                          "writeAt 0\n"
-                                          "writeAt 0\n"
-                                          "Restarting partition update!\n"
-                                          "Unmounting \"/media/resources\"\n"
-                                          "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\n"
-                                          "Beginning partition update \"/dev/mmcblk0p2\" at \"/media/resources\"\n"
-                                          "begin 0 valid 1\n"
-                                          "writeAt 0\n"
-                                          "Wrote 4096 bytes to \"/dev/mmcblk0p2\"\n"
-                                          "Mounting \"/media/resources\"\n"
-                                          "finalise 0\n");
+    EXPECT_EQ(normalisedStorageLog(result.out),
+              kBegun +
+                  "begin 0\n"
+                  "writeAt 0\n"
+                  "writeAt 0\n"
+                  "Restarting partition update!\n"
+                  "Unmounting \"/media/resources\"\n"
+                  "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\n"
+                  "Beginning partition update \"/dev/mmcblk0p2\" at \"/media/resources\"\n"
+                  "begin 0 valid 1\n"
+                  "writeAt 0\n"
+                  "Wrote 4096 bytes to \"/dev/mmcblk0p2\"\n"
+                  "Mounting \"/media/resources\"\n"
+                  "finalise 0\n");
     EXPECT_EQ(recorder.calls(), std::string(kUnmount) + kUnmount + kMount);
     EXPECT_EQ(sd::mountState(sd::kResourcesMount), sd::MountState::kReadWrite);
     EXPECT_EQ(testing_support::readText(sd::kResourcesMarker), sd::kResourcesMarkerText);
@@ -284,15 +287,15 @@ TEST_F(FirmwareUpdatePartitionOnDevice, FailedBlockWritesKeepTheUpdate) {
         return 0;
     });
     EXPECT_EQ(normalisedStorageLog(result.out), kBegun +
-                                          "begin 0\n"
-                                          "writeAt 52\n"
-                                          "valid 1\n"
-                                          "writeAt 28\n"
-                                          "valid 1\n"
-                                          "writeAt 0\n"
-                                          "Wrote 1024 bytes to \"/dev/mmcblk0p2\"\n"
-                                          "Mounting \"/media/resources\"\n"
-                                          "finalise 0\n");
+                                                    "begin 0\n"
+                                                    "writeAt 52\n"
+                                                    "valid 1\n"
+                                                    "writeAt 28\n"
+                                                    "valid 1\n"
+                                                    "writeAt 0\n"
+                                                    "Wrote 1024 bytes to \"/dev/mmcblk0p2\"\n"
+                                                    "Mounting \"/media/resources\"\n"
+                                                    "finalise 0\n");
     EXPECT_EQ(sd::mountState(sd::kResourcesMount), sd::MountState::kReadWrite);
     EXPECT_EQ(sd::readDeviceBytes(sd::kResourcePartition, static_cast<uint64_t>(end - 10), 10), pattern(10, 1));
 }

@@ -2,10 +2,10 @@
 // partitions, the boot vector and the firmware-update targets. On the
 // simulated device (RegistrationOnDevice) and on a host without the device
 // (RegistrationWithoutDevice).
+#include <unistd.h>
 #include <algorithm>
 #include <filesystem>
 #include <string>
-#include <unistd.h>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -13,8 +13,8 @@
 #include "child_process.h"
 #include "device_test_support.h"
 #include "files.h"
-#include "scratch_dir.h"
 #include "registration_log.h"
+#include "scratch_dir.h"
 #include "simulated_device.h"
 #include "storage_log.h"
 
@@ -66,8 +66,8 @@ TEST_F(RegistrationOnDevice, HealthyDeviceLogsNothingByDefault) {
     EXPECT_EQ(absent.out, "");
     EXPECT_EQ(absent.err, "");
 
-    const ProcessResult migrated = runTool({"--base", base().string(), "--target", "settings", "--type", "simple",
-                                            "--data", (dir / "data").string()});
+    const ProcessResult migrated = runTool(
+        {"--base", base().string(), "--target", "settings", "--type", "simple", "--data", (dir / "data").string()});
     EXPECT_EQ(migrated.exitStatus, 0);
     EXPECT_EQ(migrated.out, "");
     EXPECT_EQ(migrated.err, "");
@@ -92,8 +92,8 @@ TEST_F(RegistrationOnDevice, EveryRunReadsTheBootVector) {
     sd::writeImageBytes(sd::bootVectorOffset(), original);
     EXPECT_EQ(result.exitStatus, 10);
     EXPECT_EQ(normalisedStorageLog(result.out), dualFileLines(base()) + kFileReadLines +
-                                          "lib/storage/storage_target:N Boot vector query failed!\n" +
-                                          kDeviceTargetLines);
+                                                    "lib/storage/storage_target:N Boot vector query failed!\n" +
+                                                    kDeviceTargetLines);
 
     const ProcessResult healthy = runTool({"--base", base().string(), "--target", "settings", "--query-present"});
     EXPECT_EQ(healthy.out, "");
@@ -139,8 +139,8 @@ TEST_F(RegistrationWithoutDevice, VerboseRegistrationIsComplete) {
 }
 
 TEST_F(RegistrationWithoutDevice, DualFileStoresStillWork) {
-    const ProcessResult migrated = runTool({"--base", base().string(), "--target", "settings", "--type", "simple",
-                                            "--data", (dir / "data").string()});
+    const ProcessResult migrated = runTool(
+        {"--base", base().string(), "--target", "settings", "--type", "simple", "--data", (dir / "data").string()});
     EXPECT_EQ(migrated.exitStatus, 0);
     EXPECT_EQ(normalisedStorageLog(migrated.out), kParseFailure);
     expectOneComplaint(migrated.err);

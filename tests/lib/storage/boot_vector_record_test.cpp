@@ -14,9 +14,9 @@
 
 #include "child_process.h"
 #include "files.h"
-#include "scratch_dir.h"
 #include "lib/storage/boot_vector_target.h"
 #include "lib/util/log.h"
+#include "scratch_dir.h"
 #include "storage_log.h"
 #include "store_files.h"
 
@@ -76,9 +76,7 @@ struct SectorRow {
     bool sectorChecked = true;
 };
 
-std::ostream& operator<<(std::ostream& out, const SectorRow& row) {
-    return out << '"' << row.text << '"';
-}
+std::ostream& operator<<(std::ostream& out, const SectorRow& row) { return out << '"' << row.text << '"'; }
 
 class SectorParsing : public ::testing::TestWithParam<SectorRow> {};
 
@@ -100,34 +98,25 @@ INSTANTIATE_TEST_SUITE_P(
         SectorRow{" 30703616 30777343 73728 36M\n", SectorParse::kOk, 30703616},
         SectorRow{"30703616 33554431 2850816  1.4G\n", SectorParse::kOk, 30703616},
         // The bounds: 3 GiB and 16 GiB in sectors, both inclusive.
-        SectorRow{"6291456\n", SectorParse::kOk, 6291456},
-        SectorRow{"33554432\n", SectorParse::kOk, 33554432},
+        SectorRow{"6291456\n", SectorParse::kOk, 6291456}, SectorRow{"33554432\n", SectorParse::kOk, 33554432},
         SectorRow{"6291455\n", SectorParse::kOutOfRange, 6291455},
-        SectorRow{"33554433\n", SectorParse::kOutOfRange, 33554433},
-        SectorRow{"0\n", SectorParse::kOutOfRange, 0},
+        SectorRow{"33554433\n", SectorParse::kOutOfRange, 33554433}, SectorRow{"0\n", SectorParse::kOutOfRange, 0},
         SectorRow{"2048000 33554431 31506432 15G\n", SectorParse::kOutOfRange, 2048000},
         // Nothing that starts a number.
-        SectorRow{"", SectorParse::kNotANumber, kUntouched},
-        SectorRow{"\n", SectorParse::kNotANumber, kUntouched},
+        SectorRow{"", SectorParse::kNotANumber, kUntouched}, SectorRow{"\n", SectorParse::kNotANumber, kUntouched},
         SectorRow{"Start End Sectors Size\n", SectorParse::kNotANumber, kUntouched},
         SectorRow{"   Start\n", SectorParse::kNotANumber, kUntouched},
         SectorRow{"M30703616\n", SectorParse::kNotANumber, kUntouched},
         // Parsed as a floating-point number, truncated toward zero.
-        SectorRow{"-5\n", SectorParse::kOutOfRange, 0},
-        SectorRow{"-30703616\n", SectorParse::kOutOfRange, 0},
-        SectorRow{"12345678.9\n", SectorParse::kOk, 12345678},
-        SectorRow{"33554432.99\n", SectorParse::kOk, 33554432},
+        SectorRow{"-5\n", SectorParse::kOutOfRange, 0}, SectorRow{"-30703616\n", SectorParse::kOutOfRange, 0},
+        SectorRow{"12345678.9\n", SectorParse::kOk, 12345678}, SectorRow{"33554432.99\n", SectorParse::kOk, 33554432},
         SectorRow{"6291455.99\n", SectorParse::kOutOfRange, 6291455},
-        SectorRow{"3.0703616e7 x\n", SectorParse::kOk, 30703616},
-        SectorRow{"+6291456", SectorParse::kOk, 6291456},
-        SectorRow{"\t 6291457 ", SectorParse::kOk, 6291457},
-        SectorRow{"0x1d48000\n", SectorParse::kOk, 30703616},
+        SectorRow{"3.0703616e7 x\n", SectorParse::kOk, 30703616}, SectorRow{"+6291456", SectorParse::kOk, 6291456},
+        SectorRow{"\t 6291457 ", SectorParse::kOk, 6291457}, SectorRow{"0x1d48000\n", SectorParse::kOk, 30703616},
         SectorRow{"30703616M", SectorParse::kOk, 30703616},
         // Numbers a sector cannot be.
-        SectorRow{"nan\n", SectorParse::kOutOfRange, 0, false},
-        SectorRow{"inf\n", SectorParse::kOutOfRange, 0, false},
-        SectorRow{"-inf\n", SectorParse::kOutOfRange, 0},
-        SectorRow{"1e30\n", SectorParse::kOutOfRange, 0, false},
+        SectorRow{"nan\n", SectorParse::kOutOfRange, 0, false}, SectorRow{"inf\n", SectorParse::kOutOfRange, 0, false},
+        SectorRow{"-inf\n", SectorParse::kOutOfRange, 0}, SectorRow{"1e30\n", SectorParse::kOutOfRange, 0, false},
         SectorRow{"18446744073709551616\n", SectorParse::kOutOfRange, 0, false}));
 
 TEST(BootVectorLocation, RecordOffsetOfTheUsualSector) {
@@ -392,26 +381,27 @@ TEST_P(BootVectorLocateWithoutDevice, SilentAtTheCriticalThreshold) {
 
 INSTANTIATE_TEST_SUITE_P(
     Rows, BootVectorLocateWithoutDevice,
-    ::testing::Values(
-        LocateRow{"CommandFails", "exit 1", "lib/storage/storage_target:N Failed to query flash size\n"},
-        LocateRow{"CommandKilled", "kill -KILL $PPID; kill -KILL $$",
-                  "lib/storage/storage_target:N Failed to query flash size\n"},
-        LocateRow{"NothingPrinted", "exit 0", "lib/storage/storage_target:N Failed to parse flash size ''\n"},
-        // The captured text keeps its newline, which splits the line.
-        LocateRow{"Heading", "echo 'Start End Sectors Size'",
-                  "lib/storage/storage_target:N Failed to parse flash size 'Start End Sectors Size\n'\n"},
-        LocateRow{"BelowTheRange", "echo ' 6291455 33554431 27262977 13G'",
-                  "lib/storage/storage_target:N Boot vector 6291455 not in range 6291456 to 33554432\n"},
-        LocateRow{"AboveTheRange", "echo 33554433",
-                  "lib/storage/storage_target:N Boot vector 33554433 not in range 6291456 to 33554432\n"},
-        LocateRow{"Negative", "echo -5", "lib/storage/storage_target:N Boot vector 0 not in range 6291456 to 33554432\n"},
-        // In range, so the device is opened next, and it is missing.
-        LocateRow{"InRange", "echo ' 30703616 30777343 73728 36M'",
-                  "libcommon/lib/util/fd:N Failed to open /dev/mmcblk0: No such file or directory\n"
-                  "lib/storage/storage_target:N Boot vector query failed!\n"},
-        LocateRow{"Fraction", "echo 12345678.9",
-                  "libcommon/lib/util/fd:N Failed to open /dev/mmcblk0: No such file or directory\n"
-                  "lib/storage/storage_target:N Boot vector query failed!\n"}),
+    ::testing::Values(LocateRow{"CommandFails", "exit 1", "lib/storage/storage_target:N Failed to query flash size\n"},
+                      LocateRow{"CommandKilled", "kill -KILL $PPID; kill -KILL $$",
+                                "lib/storage/storage_target:N Failed to query flash size\n"},
+                      LocateRow{"NothingPrinted", "exit 0",
+                                "lib/storage/storage_target:N Failed to parse flash size ''\n"},
+                      // The captured text keeps its newline, which splits the line.
+                      LocateRow{"Heading", "echo 'Start End Sectors Size'",
+                                "lib/storage/storage_target:N Failed to parse flash size 'Start End Sectors Size\n'\n"},
+                      LocateRow{"BelowTheRange", "echo ' 6291455 33554431 27262977 13G'",
+                                "lib/storage/storage_target:N Boot vector 6291455 not in range 6291456 to 33554432\n"},
+                      LocateRow{"AboveTheRange", "echo 33554433",
+                                "lib/storage/storage_target:N Boot vector 33554433 not in range 6291456 to 33554432\n"},
+                      LocateRow{"Negative", "echo -5",
+                                "lib/storage/storage_target:N Boot vector 0 not in range 6291456 to 33554432\n"},
+                      // In range, so the device is opened next, and it is missing.
+                      LocateRow{"InRange", "echo ' 30703616 30777343 73728 36M'",
+                                "libcommon/lib/util/fd:N Failed to open /dev/mmcblk0: No such file or directory\n"
+                                "lib/storage/storage_target:N Boot vector query failed!\n"},
+                      LocateRow{"Fraction", "echo 12345678.9",
+                                "libcommon/lib/util/fd:N Failed to open /dev/mmcblk0: No such file or directory\n"
+                                "lib/storage/storage_target:N Boot vector query failed!\n"}),
     [](const ::testing::TestParamInfo<LocateRow>& info) { return std::string(info.param.name); });
 
 }  // namespace

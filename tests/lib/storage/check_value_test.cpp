@@ -1,10 +1,10 @@
 #include "lib/storage/check_value.h"
 
 #include <fcntl.h>
-#include <filesystem>
-#include <stdexcept>
 #include <sys/stat.h>
 #include <unistd.h>
+#include <filesystem>
+#include <stdexcept>
 
 #include <gtest/gtest.h>
 
@@ -16,8 +16,8 @@
 namespace {
 
 using store_test::absentCheckFile;
-using store_test::bytesOf;
 using store_test::Bytes;
+using store_test::bytesOf;
 using store_test::expectedCheckFile;
 using store_test::kPast;
 using store_test::kSecond;
@@ -92,8 +92,8 @@ TEST_P(ComputeCheckValueSizes, MatchesTheReferenceLayout) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Blocks, ComputeCheckValueSizes,
-                         ::testing::Values(1, 7, 4095, 4096, 4097, 8192, 12289, 65535, 65536, 65537,
-                                           3 * 65536 + 5, 1000000));
+                         ::testing::Values(1, 7, 4095, 4096, 4097, 8192, 12289, 65535, 65536, 65537, 3 * 65536 + 5,
+                                           1000000));
 
 // A read error (a directory passed off as a data file) fails the value.
 TEST(ComputeCheckValue, UnreadableDataFails) {

@@ -26,8 +26,8 @@ const std::string kOpenFailure = testing_support::openFailurePrefix();
 
 namespace fs = std::filesystem;
 using store_test::absentBlob;
-using store_test::bytesOf;
 using store_test::Bytes;
+using store_test::bytesOf;
 using store_test::contentOf;
 using store_test::copyLines;
 using store_test::describeTree;
@@ -52,17 +52,16 @@ using testing_support::ScratchDir;
 unsigned long firstReadTries() { return testing_support::openat2Available() ? 1 : 2; }
 
 std::string stateLine(const SlotContent& content) {
-    return "state: exists=" + std::to_string(content.exists ? 1 : 0) + " valid=" + std::to_string(content.valid ? 1 : 0) +
-           " read=" + std::to_string(content.status) + " data=" + hex(content.data) + "\n";
+    return "state: exists=" + std::to_string(content.exists ? 1 : 0) +
+           " valid=" + std::to_string(content.valid ? 1 : 0) + " read=" + std::to_string(content.status) +
+           " data=" + hex(content.data) + "\n";
 }
 
 class DualFileFaults : public ::testing::Test {
 protected:
     fs::path base() const { return dir / "store"; }
     // Directory of one slot of a target with `slots` slots.
-    fs::path slotDir(size_t slots, size_t slot) const {
-        return slots == 1 ? base() : base() / std::to_string(slot);
-    }
+    fs::path slotDir(size_t slots, size_t slot) const { return slots == 1 ? base() : base() / std::to_string(slot); }
     std::string path(const std::string& relative) const { return (base() / relative).string(); }
 
     // An input file for the driver, outside the store.
@@ -74,7 +73,8 @@ protected:
 
     ProcessResult drive(const std::vector<std::string>& steps, const Environment& env = {}, size_t slots = 1,
                         size_t slot = 0) {
-        std::vector<std::string> argv = {DUAL_FILE_DRIVER, base().string(), std::to_string(slots), std::to_string(slot)};
+        std::vector<std::string> argv = {DUAL_FILE_DRIVER, base().string(), std::to_string(slots),
+                                         std::to_string(slot)};
         argv.insert(argv.end(), steps.begin(), steps.end());
         return testing_support::runProgram(argv, env);
     }
@@ -86,7 +86,8 @@ protected:
 
     // How many calls matching `call` on paths containing `substr` the steps
     // make, opening included.
-    unsigned long countCalls(const std::string& call, const std::string& substr, const std::vector<std::string>& steps) {
+    unsigned long countCalls(const std::string& call, const std::string& substr,
+                             const std::vector<std::string>& steps) {
         const fs::path countFile = dir / "count";
         const ProcessResult result = drive(steps, faultCountEnv(call, countFile.string(), substr));
         EXPECT_EQ(result.exitStatus, 0) << result.out << result.err;
@@ -183,8 +184,8 @@ class RenameFails : public DualFileFaults, public ::testing::WithParamInterface<
 
 TEST_P(RenameFails, ReturnsItsErrnoAndKeepsTheOldCopy) {
     prepare();
-    const ProcessResult result = drive({"write", input(new_)},
-                                       faultEnv("rename", 1, std::string("errno:") + GetParam().first, path("1/data")));
+    const ProcessResult result =
+        drive({"write", input(new_)}, faultEnv("rename", 1, std::string("errno:") + GetParam().first, path("1/data")));
     EXPECT_EQ(result.exitStatus, 1);
     EXPECT_EQ(result.out, "write: " + std::to_string(GetParam().second) + "\n" + stateLine(holding(old_)));
     // The check value never reached its real name.
@@ -213,8 +214,7 @@ TEST_F(DualFileFaults, RenameFailsInFinalise) {
 // next opening, while this process keeps serving the old one.
 TEST_F(DualFileFaults, SyncfsFails) {
     prepare();
-    const ProcessResult result =
-        drive({"write", input(new_)}, faultEnv("syncfs", 1, "errno:EIO", path("1/data.chk")));
+    const ProcessResult result = drive({"write", input(new_)}, faultEnv("syncfs", 1, "errno:EIO", path("1/data.chk")));
     EXPECT_EQ(result.exitStatus, 1);
     EXPECT_EQ(result.out, "lib/storage/storage_target:510 Failed to sync fs: Input/output error (5)\nwrite: 5\n" +
                               stateLine(holding(old_)));
@@ -226,8 +226,9 @@ TEST_F(DualFileFaults, SyncfsFailsOnErase) {
     prepare();
     const ProcessResult result = drive({"erase"}, faultEnv("sync", 1, "errno:ENOSPC", path("1/data.chk")));
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "lib/storage/storage_target:510 Failed to sync fs: No space left on device (28)\nerase: 28\n" +
-                              stateLine(holding(old_)));
+    EXPECT_EQ(result.out,
+              "lib/storage/storage_target:510 Failed to sync fs: No space left on device (28)\nerase: 28\n" +
+                  stateLine(holding(old_)));
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data.chk ffffffffffffffff\n" + copyLines("2", old_));
     expectReopenedAs(absentBlob());
 }
@@ -237,12 +238,13 @@ TEST_F(DualFileFaults, SyncfsFailsOnErase) {
 TEST_F(DualFileFaults, WriteAfterAFailedSync) {
     prepare();
     const Bytes newer = bytesOf("newer still");
-    const ProcessResult result = drive({"write", input(new_), "write", input(newer)},
-                                       faultEnv("syncfs", 1, "errno:EIO", path("1/data.chk")));
+    const ProcessResult result =
+        drive({"write", input(new_), "write", input(newer)}, faultEnv("syncfs", 1, "errno:EIO", path("1/data.chk")));
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "lib/storage/storage_target:510 Failed to sync fs: Input/output error (5)\nwrite: 5\n"
-                          "write: 0\n" +
-                              stateLine(holding(newer)));
+    EXPECT_EQ(result.out,
+              "lib/storage/storage_target:510 Failed to sync fs: Input/output error (5)\nwrite: 5\n"
+              "write: 0\n" +
+                  stateLine(holding(newer)));
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", newer) + copyLines("2", old_));
     expectReopenedAs(holding(newer));
 }
@@ -297,8 +299,7 @@ TEST_F(DualFileFaults, UtimensatSucceedsWithoutTheShimFailingIt) {
 // removal before opening its data file then succeeds.
 TEST_F(DualFileFaults, InvalidatingRemovalFails) {
     prepare();
-    const ProcessResult result =
-        drive({"write", input(new_)}, faultEnv("unlink", 1, "errno:EIO", path("1/data.chk")));
+    const ProcessResult result = drive({"write", input(new_)}, faultEnv("unlink", 1, "errno:EIO", path("1/data.chk")));
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(result.out, "lib/storage/storage_target:378 generic:5\nwrite: 0\n" + stateLine(holding(new_)));
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", new_) + copyLines("2", old_));
@@ -307,8 +308,7 @@ TEST_F(DualFileFaults, InvalidatingRemovalFails) {
 
 TEST_F(DualFileFaults, RemovalBeforeOpeningTheDataFails) {
     prepare();
-    const ProcessResult result =
-        drive({"write", input(new_)}, faultEnv("unlink", 2, "errno:EIO", path("1/data.chk")));
+    const ProcessResult result = drive({"write", input(new_)}, faultEnv("unlink", 2, "errno:EIO", path("1/data.chk")));
     EXPECT_EQ(result.exitStatus, 1);
     EXPECT_EQ(result.out, "write: 5\n" + stateLine(holding(old_)));
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(older_) + "\n" + copyLines("2", old_));
@@ -335,8 +335,7 @@ TEST_F(DualFileFaults, EraseCannotRemoveTheData) {
 
 TEST_F(DualFileFaults, BeginWriteCannotRemoveTheData) {
     prepare();
-    const ProcessResult result =
-        drive({"beginWrite", "finalise"}, faultEnv("unlink", 1, "errno:EIO", path("1/data")));
+    const ProcessResult result = drive({"beginWrite", "finalise"}, faultEnv("unlink", 1, "errno:EIO", path("1/data")));
     EXPECT_EQ(result.exitStatus, 1);
     EXPECT_EQ(result.out, "beginWrite: 5\nfinalise: 95\n" + stateLine(holding(old_)));
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", older_) + copyLines("2", old_));
@@ -388,7 +387,8 @@ TEST_F(DualFileFaults, OpeningRemovesOnlyCheckFilesThatAreThere) {
     store_test::writeCopy(base() / "2", old_, kPast);
     testing_support::writeBytes(base() / "2" / "data", bytesOf("changed"));
     EXPECT_EQ(countCalls("unlink", base().string(), {}), 1u);
-    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(older_) + "\nf 2/data " + hex(bytesOf("changed")) + "\n");
+    EXPECT_EQ(describeTree(base()),
+              "d 1\nd 2\nf 1/data " + hex(older_) + "\nf 2/data " + hex(bytesOf("changed")) + "\n");
 }
 
 // ---- writing the data ----
@@ -403,8 +403,8 @@ TEST_P(DataWriteFails, ReturnsTheErrno) {
     const ProcessResult result =
         drive({"write", input(new_)}, faultEnv("write", 1, "errno:" + errorName, path("1/data")));
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "lib/storage/storage_target:144 write failed: " + text + "\nwrite: " +
-                              text.substr(0, text.find(':')) + "\n" + stateLine(holding(old_)));
+    EXPECT_EQ(result.out, "lib/storage/storage_target:144 write failed: " + text +
+                              "\nwrite: " + text.substr(0, text.find(':')) + "\n" + stateLine(holding(old_)));
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data \n" + copyLines("2", old_));
     expectReopenedAs(holding(old_));
 }
@@ -420,8 +420,8 @@ TEST_F(DualFileFaults, ShortDataWrite) {
     const ProcessResult result = drive({"write", input(new_)}, faultEnv("write", 1, "short:4", path("1/data")));
     EXPECT_EQ(result.exitStatus, 1);
     EXPECT_EQ(result.out, "write: 52\n" + stateLine(holding(old_)));
-    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(Bytes(new_.begin(), new_.begin() + 4)) + "\n" +
-                                        copyLines("2", old_));
+    EXPECT_EQ(describeTree(base()),
+              "d 1\nd 2\nf 1/data " + hex(Bytes(new_.begin(), new_.begin() + 4)) + "\n" + copyLines("2", old_));
     expectReopenedAs(holding(old_));
 }
 
@@ -433,8 +433,8 @@ TEST_F(DualFileFaults, DataFileCannotBeOpened) {
     const ProcessResult result =
         drive({"write", input(new_)}, faultEnv("open", atOpening + 1, "errno:EIO", path("1/data")));
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, kOpenFailure + path("1/data") +
-                              ": Input/output error\nwrite: 52\n" + stateLine(holding(old_)));
+    EXPECT_EQ(result.out,
+              kOpenFailure + path("1/data") + ": Input/output error\nwrite: 52\n" + stateLine(holding(old_)));
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(older_) + "\n" + copyLines("2", old_));
     expectReopenedAs(holding(old_));
 }
@@ -474,8 +474,8 @@ TEST_F(DualFileFaults, CopyingTheOldBlobFails) {
     const ProcessResult result =
         drive({"writeAt", "10", input(bytesOf("block"))}, faultEnv("write", 1, "errno:EIO", path("1/data")));
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "lib/storage/storage_target:199 Failed to copy old data\nwriteAt: 52\n" +
-                              stateLine(holding(old_)));
+    EXPECT_EQ(result.out,
+              "lib/storage/storage_target:199 Failed to copy old data\nwriteAt: 52\n" + stateLine(holding(old_)));
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data \n" + copyLines("2", old_));
     expectReopenedAs(holding(old_));
 }
@@ -483,8 +483,7 @@ TEST_F(DualFileFaults, CopyingTheOldBlobFails) {
 // A power cut right after the data write: the commit never started.
 TEST_F(DualFileFaults, CrashAfterTheDataWrite) {
     prepare();
-    const ProcessResult result =
-        drive({"write", input(new_)}, faultEnv("open", 1, "crash", path("1/data.chk.tmp")));
+    const ProcessResult result = drive({"write", input(new_)}, faultEnv("open", 1, "crash", path("1/data.chk.tmp")));
     EXPECT_EQ(result.signal, SIGKILL);
     EXPECT_EQ(result.out, "");
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(new_) + "\n" + copyLines("2", old_));
@@ -601,9 +600,7 @@ protected:
     const int64_t future_ = store_test::nowNs() + 3600 * kSecond;
 };
 
-TEST_P(PowerCut, OneShotWrite) {
-    runPlan({{"write", input(new_)}, "write", {holding(old_), holding(new_)}});
-}
+TEST_P(PowerCut, OneShotWrite) { runPlan({{"write", input(new_)}, "write", {holding(old_), holding(new_)}}); }
 
 TEST_P(PowerCut, Erase) { runPlan({{"erase"}, "erase", {holding(old_), absentBlob()}}); }
 

@@ -3,6 +3,7 @@
 // operation. Each runs in a child under a time limit (a wait on a FIFO ends
 // it with SIGALRM), must leave everything outside the store as it was, and
 // must either do what it says or fail with a clear status.
+#include <unistd.h>
 #include <cerrno>
 #include <csignal>
 #include <cstdio>
@@ -12,7 +13,6 @@
 #include <sstream>
 #include <string>
 #include <tuple>
-#include <unistd.h>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -30,8 +30,8 @@ namespace fs = std::filesystem;
 using Storage::DualFileTarget;
 using Storage::TargetSlot;
 using store_test::absentBlob;
-using store_test::bytesOf;
 using store_test::Bytes;
+using store_test::bytesOf;
 using store_test::contentOf;
 using store_test::holding;
 using store_test::patternBytes;
@@ -86,11 +86,13 @@ const Bytes kBlock = patternBytes(64, 90);  // longer than anything stored befor
 
 const std::vector<Operation>& operations() {
     static const std::vector<Operation> all = {
-        {"opening", [](TargetSlot&, int, const SlotContent& before, SlotContent& promised) {
+        {"opening",
+         [](TargetSlot&, int, const SlotContent& before, SlotContent& promised) {
              promised = before;
              return STATUS_OK;
          }},
-        {"query", [](TargetSlot& slot, int, const SlotContent& before, SlotContent& promised) {
+        {"query",
+         [](TargetSlot& slot, int, const SlotContent& before, SlotContent& promised) {
              promised = before;
              uint8_t buffer[16];
              size_t count = 0;
@@ -98,12 +100,14 @@ const std::vector<Operation>& operations() {
              const Status status = slot.readSome(buffer, sizeof buffer, 3, count);
              return status == before.status ? STATUS_OK : STATUS_FAILED;
          }},
-        {"write", [](TargetSlot& slot, int round, const SlotContent&, SlotContent& promised) {
+        {"write",
+         [](TargetSlot& slot, int round, const SlotContent&, SlotContent& promised) {
              const Bytes blob = patternBytes(100 + round, 91 + round);
              promised = holding(blob);
              return writeBlob(slot, blob);
          }},
-        {"writeAt-inside", [](TargetSlot& slot, int, const SlotContent&, SlotContent& promised) {
+        {"writeAt-inside",
+         [](TargetSlot& slot, int, const SlotContent&, SlotContent& promised) {
              promised = holding(Bytes(kBlock.begin(), kBlock.end()));
              Status status = slot.beginWrite();
              if (status == STATUS_OK) status = slot.writeAt(0, kBlock.data(), 32);
@@ -111,17 +115,20 @@ const std::vector<Operation>& operations() {
              const Status finalised = slot.finalise();
              return status != STATUS_OK ? status : finalised;
          }},
-        {"writeAt-outside", [](TargetSlot& slot, int, const SlotContent&, SlotContent& promised) {
+        {"writeAt-outside",
+         [](TargetSlot& slot, int, const SlotContent&, SlotContent& promised) {
              promised = holding(kBlock);
              return slot.writeAt(0, kBlock.data(), kBlock.size());
          }},
-        {"begin-finalise", [](TargetSlot& slot, int, const SlotContent&, SlotContent& promised) {
+        {"begin-finalise",
+         [](TargetSlot& slot, int, const SlotContent&, SlotContent& promised) {
              promised = absentBlob();
              const Status begun = slot.beginWrite();
              const Status finalised = slot.finalise();
              return begun != STATUS_OK ? begun : finalised;
          }},
-        {"erase", [](TargetSlot& slot, int, const SlotContent&, SlotContent& promised) {
+        {"erase",
+         [](TargetSlot& slot, int, const SlotContent&, SlotContent& promised) {
              promised = absentBlob();
              return slot.erase();
          }},
@@ -146,9 +153,7 @@ protected:
     Plant plant() const { return std::get<1>(GetParam()); }
     Reads reads() const { return std::get<2>(GetParam()); }
     fs::path base() const { return dir / "store"; }
-    fs::path slotDirectory() const {
-        return place().slots == 1 ? base() : base() / std::to_string(place().slot);
-    }
+    fs::path slotDirectory() const { return place().slots == 1 ? base() : base() / std::to_string(place().slot); }
 
     // Two committed blobs in the slot used (copy "1" current), one in each
     // other slot, then the plant.
@@ -203,7 +208,8 @@ protected:
                 for (size_t other = 0; other < place().slots; ++other) {
                     if (other == place().slot) continue;
                     const SlotContent content = contentOf(*again.getSlot(other).get());
-                    if (content != holding(old(other))) note("slot " + std::to_string(other) + ": " + describe(content));
+                    if (content != holding(old(other)))
+                        note("slot " + std::to_string(other) + ": " + describe(content));
                 }
             }
             std::fputs(problems.c_str(), stdout);
@@ -230,7 +236,8 @@ TEST_P(HostileTree, EveryOperationStaysInsideTheStoreAndNeverWaits) {
 }
 
 std::string caseName(const ::testing::TestParamInfo<HostileTree::ParamType>& info) {
-    return std::string(kPlaces[std::get<0>(info.param)].name) + "_" + testing_support::plantName(std::get<1>(info.param)) +
+    return std::string(kPlaces[std::get<0>(info.param)].name) + "_" +
+           testing_support::plantName(std::get<1>(info.param)) +
            (std::get<2>(info.param) == Reads::kOpenat2 ? "" : "_through_directories");
 }
 

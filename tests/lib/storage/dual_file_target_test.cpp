@@ -1,5 +1,11 @@
 #include "lib/storage/dual_file_target.h"
 
+#include <sched.h>
+#include <sys/mount.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <unistd.h>
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
@@ -10,14 +16,8 @@
 #include <iterator>
 #include <memory>
 #include <stdexcept>
-#include <sched.h>
 #include <string>
-#include <sys/mount.h>
-#include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/un.h>
 #include <tuple>
-#include <unistd.h>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -40,8 +40,8 @@ using Storage::SlotHandle;
 using Storage::TargetSlot;
 using store_test::absentBlob;
 using store_test::absentCheckFile;
-using store_test::bytesOf;
 using store_test::Bytes;
+using store_test::bytesOf;
 using store_test::contentOf;
 using store_test::copyLines;
 using store_test::describeTree;
@@ -69,9 +69,7 @@ protected:
     fs::path data(int copy) const { return copyDir(copy) / "data"; }
     fs::path check(int copy) const { return copyDir(copy) / "data.chk"; }
 
-    std::unique_ptr<DualFileTarget> open(size_t slots = 1) {
-        return std::make_unique<DualFileTarget>(base(), slots);
-    }
+    std::unique_ptr<DualFileTarget> open(size_t slots = 1) { return std::make_unique<DualFileTarget>(base(), slots); }
     // A fresh one-slot target over the same directory, read at once.
     SlotContent reopened() {
         DualFileTarget target(base(), 1);
@@ -342,8 +340,8 @@ TEST_F(DualFileStore, NeitherCopyValidReadsFailOnCopy0) {
     EXPECT_EQ(slot.read(buffer, sizeof buffer, 0), STATUS_FAILED);
     EXPECT_EQ(slot.readSome(buffer, sizeof buffer, 0, count), STATUS_FAILED);
     EXPECT_EQ(count, 42u);
-    EXPECT_EQ(describeTree(base()),
-              "d 1\nd 2\nf 1/data " + hex(bytesOf("unchecked zero")) + "\nf 2/data " + hex(bytesOf("unchecked one")) + "\n");
+    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(bytesOf("unchecked zero")) + "\nf 2/data " +
+                                        hex(bytesOf("unchecked one")) + "\n");
 }
 
 TEST_F(DualFileStore, ReadsNeverFallBackToTheOtherCopy) {
@@ -565,9 +563,8 @@ TEST_F(DualFileStore, StrayTemporaryFilesDoNotCount) {
     // The next commit into copy 1 replaces the leftover.
     const Bytes next = bytesOf("next");
     EXPECT_EQ(write(slotOf(*target), next), STATUS_OK);
-    EXPECT_EQ(describeTree(base()),
-              "d 1\nd 2\n" + copyLines("1", zero) + "f 1/data.chk.tmp " + hex(bytesOf("junk")) + "\n" +
-                  copyLines("2", next));
+    EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", zero) + "f 1/data.chk.tmp " + hex(bytesOf("junk")) +
+                                        "\n" + copyLines("2", next));
     EXPECT_EQ(reopened(), holding(next));
 }
 
@@ -585,8 +582,8 @@ std::vector<CheckMutation> checkMutations() {
     const Bytes good = expectedCheckFile(bytesOf("newer copy"));
     std::vector<CheckMutation> mutations;
     for (size_t length = 0; length <= good.size(); ++length) {
-        mutations.push_back({"Truncated" + std::to_string(length), Bytes(good.begin(), good.begin() + length),
-                             length == good.size()});
+        mutations.push_back(
+            {"Truncated" + std::to_string(length), Bytes(good.begin(), good.begin() + length), length == good.size()});
     }
     for (size_t i = 0; i < good.size(); ++i) {
         Bytes bytes = good;
@@ -999,9 +996,8 @@ TEST_F(DualFileStore, BeginThenFinaliseCommitsAnAbsentBlob) {
     EXPECT_EQ(write(slot, bytesOf("two")), STATUS_OK);
     // Current is copy 0; copy 1 still holds "one".
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
-    EXPECT_EQ(describeTree(base()),
-              "d 1\nd 2\n" + copyLines("1", bytesOf("two")) + "f 2/data.chk " + hex(expectedCheckFile(bytesOf("one"))) +
-                  "\n");
+    EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", bytesOf("two")) + "f 2/data.chk " +
+                                        hex(expectedCheckFile(bytesOf("one"))) + "\n");
     EXPECT_EQ(contentOf(slot), holding(bytesOf("two")));
     EXPECT_EQ(slot.finalise(), STATUS_OK);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", bytesOf("two")) + "f 2/data.chk ffffffffffffffff\n");
@@ -1113,10 +1109,11 @@ TEST_F(DualFileStore, WriteAtPastTheEndExtends) {
     EXPECT_EQ(writeAt(slot, 8, bytesOf("ABCDE")), STATUS_OK);
     EXPECT_EQ(contentOf(slot), holding(bytesOf("01234567ABCDE")));
     EXPECT_EQ(writeAt(slot, 15, bytesOf("Z")), STATUS_OK);
-    EXPECT_EQ(contentOf(slot), holding(Bytes{'0', '1', '2', '3', '4', '5', '6', '7', 'A', 'B', 'C', 'D', 'E', 0, 0, 'Z'}));
-    EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", bytesOf("01234567ABCDE")) +
-                                        copyLines("2", Bytes{'0', '1', '2', '3', '4', '5', '6', '7', 'A', 'B', 'C',
-                                                             'D', 'E', 0, 0, 'Z'}));
+    EXPECT_EQ(contentOf(slot),
+              holding(Bytes{'0', '1', '2', '3', '4', '5', '6', '7', 'A', 'B', 'C', 'D', 'E', 0, 0, 'Z'}));
+    EXPECT_EQ(describeTree(base()),
+              "d 1\nd 2\n" + copyLines("1", bytesOf("01234567ABCDE")) +
+                  copyLines("2", Bytes{'0', '1', '2', '3', '4', '5', '6', '7', 'A', 'B', 'C', 'D', 'E', 0, 0, 'Z'}));
 }
 
 TEST_F(DualFileStore, WriteAtOnAFreshStoreStartsFromNothing) {
@@ -1194,7 +1191,7 @@ TEST_F(DualFileStore, UnremovableCheckPathFailsTheWrite) {
 TEST_F(DualFileStore, LinkedCopyDirectoryFailsEveryUpdate) {
     {
         auto target = open();
-        EXPECT_EQ(write(slotOf(*target), bytesOf("kept")), STATUS_OK);  // copy 1
+        EXPECT_EQ(write(slotOf(*target), bytesOf("kept")), STATUS_OK);     // copy 1
         EXPECT_EQ(write(slotOf(*target), bytesOf("current")), STATUS_OK);  // copy 0
     }
     // Copy 1's directory becomes a dangling symbolic link.
@@ -1254,9 +1251,8 @@ TEST_F(DualFileStore, TransientFileThatCannotBeCleanedUp) {
                               "lib/storage/storage_target:470 Failed to cleanup check file\n"
                               "write 52\n" +
                               hex(bytesOf("current")) + "\n");
-    EXPECT_EQ(describeTree(base()),
-              "d 1\nd 1/data.chk.tmp\nd 1/data.chk.tmp/inside\nd 2\nf 1/data " + hex(bytesOf("new")) + "\n" +
-                  copyLines("2", bytesOf("current")));
+    EXPECT_EQ(describeTree(base()), "d 1\nd 1/data.chk.tmp\nd 1/data.chk.tmp/inside\nd 2\nf 1/data " +
+                                        hex(bytesOf("new")) + "\n" + copyLines("2", bytesOf("current")));
     EXPECT_EQ(reopened(), holding(bytesOf("current")));
 }
 
@@ -1291,13 +1287,13 @@ TEST_F(DualFileStore, FilesAreCreatedWithMode0666) {
         if (slot.beginWrite() != STATUS_OK) return 4;                          // copy 0
         if (slot.writeAt(0, blob.data(), blob.size()) != STATUS_OK) return 5;
         if (slot.finalise() != STATUS_OK) return 6;
-        if (slot.write(blob.data(), blob.size()) != STATUS_OK) return 7;       // copy 1
+        if (slot.write(blob.data(), blob.size()) != STATUS_OK) return 7;  // copy 1
         return 0;
     });
     ASSERT_EQ(result.exitStatus, 0);
     for (const fs::path& file : {data(0), check(0), data(1), check(1)}) {
-        EXPECT_EQ(fs::status(file).permissions(), fs::perms::all & ~(fs::perms::owner_exec | fs::perms::group_exec |
-                                                                        fs::perms::others_exec))
+        EXPECT_EQ(fs::status(file).permissions(),
+                  fs::perms::all & ~(fs::perms::owner_exec | fs::perms::group_exec | fs::perms::others_exec))
             << file;
     }
 }

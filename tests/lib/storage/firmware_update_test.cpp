@@ -1,18 +1,18 @@
 // The firmware-update targets on a host without the device: everything
 // that happens before "/media/boot" or "/dev/mmcblk0p2" is needed. The rest
 // runs on the simulated device (tests/device/targets).
+#include <fcntl.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <climits>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
-#include <fcntl.h>
 #include <filesystem>
 #include <functional>
 #include <map>
 #include <string>
-#include <sys/resource.h>
-#include <sys/stat.h>
-#include <unistd.h>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -39,8 +39,8 @@ using testing_support::finalisingLines;
 using testing_support::kBootRemountRoCall;
 using testing_support::kBootRemountRwCall;
 using testing_support::needsUpdatingLines;
-using testing_support::ProcessResult;
 using testing_support::normalisedStorageLog;
+using testing_support::ProcessResult;
 using testing_support::runInChild;
 
 using Bytes = std::vector<uint8_t>;
@@ -64,7 +64,9 @@ Bytes pattern(size_t size, uint8_t seed) {
     return bytes;
 }
 
-Status writeAt(TargetSlot& slot, int64_t offset, const Bytes& data) { return slot.writeAt(offset, data.data(), data.size()); }
+Status writeAt(TargetSlot& slot, int64_t offset, const Bytes& data) {
+    return slot.writeAt(offset, data.data(), data.size());
+}
 
 // "<what> <status> valid <0|1>", the slot's validity taken after the call
 // that gave `status`.
@@ -163,10 +165,9 @@ TEST(FirmwareUpdateBoot, BeginOpensAnUnnamedTemporaryFile) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              begunLines("BOOT.BIN", 1) +
-              "begin 0 valid 1\n"
-              "fd #1 (deleted) cloexec 1\n");
+    EXPECT_EQ(normalisedStorageLog(result.out), begunLines("BOOT.BIN", 1) +
+                                                    "begin 0 valid 1\n"
+                                                    "fd #1 (deleted) cloexec 1\n");
 }
 
 TEST(FirmwareUpdateBoot, SecondSlotIsBoot0010) {
@@ -177,10 +178,9 @@ TEST(FirmwareUpdateBoot, SecondSlotIsBoot0010) {
         std::printf("slot 0 valid %d\n", target.getSlot(0)->isValid() ? 1 : 0);
         return 0;
     });
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              begunLines("BOOT0010.BIN", 1) +
-              "begin 0\n"
-              "slot 0 valid 0\n");
+    EXPECT_EQ(normalisedStorageLog(result.out), begunLines("BOOT0010.BIN", 1) +
+                                                    "begin 0\n"
+                                                    "slot 0 valid 0\n");
 }
 
 TEST(FirmwareUpdateBoot, NothingBelowWarningPriority) {
@@ -202,15 +202,14 @@ TEST(FirmwareUpdateBoot, BeginTwiceRestarts) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              begunLines("BOOT.BIN", 1) +
-              "begin 0\n"
-              "writeAt 0\n"
-              "Restarting firmware update!\n"
-              "Closing #1\n" +
-              begunLines("BOOT.BIN", 2) +
-              "begin 0 valid 1\n"
-              "fd #2 (deleted) cloexec 1\n");
+    EXPECT_EQ(normalisedStorageLog(result.out), begunLines("BOOT.BIN", 1) +
+                                                    "begin 0\n"
+                                                    "writeAt 0\n"
+                                                    "Restarting firmware update!\n"
+                                                    "Closing #1\n" +
+                                                    begunLines("BOOT.BIN", 2) +
+                                                    "begin 0 valid 1\n"
+                                                    "fd #2 (deleted) cloexec 1\n");
 }
 
 // The restart's own count starts at 0: nothing received after it means a
@@ -225,11 +224,9 @@ TEST(FirmwareUpdateBoot, RestartForgetsWhatWasReceived) {
         return 0;
     });
     const std::string out = normalisedStorageLog(result.out);
-    EXPECT_EQ(out.substr(out.find("--\n")),
-              "--\n" +
-              finalisingLines("BOOT.BIN", 0) +
-              "Closing #2\n"
-              "finalise 52\n");
+    EXPECT_EQ(out.substr(out.find("--\n")), "--\n" + finalisingLines("BOOT.BIN", 0) +
+                                                "Closing #2\n"
+                                                "finalise 52\n");
 }
 
 TEST(FirmwareUpdateBoot, FinaliseWithNothingReceivedFails) {
@@ -242,13 +239,11 @@ TEST(FirmwareUpdateBoot, FinaliseWithNothingReceivedFails) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              begunLines("BOOT.BIN", 1) +
-              "begin 0\n" +
-              finalisingLines("BOOT.BIN", 0) +
-              "Closing #1\n"
-              "finalise 52 valid 0\n"
-              "finalise 2\n");
+    EXPECT_EQ(normalisedStorageLog(result.out), begunLines("BOOT.BIN", 1) + "begin 0\n" +
+                                                    finalisingLines("BOOT.BIN", 0) +
+                                                    "Closing #1\n"
+                                                    "finalise 52 valid 0\n"
+                                                    "finalise 2\n");
     EXPECT_EQ(fake.calls(), "");
 }
 
@@ -283,15 +278,14 @@ TEST(FirmwareUpdateBoot, EraseAbandonsTheUpdate) {
         std::printf("finalise %u\n", slot.finalise());
         return 0;
     });
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              begunLines("BOOT0010.BIN", 1) +
-              "begin 0\n"
-              "writeAt 0\n"
-              "Closing #1\n"
-              "erase 0 valid 0\n"
-              "erase 95\n"
-              "writeAt 95\n"
-              "finalise 2\n");
+    EXPECT_EQ(normalisedStorageLog(result.out), begunLines("BOOT0010.BIN", 1) +
+                                                    "begin 0\n"
+                                                    "writeAt 0\n"
+                                                    "Closing #1\n"
+                                                    "erase 0 valid 0\n"
+                                                    "erase 95\n"
+                                                    "writeAt 95\n"
+                                                    "finalise 2\n");
 }
 
 // pwrite refuses a negative offset; the errno comes back and the update is
@@ -305,14 +299,13 @@ TEST(FirmwareUpdateBoot, StreamedWriteAfterAFailedOneIsRefused) {
         std::printf("finalise %u\n", slot.finalise());
         return 0;
     });
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              begunLines("BOOT.BIN", 1) +
-              "begin 0\n"
-              "writeAt 0\n"
-              "Closing #1\n"
-              "writeAt 22 valid 0\n"
-              "writeAt 95\n"
-              "finalise 2\n");
+    EXPECT_EQ(normalisedStorageLog(result.out), begunLines("BOOT.BIN", 1) +
+                                                    "begin 0\n"
+                                                    "writeAt 0\n"
+                                                    "Closing #1\n"
+                                                    "writeAt 22 valid 0\n"
+                                                    "writeAt 95\n"
+                                                    "finalise 2\n");
 }
 
 // With the file-size limit at 1 MiB, a block across it is written short
@@ -339,19 +332,18 @@ TEST(FirmwareUpdateBoot, ShortOrFailedStreamedWriteEndsTheUpdate) {
         return 0;
     });
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              begunLines("BOOT.BIN", 1) +
-              "begin 0\n"
-              "writeAt 0\n"
-              "Closing #1\n"
-              "writeAt 52\n"
-              "writeAt 95\n" +
-              begunLines("BOOT.BIN", 2) +
-              "begin 0\n"
-              "Closing #2\n"
-              "writeAt 27\n"
-              "writeAt 95\n"
-              "finalise 2\n");
+    EXPECT_EQ(normalisedStorageLog(result.out), begunLines("BOOT.BIN", 1) +
+                                                    "begin 0\n"
+                                                    "writeAt 0\n"
+                                                    "Closing #1\n"
+                                                    "writeAt 52\n"
+                                                    "writeAt 95\n" +
+                                                    begunLines("BOOT.BIN", 2) +
+                                                    "begin 0\n"
+                                                    "Closing #2\n"
+                                                    "writeAt 27\n"
+                                                    "writeAt 95\n"
+                                                    "finalise 2\n");
 }
 
 // Offsets are the caller's business: the count adds up the block sizes. The
@@ -360,27 +352,27 @@ TEST(FirmwareUpdateBoot, ShortOrFailedStreamedWriteEndsTheUpdate) {
 TEST(FirmwareUpdateBoot, FailedRemountEndsTheUpdate) {
     if (fs::exists("/media/boot")) GTEST_SKIP() << "this host has a /media/boot";
     FakeMountCommands fake;
-    const auto result = onBootSlot(fake, 0, LOG_PRIORITY_INFO, [](TargetSlot& slot) {
-        std::printf("begin %u\n", slot.beginWrite());
-        std::printf("writeAt %u\n", writeAt(slot, 100, pattern(10, 1)));
-        std::printf("writeAt %u\n", writeAt(slot, 0, pattern(7, 2)));
-        std::printf("writeAt %u\n", writeAt(slot, 100, pattern(13, 3)));
-        printWithValidity("finalise", slot.finalise(), slot);
-        printTemporaryDescriptors();
-        return 0;
-    }, {{"FAKE_MOUNT_EXIT", "32"}});
+    const auto result = onBootSlot(fake, 0, LOG_PRIORITY_INFO,
+                                   [](TargetSlot& slot) {
+                                       std::printf("begin %u\n", slot.beginWrite());
+                                       std::printf("writeAt %u\n", writeAt(slot, 100, pattern(10, 1)));
+                                       std::printf("writeAt %u\n", writeAt(slot, 0, pattern(7, 2)));
+                                       std::printf("writeAt %u\n", writeAt(slot, 100, pattern(13, 3)));
+                                       printWithValidity("finalise", slot.finalise(), slot);
+                                       printTemporaryDescriptors();
+                                       return 0;
+                                   },
+                                   {{"FAKE_MOUNT_EXIT", "32"}});
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              begunLines("BOOT.BIN", 1) +
-              "begin 0\n"
-              "writeAt 0\n"
-              "writeAt 0\n"
-              "writeAt 0\n" +
-              finalisingLines("BOOT.BIN", 30) +
-              needsUpdatingLines("BOOT.BIN") +
-              "lib/storage/storage_target:N Failed to execute mount\n"
-              "Closing #1\n"
-              "finalise 52 valid 0\n");
+    EXPECT_EQ(normalisedStorageLog(result.out), begunLines("BOOT.BIN", 1) +
+                                                    "begin 0\n"
+                                                    "writeAt 0\n"
+                                                    "writeAt 0\n"
+                                                    "writeAt 0\n" +
+                                                    finalisingLines("BOOT.BIN", 30) + needsUpdatingLines("BOOT.BIN") +
+                                                    "lib/storage/storage_target:N Failed to execute mount\n"
+                                                    "Closing #1\n"
+                                                    "finalise 52 valid 0\n");
     EXPECT_EQ(fake.calls(), kBootRemountRwCall);
 }
 
@@ -403,16 +395,14 @@ TEST(FirmwareUpdateBoot, UnwritableBootFileIsTriedFiveTimes) {
             "lib/storage/storage_target:N Failed to open BOOT.BIN for writing\n";
     }
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(normalisedStorageLog(result.out),
-              begunLines("BOOT.BIN", 1) +
-              "begin 0\n"
-              "writeAt 0\n" +
-              finalisingLines("BOOT.BIN", 10) +
-              needsUpdatingLines("BOOT.BIN") +
-                  attempts +
-                  "Remounting \"/media/boot\" as ro\n"
-                  "Closing #1\n"
-                  "finalise 52 valid 0\n");
+    EXPECT_EQ(normalisedStorageLog(result.out), begunLines("BOOT.BIN", 1) +
+                                                    "begin 0\n"
+                                                    "writeAt 0\n" +
+                                                    finalisingLines("BOOT.BIN", 10) + needsUpdatingLines("BOOT.BIN") +
+                                                    attempts +
+                                                    "Remounting \"/media/boot\" as ro\n"
+                                                    "Closing #1\n"
+                                                    "finalise 52 valid 0\n");
     EXPECT_EQ(fake.calls(), std::string(kBootRemountRwCall) + kBootRemountRoCall);
 }
 
@@ -457,7 +447,8 @@ TEST(FirmwareUpdateBootHostFaults, EveryAttemptOpensTheBootFileOnce) {
     EXPECT_EQ(countOf(counted.out, "Failed to open /media/boot/BOOT.BIN: No such file or directory\n"), 5u);
     EXPECT_EQ(countOf(counted.out, "finalise 52 valid 0\n"), 1u);
 
-    const ProcessResult failed = drive(testing_support::faultEnv("open", 1, "errno:EIO", "/media/boot/BOOT.BIN", counts));
+    const ProcessResult failed =
+        drive(testing_support::faultEnv("open", 1, "errno:EIO", "/media/boot/BOOT.BIN", counts));
     EXPECT_EQ(failed.exitStatus, 0) << failed.err;
     EXPECT_EQ(testing_support::readFaultCount(counts), 5u);
     EXPECT_EQ(countOf(failed.out, "Failed to open /media/boot/BOOT.BIN: Input/output error\n"), 1u);

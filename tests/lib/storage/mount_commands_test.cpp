@@ -37,7 +37,8 @@ TEST(RemountBootPartition, WritableRunsRemountRw) {
 
 TEST(RemountBootPartition, ReadOnlyRunsRemountRo) {
     FakeMountCommands fake;
-    const auto result = fake.run(LOG_PRIORITY_WARNING, [] { return printStatus(Storage::remountBootPartition(false)); });
+    const auto result =
+        fake.run(LOG_PRIORITY_WARNING, [] { return printStatus(Storage::remountBootPartition(false)); });
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(result.out, "Remounting \"/media/boot\" as ro\nstatus 0\n");
     EXPECT_EQ(fake.calls(), "mount [-o] [remount,ro] [/media/boot]\n");
@@ -55,9 +56,8 @@ TEST(RemountBootPartition, NoNoticeBelowWarningPriority) {
 
 TEST(RemountBootPartition, FailingMountIsFailed) {
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_WARNING, [] { return printStatus(Storage::remountBootPartition(true)); },
-        {{"FAKE_MOUNT_EXIT", "32"}});
+    const auto result = fake.run(LOG_PRIORITY_WARNING, [] { return printStatus(Storage::remountBootPartition(true)); },
+                                 {{"FAKE_MOUNT_EXIT", "32"}});
     EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "Remounting \"/media/boot\" as rw\n"
               "lib/storage/storage_target:N Failed to execute mount\n"
@@ -67,27 +67,25 @@ TEST(RemountBootPartition, FailingMountIsFailed) {
 
 TEST(RemountBootPartition, FailureStillLoggedAtErrorPriority) {
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_ERROR, [] { return printStatus(Storage::remountBootPartition(false)); },
-        {{"FAKE_MOUNT_EXIT", "1"}});
+    const auto result = fake.run(LOG_PRIORITY_ERROR, [] { return printStatus(Storage::remountBootPartition(false)); },
+                                 {{"FAKE_MOUNT_EXIT", "1"}});
     EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "lib/storage/storage_target:N Failed to execute mount\nstatus 52\n");
 }
 
 TEST(RemountBootPartition, NothingLoggedAtCriticalPriority) {
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_CRITICAL, [] { return printStatus(Storage::remountBootPartition(false)); },
-        {{"FAKE_MOUNT_EXIT", "1"}});
+    const auto result =
+        fake.run(LOG_PRIORITY_CRITICAL, [] { return printStatus(Storage::remountBootPartition(false)); },
+                 {{"FAKE_MOUNT_EXIT", "1"}});
     EXPECT_EQ(result.out, "status 52\n");
 }
 
 // Any failure of the command is STATUS_FAILED, a signal too.
 TEST(RemountBootPartition, KilledMountIsFailed) {
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_ERROR, [] { return printStatus(Storage::remountBootPartition(true)); },
-        {{"FAKE_MOUNT_KILL", "1"}});
+    const auto result = fake.run(LOG_PRIORITY_ERROR, [] { return printStatus(Storage::remountBootPartition(true)); },
+                                 {{"FAKE_MOUNT_KILL", "1"}});
     EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "lib/storage/storage_target:N Failed to execute mount\nstatus 52\n");
     EXPECT_EQ(fake.calls(), "mount [-o] [remount,rw] [/media/boot]\n");
@@ -127,9 +125,9 @@ TEST(MountPartition, NoNoticeBelowWarningPriority) {
 
 TEST(MountPartition, FailingMountIsReported) {
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_WARNING, [] { return printStatus(Storage::mountPartition("/media/resources")); },
-        {{"FAKE_MOUNT_EXIT", "32"}});
+    const auto result =
+        fake.run(LOG_PRIORITY_WARNING, [] { return printStatus(Storage::mountPartition("/media/resources")); },
+                 {{"FAKE_MOUNT_EXIT", "32"}});
     EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "Mounting \"/media/resources\"\n"
               "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\n"
@@ -138,26 +136,26 @@ TEST(MountPartition, FailingMountIsReported) {
 
 TEST(MountPartition, FailureStillReportedAtErrorPriority) {
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_ERROR, [] { return printStatus(Storage::mountPartition("/media/resources")); },
-        {{"FAKE_MOUNT_EXIT", "1"}});
+    const auto result =
+        fake.run(LOG_PRIORITY_ERROR, [] { return printStatus(Storage::mountPartition("/media/resources")); },
+                 {{"FAKE_MOUNT_EXIT", "1"}});
     EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n");
 }
 
 TEST(MountPartition, NoReportAtCriticalPriority) {
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_CRITICAL, [] { return printStatus(Storage::mountPartition("/media/resources")); },
-        {{"FAKE_MOUNT_EXIT", "1"}});
+    const auto result =
+        fake.run(LOG_PRIORITY_CRITICAL, [] { return printStatus(Storage::mountPartition("/media/resources")); },
+                 {{"FAKE_MOUNT_EXIT", "1"}});
     EXPECT_EQ(result.out, "status 52\n");
 }
 
 TEST(MountPartition, KilledMountIsNotFound) {
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_WARNING, [] { return printStatus(Storage::mountPartition("/media/resources")); },
-        {{"FAKE_MOUNT_KILL", "1"}});
+    const auto result =
+        fake.run(LOG_PRIORITY_WARNING, [] { return printStatus(Storage::mountPartition("/media/resources")); },
+                 {{"FAKE_MOUNT_KILL", "1"}});
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "Mounting \"/media/resources\"\n"
@@ -173,17 +171,18 @@ TEST(MountPartition, MissingMountCommandIsFailed) {
         setLogOutput(LOG_OUTPUT_STDOUT);
         return printStatus(Storage::mountPartition("/media/resources"));
     });
-    EXPECT_EQ(withoutStorageLineNumbers(result.out),
-              "Mounting \"/media/resources\"\n[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n");
+    EXPECT_EQ(
+        withoutStorageLineNumbers(result.out),
+        "Mounting \"/media/resources\"\n[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n");
 }
 
 // The command's standard output is captured and dropped; its standard
 // error is left alone.
 TEST(MountPartition, CommandOutputIsDiscarded) {
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_WARNING, [] { return printStatus(Storage::mountPartition("/media/resources")); },
-        {{"FAKE_MOUNT_STDOUT", "said on stdout"}, {"FAKE_MOUNT_STDERR", "said on stderr"}});
+    const auto result =
+        fake.run(LOG_PRIORITY_WARNING, [] { return printStatus(Storage::mountPartition("/media/resources")); },
+                 {{"FAKE_MOUNT_STDOUT", "said on stdout"}, {"FAKE_MOUNT_STDERR", "said on stderr"}});
     EXPECT_EQ(result.out, "Mounting \"/media/resources\"\nstatus 0\n");
     EXPECT_EQ(result.err, "said on stderr\n");
 }
@@ -221,9 +220,9 @@ TEST(UnmountPartition, NoNoticeBelowWarningPriority) {
 
 TEST(UnmountPartition, FailingUmountIsReported) {
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_WARNING, [] { return printStatus(Storage::unmountPartition("/media/resources")); },
-        {{"FAKE_MOUNT_EXIT", "32"}});
+    const auto result =
+        fake.run(LOG_PRIORITY_WARNING, [] { return printStatus(Storage::unmountPartition("/media/resources")); },
+                 {{"FAKE_MOUNT_EXIT", "32"}});
     EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "Unmounting \"/media/resources\"\n"
               "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\n"
@@ -233,18 +232,18 @@ TEST(UnmountPartition, FailingUmountIsReported) {
 
 TEST(UnmountPartition, FailureStillReportedAtErrorPriority) {
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_ERROR, [] { return printStatus(Storage::unmountPartition("/media/resources")); },
-        {{"FAKE_MOUNT_EXIT", "1"}});
+    const auto result =
+        fake.run(LOG_PRIORITY_ERROR, [] { return printStatus(Storage::unmountPartition("/media/resources")); },
+                 {{"FAKE_MOUNT_EXIT", "1"}});
     EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n");
 }
 
 TEST(UnmountPartition, KilledUmountIsNotFound) {
     FakeMountCommands fake;
-    const auto result = fake.run(
-        LOG_PRIORITY_WARNING, [] { return printStatus(Storage::unmountPartition("/media/resources")); },
-        {{"FAKE_MOUNT_KILL", "1"}});
+    const auto result =
+        fake.run(LOG_PRIORITY_WARNING, [] { return printStatus(Storage::unmountPartition("/media/resources")); },
+                 {{"FAKE_MOUNT_KILL", "1"}});
     EXPECT_EQ(withoutStorageLineNumbers(result.out),
               "Unmounting \"/media/resources\"\n"
               "[lib/storage/storage_target:N] err_code = 2 (STATUS_NOT_FOUND)\n"

@@ -290,8 +290,7 @@ TEST_F(AdaptorTest, ReadsAreBracketedAndPassResultsThrough) {
     EXPECT_EQ(adaptor->readSome(buffer, 4, 6, count), STATUS_OK);
     EXPECT_EQ(buffer[0], 's');
     EXPECT_EQ(count, 1u);
-    EXPECT_EQ(calls, (Calls{"beforeRead 3", "read 8 5", "afterRead 3", "beforeRead 3", "readSome 4 6",
-                            "afterRead 3"}));
+    EXPECT_EQ(calls, (Calls{"beforeRead 3", "read 8 5", "afterRead 3", "beforeRead 3", "readSome 4 6", "afterRead 3"}));
 }
 
 class AdaptorFailureTest : public AdaptorTest, public ::testing::WithParamInterface<Status> {};
@@ -317,8 +316,7 @@ TEST_P(AdaptorFailureTest, FailuresPassThroughWithAfterCalls) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Statuses, AdaptorFailureTest,
-                         ::testing::Values(STATUS_FAILED, STATUS_INVALID_OPERATION, STATUS_NOT_IMPLEMENTED,
-                                           Status{5}));
+                         ::testing::Values(STATUS_FAILED, STATUS_INVALID_OPERATION, STATUS_NOT_IMPLEMENTED, Status{5}));
 
 TEST_F(AdaptorTest, DestroyingTheAdaptorDestroysAnOwnedInnerSlot) {
     EXPECT_EQ(destroyed, 0);
@@ -333,8 +331,8 @@ TEST(Adaptor, BorrowedInnerSlotSurvivesTheAdaptor) {
     RecordingSlot slot(calls, destroyed);
     RecordingObserver observer(calls);
     {
-        SlotHandle handle = SlotHandle::own(
-            std::make_unique<TargetSlotAdaptor>(SlotHandle::borrow(&slot), 0, observer));
+        SlotHandle handle =
+            SlotHandle::own(std::make_unique<TargetSlotAdaptor>(SlotHandle::borrow(&slot), 0, observer));
         EXPECT_TRUE(handle.ownsSlot());
         EXPECT_EQ(handle->erase(), STATUS_OK);
     }
@@ -352,8 +350,7 @@ TEST(Adaptor, ReleasingAnAdaptorOverATargetSlotKeepsTheSlot) {
     RecordingObserver observer(calls);
     const store_test::Bytes blob = store_test::bytesOf("kept");
     {
-        SlotHandle handle =
-            SlotHandle::own(std::make_unique<TargetSlotAdaptor>(target.getSlot(1), 1, observer));
+        SlotHandle handle = SlotHandle::own(std::make_unique<TargetSlotAdaptor>(target.getSlot(1), 1, observer));
         ASSERT_TRUE(handle);
         EXPECT_EQ(handle->write(blob.data(), blob.size()), STATUS_OK);
     }

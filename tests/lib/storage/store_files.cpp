@@ -1,13 +1,13 @@
 #include "store_files.h"
 
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <algorithm>
 #include <cerrno>
-#include <fcntl.h>
 #include <ostream>
 #include <sstream>
 #include <stdexcept>
-#include <sys/stat.h>
-#include <unistd.h>
 
 namespace store_test {
 namespace fs = std::filesystem;

@@ -1,13 +1,13 @@
 #include "lib/storage/untrusted_tree.h"
 
-#include <cerrno>
-#include <csignal>
 #include <fcntl.h>
-#include <filesystem>
-#include <string>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
+#include <cerrno>
+#include <csignal>
+#include <filesystem>
+#include <string>
 
 #include <gtest/gtest.h>
 

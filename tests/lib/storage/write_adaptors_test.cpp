@@ -1,10 +1,12 @@
 #include "lib/storage/write_adaptors.h"
 
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <atomic>
 #include <condition_variable>
 #include <cstdint>
 #include <cstdlib>
-#include <fcntl.h>
 #include <filesystem>
 #include <functional>
 #include <limits>
@@ -16,9 +18,7 @@
 #include <sstream>
 #include <stdexcept>
 #include <string>
-#include <sys/stat.h>
 #include <thread>
-#include <unistd.h>
 #include <utility>
 #include <vector>
 
@@ -231,9 +231,9 @@ TEST_F(TargetWriteAdaptorTest, GetSlotHandsOutAnOwnedAdaptor) {
         EXPECT_TRUE(third->exists());
         appendLine(eventsPath, "destroying adaptor");
     }
-    EXPECT_EQ(events(), (Lines{"beforeModify 1", "slot 1 write 4", "afterModify 1", "beforeModify 1",
-                               "slot 1 write 4", "afterModify 1", "slot 1 exists", "destroying adaptor",
-                               "slot 0 destroyed", "slot 1 destroyed", "target destroyed"}));
+    EXPECT_EQ(events(), (Lines{"beforeModify 1", "slot 1 write 4", "afterModify 1", "beforeModify 1", "slot 1 write 4",
+                               "afterModify 1", "slot 1 exists", "destroying adaptor", "slot 0 destroyed",
+                               "slot 1 destroyed", "target destroyed"}));
 }
 
 TEST_F(TargetWriteAdaptorTest, IncrementalWritesReachWriteStartedAndWriteEnded) {
@@ -244,9 +244,9 @@ TEST_F(TargetWriteAdaptorTest, IncrementalWritesReachWriteStartedAndWriteEnded) 
     EXPECT_EQ(slot->writeAt(7, blob.data(), blob.size()), STATUS_INVALID_OPERATION);
     EXPECT_EQ(slot->finalise(), STATUS_INVALID_OPERATION);
     EXPECT_EQ(slot->erase(), STATUS_INVALID_OPERATION);
-    EXPECT_EQ(events(), (Lines{"writeStarted 1", "slot 1 beginWrite", "beforeModify 1", "slot 1 writeAt 7 4",
-                               "afterModify 1", "slot 1 finalise", "writeEnded 1", "beforeModify 1",
-                               "slot 1 erase", "afterModify 1"}));
+    EXPECT_EQ(events(),
+              (Lines{"writeStarted 1", "slot 1 beginWrite", "beforeModify 1", "slot 1 writeAt 7 4", "afterModify 1",
+                     "slot 1 finalise", "writeEnded 1", "beforeModify 1", "slot 1 erase", "afterModify 1"}));
 }
 
 TEST_F(TargetWriteAdaptorTest, ReadsAndQueriesAreNotWrites) {
@@ -391,9 +391,8 @@ class SingleCallTest : public PartitionWriteAdaptorTest, public ::testing::WithP
 TEST_P(SingleCallTest, RemountsAroundTheCall) {
     const SingleCallCase& row = GetParam();
     // A fresh store writes into copy 1, "2/data".
-    installFakeMount(0, {{"data", storePath / "2/data"},
-                         {"chk", storePath / "2/data.chk"},
-                         {"tmp", storePath / "2/data.chk.tmp"}});
+    installFakeMount(
+        0, {{"data", storePath / "2/data"}, {"chk", storePath / "2/data.chk"}, {"tmp", storePath / "2/data.chk.tmp"}});
     const ProcessResult result = run([&] {
         PartitionWriteAdaptor<DualFileTarget> store(mountPoint, storePath, 1);
         SlotHandle slot = store.getSlot(0);
@@ -404,8 +403,7 @@ TEST_P(SingleCallTest, RemountsAroundTheCall) {
     expectCleanExit(result);
     EXPECT_EQ(result.out, "");
     EXPECT_EQ(events(), (Lines{"calling " + row.name, remount("rw") + " -data -chk -tmp",
-                               remount("ro") + " " + row.filesAfter, row.name + " -> 0",
-                               "releasing the adaptor"}));
+                               remount("ro") + " " + row.filesAfter, row.name + " -> 0", "releasing the adaptor"}));
     DualFileTarget reopened(storePath, 1);
     EXPECT_EQ(store_test::contentOf(*reopened.getSlot(0).get()), row.contentAfter);
 }
@@ -478,8 +476,8 @@ TEST_F(PartitionWriteAdaptorTest, FailedBeginWriteOnTheStoreStillRemounts) {
     // Opening the store already trips over the file.
     EXPECT_EQ(splitLines(result.out), (Lines{"lib/storage/storage_target:334 Failure cleaning up checkfile \"" +
                                              (storePath / "2/data.chk").string() + "\""}));
-    EXPECT_EQ(events(), (Lines{remount("rw"), "begin 0 -> 20", "destroying adaptor", remount("ro"),
-                               "adaptor destroyed"}));
+    EXPECT_EQ(events(),
+              (Lines{remount("rw"), "begin 0 -> 20", "destroying adaptor", remount("ro"), "adaptor destroyed"}));
 }
 
 TEST_F(PartitionWriteAdaptorTest, DestroyingTheAdaptorDuringAWriteRemountsReadOnly) {
@@ -533,9 +531,9 @@ TEST_F(PartitionWriteAdaptorTest, NestedStartsOnOneSlotAreCounted) {
     expectCleanExit(result);
     EXPECT_EQ(splitLines(result.out), (Lines{notActiveWarning(0)}));
     EXPECT_EQ(events(), (Lines{remount("rw"), "slot 0 beginWrite", "begin -> 0", "slot 0 beginWrite", "begin -> 0",
-                               "slot 0 write 12", "write -> 0", "slot 0 finalise", "finalise -> 0",
-                               "slot 0 finalise", remount("ro"), "finalise -> 0", "slot 0 finalise",
-                               "finalise -> 0", "slot 0 destroyed", "target destroyed"}));
+                               "slot 0 write 12", "write -> 0", "slot 0 finalise", "finalise -> 0", "slot 0 finalise",
+                               remount("ro"), "finalise -> 0", "slot 0 finalise", "finalise -> 0", "slot 0 destroyed",
+                               "target destroyed"}));
 }
 
 TEST_F(PartitionWriteAdaptorTest, ReadsAndQueriesDoNotRemount) {
@@ -552,9 +550,9 @@ TEST_F(PartitionWriteAdaptorTest, ReadsAndQueriesDoNotRemount) {
     });
     expectCleanExit(result);
     EXPECT_EQ(result.out, "");
-    EXPECT_EQ(events(), (Lines{"slot 0 read", "read -> 0", "slot 0 readSome", "readSome -> 0", "slot 0 exists",
-                               "exists true", "slot 0 isValid", "isValid false", "slot 0 destroyed",
-                               "target destroyed"}));
+    EXPECT_EQ(events(),
+              (Lines{"slot 0 read", "read -> 0", "slot 0 readSome", "readSome -> 0", "slot 0 exists", "exists true",
+                     "slot 0 isValid", "isValid false", "slot 0 destroyed", "target destroyed"}));
 }
 
 TEST_F(PartitionWriteAdaptorTest, RemoveAllSlotsRefusesWithoutRemount) {
@@ -567,8 +565,8 @@ TEST_F(PartitionWriteAdaptorTest, RemoveAllSlotsRefusesWithoutRemount) {
     });
     expectCleanExit(result);
     EXPECT_EQ(result.out, "");
-    EXPECT_EQ(events(), (Lines{"removeAllSlots -> 38", "count 2", "slot 2 null", "slot 0 destroyed",
-                               "slot 1 destroyed", "target destroyed"}));
+    EXPECT_EQ(events(), (Lines{"removeAllSlots -> 38", "count 2", "slot 2 null", "slot 0 destroyed", "slot 1 destroyed",
+                               "target destroyed"}));
 }
 
 // The same over the dual-file store, as the registry builds it: its blobs
@@ -609,9 +607,9 @@ TEST_P(FailingRemountTest, IsLoggedAndTheWriteGoesOn) {
               (Lines{failedToSet(quotedMountPoint(), true), failedToSet(quotedMountPoint(), false),
                      failedToSet(quotedMountPoint(), true), failedToSet(quotedMountPoint(), false)}));
     const std::string status = std::to_string(inner);
-    EXPECT_EQ(events(), (Lines{remount("rw"), "slot 0 write 12", remount("ro"), "write -> " + status, remount("rw"),
-                               "slot 0 erase", remount("ro"), "erase -> " + status, "slot 0 destroyed",
-                               "target destroyed"}));
+    EXPECT_EQ(events(),
+              (Lines{remount("rw"), "slot 0 write 12", remount("ro"), "write -> " + status, remount("rw"),
+                     "slot 0 erase", remount("ro"), "erase -> " + status, "slot 0 destroyed", "target destroyed"}));
 }
 
 INSTANTIATE_TEST_SUITE_P(InnerStatuses, FailingRemountTest, ::testing::Values(STATUS_OK, Status{30}));
@@ -626,8 +624,8 @@ TEST_F(PartitionWriteAdaptorTest, FailingRemountAtDestructionIsLogged) {
     expectCleanExit(result);
     EXPECT_EQ(maskedOutput(result.out),
               (Lines{failedToSet(quotedMountPoint(), true), failedToSet(quotedMountPoint(), false)}));
-    EXPECT_EQ(events(), (Lines{remount("rw"), "slot 0 beginWrite", "begin -> 0", "slot 0 destroyed",
-                               "target destroyed", remount("ro")}));
+    EXPECT_EQ(events(), (Lines{remount("rw"), "slot 0 beginWrite", "begin -> 0", "slot 0 destroyed", "target destroyed",
+                               remount("ro")}));
 }
 
 TEST_F(PartitionWriteAdaptorTest, ThresholdDecidesWhatIsLogged) {

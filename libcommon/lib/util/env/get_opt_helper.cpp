@@ -65,8 +65,8 @@ Status GetOptHelper::parse(int argc, char** argv) {
         if (row != nullptr && row->kind == OptionKind::Choice) {
             if (optarg == nullptr) throw std::logic_error("choice option without an argument");
             const auto value = row->values.find(optarg);
-            const Status r = value != row->values.end() ? handleChoice(ch, optarg, value->second)
-                                                         : invalidChoice(ch, optarg);
+            const Status r =
+                value != row->values.end() ? handleChoice(ch, optarg, value->second) : invalidChoice(ch, optarg);
             if (r != STATUS_OK) return r;
             continue;
         }

@@ -103,6 +103,5 @@ protected:
 
 private:
     const OptionSpec* findRow(int id) const;
-    static void writeWrapped(std::ostream& out, const char* text, unsigned col, unsigned helpColumn,
-                             unsigned width);
+    static void writeWrapped(std::ostream& out, const char* text, unsigned col, unsigned helpColumn, unsigned width);
 };

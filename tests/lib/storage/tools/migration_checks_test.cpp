@@ -75,23 +75,22 @@ Block withLength(Block block, uint16_t declared) {
     return block;
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Boundaries, SettingsCheck,
-    ::testing::Values(CheckRow{"empty", Block{}, STATUS_INVALID_PARAMETER, 0},
-                      CheckRow{"size3", settingsBlock(3, 3), STATUS_INVALID_PARAMETER, 3},
-                      CheckRow{"size6", settingsBlock(6, 6), STATUS_INVALID_PARAMETER, 6},
-                      CheckRow{"size4_L4", settingsBlock(4, 4), STATUS_OK, 4},
-                      CheckRow{"size8_L6", settingsBlock(8, 6), STATUS_OK, 6},
-                      CheckRow{"size8_L8", settingsBlock(8, 8), STATUS_OK, 8},
-                      CheckRow{"size8_L9", settingsBlock(8, 9), STATUS_OVERFLOW, 8},
-                      CheckRow{"size8_L12", settingsBlock(8, 12), STATUS_OVERFLOW, 8},
-                      CheckRow{"L0", settingsBlock(8, 0), STATUS_OVERFLOW, 8},
-                      CheckRow{"L1", settingsBlock(8, 1), STATUS_OVERFLOW, 8},
-                      CheckRow{"L2_never_passes", settingsBlock(8, 2), STATUS_FAILED, 8},
-                      CheckRow{"L3", withLength(settingsBlock(8, 3), 3), STATUS_FAILED, 8},
-                      CheckRow{"bad_checksum", settingsBlock(8, 6, false), STATUS_FAILED, 8},
-                      CheckRow{"large", settingsBlock(19784, 19000), STATUS_OK, 19000}),
-    [](const auto& info) { return std::string(info.param.name); });
+INSTANTIATE_TEST_SUITE_P(Boundaries, SettingsCheck,
+                         ::testing::Values(CheckRow{"empty", Block{}, STATUS_INVALID_PARAMETER, 0},
+                                           CheckRow{"size3", settingsBlock(3, 3), STATUS_INVALID_PARAMETER, 3},
+                                           CheckRow{"size6", settingsBlock(6, 6), STATUS_INVALID_PARAMETER, 6},
+                                           CheckRow{"size4_L4", settingsBlock(4, 4), STATUS_OK, 4},
+                                           CheckRow{"size8_L6", settingsBlock(8, 6), STATUS_OK, 6},
+                                           CheckRow{"size8_L8", settingsBlock(8, 8), STATUS_OK, 8},
+                                           CheckRow{"size8_L9", settingsBlock(8, 9), STATUS_OVERFLOW, 8},
+                                           CheckRow{"size8_L12", settingsBlock(8, 12), STATUS_OVERFLOW, 8},
+                                           CheckRow{"L0", settingsBlock(8, 0), STATUS_OVERFLOW, 8},
+                                           CheckRow{"L1", settingsBlock(8, 1), STATUS_OVERFLOW, 8},
+                                           CheckRow{"L2_never_passes", settingsBlock(8, 2), STATUS_FAILED, 8},
+                                           CheckRow{"L3", withLength(settingsBlock(8, 3), 3), STATUS_FAILED, 8},
+                                           CheckRow{"bad_checksum", settingsBlock(8, 6, false), STATUS_FAILED, 8},
+                                           CheckRow{"large", settingsBlock(19784, 19000), STATUS_OK, 19000}),
+                         [](const auto& info) { return std::string(info.param.name); });
 
 TEST(SettingsCheck, TwoLengthBytesOnlyAreTheLength) {
     // Bytes 2 and 3 belong to the contents, not to the length.
@@ -114,20 +113,20 @@ TEST_P(LutCheck, StatusAndLength) {
     EXPECT_EQ(length, row.expectedLength);
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Boundaries, LutCheck,
-    ::testing::Values(CheckRow{"empty", Block{}, STATUS_INVALID_PARAMETER, 0},
-                      CheckRow{"size3", lutBlock(3), STATUS_INVALID_PARAMETER, 3},
-                      CheckRow{"size4", lutBlock(4), STATUS_FAILED, 4},
-                      CheckRow{"size19783", lutBlock(19783), STATUS_FAILED, 19783},
-                      CheckRow{"size19784", lutBlock(19784), STATUS_OK, 19784},
-                      CheckRow{"size30000", lutBlock(30000), STATUS_OK, 30000},
-                      CheckRow{"zero_word", lutBlock(19784, 0, 0, 0), STATUS_NOT_FOUND, 19784},
-                      CheckRow{"version3", lutBlock(19784, 0x80, 0x11, 3), STATUS_FAILED, 19784},
-                      CheckRow{"version0x102", lutBlock(19784, 0x80, 0x11, 0x102), STATUS_FAILED, 19784},
-                      CheckRow{"wrong_type", lutBlock(19784, 0x81), STATUS_FAILED, 19784},
-                      CheckRow{"wrong_second", lutBlock(19784, 0x80, 0x12), STATUS_FAILED, 19784}),
-    [](const auto& info) { return std::string(info.param.name); });
+INSTANTIATE_TEST_SUITE_P(Boundaries, LutCheck,
+                         ::testing::Values(CheckRow{"empty", Block{}, STATUS_INVALID_PARAMETER, 0},
+                                           CheckRow{"size3", lutBlock(3), STATUS_INVALID_PARAMETER, 3},
+                                           CheckRow{"size4", lutBlock(4), STATUS_FAILED, 4},
+                                           CheckRow{"size19783", lutBlock(19783), STATUS_FAILED, 19783},
+                                           CheckRow{"size19784", lutBlock(19784), STATUS_OK, 19784},
+                                           CheckRow{"size30000", lutBlock(30000), STATUS_OK, 30000},
+                                           CheckRow{"zero_word", lutBlock(19784, 0, 0, 0), STATUS_NOT_FOUND, 19784},
+                                           CheckRow{"version3", lutBlock(19784, 0x80, 0x11, 3), STATUS_FAILED, 19784},
+                                           CheckRow{"version0x102", lutBlock(19784, 0x80, 0x11, 0x102), STATUS_FAILED,
+                                                    19784},
+                                           CheckRow{"wrong_type", lutBlock(19784, 0x81), STATUS_FAILED, 19784},
+                                           CheckRow{"wrong_second", lutBlock(19784, 0x80, 0x12), STATUS_FAILED, 19784}),
+                         [](const auto& info) { return std::string(info.param.name); });
 
 std::string lutLog(const Block& block, uint32_t slotIndex) {
     return runInChild([&] {

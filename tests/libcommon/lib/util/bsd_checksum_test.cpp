@@ -71,8 +71,7 @@ TEST(BsdChecksum16, SplitComputationCarriesSeedThrough) {
     const uint16_t whole = bsdChecksum16(0x1234, data.data(), static_cast<uint32_t>(data.size()));
     for (size_t split = 0; split <= data.size(); ++split) {
         const uint16_t first = bsdChecksum16(0x1234, data.data(), static_cast<uint32_t>(split));
-        const uint16_t rest =
-            bsdChecksum16(first, data.data() + split, static_cast<uint32_t>(data.size() - split));
+        const uint16_t rest = bsdChecksum16(first, data.data() + split, static_cast<uint32_t>(data.size() - split));
         ASSERT_EQ(rest, whole) << "split at " << split;
     }
 }
@@ -95,8 +94,7 @@ TEST(BsdChecksum16, KnownVectors) {
         {"text", 0x0000, bytesOf("The quick brown fox jumps over the lazy dog"), 0xC56E},
     };
     for (const Vector& v : vectors) {
-        EXPECT_EQ(bsdChecksum16(v.seed, v.data.data(), static_cast<uint32_t>(v.data.size())), v.expected)
-            << v.name;
+        EXPECT_EQ(bsdChecksum16(v.seed, v.data.data(), static_cast<uint32_t>(v.data.size())), v.expected) << v.name;
     }
 }
 

@@ -147,8 +147,8 @@ TEST(Crc32, IncrementalAtRandomSplitsMatchesOneShot) {
 // The way a file is checksummed: whole 4096-byte blocks and a short tail.
 TEST(Crc32, BlocksOf4096MatchOneShot) {
     std::mt19937 random(4096u);
-    for (const size_t length : {size_t{0}, size_t{1}, size_t{4095}, size_t{4096}, size_t{4097}, size_t{8192},
-                                size_t{3 * 4096 + 123}}) {
+    for (const size_t length :
+         {size_t{0}, size_t{1}, size_t{4095}, size_t{4096}, size_t{4097}, size_t{8192}, size_t{3 * 4096 + 123}}) {
         const Bytes data = randomBytes(random, length);
         uint32_t state = kCrc32Initial;
         for (size_t at = 0; at < length; at += 4096) {
@@ -228,7 +228,8 @@ TEST_P(Crc32Path, AnyStartingStateMatchesTheTables) {
     std::mt19937 random(99u);
     const Bytes buffer = randomBytes(random, 5000);
     for (const uint32_t state : {0u, 1u, 0x80000000u, 0xDEADBEEFu, kCrc32Initial}) {
-        for (const size_t length : {size_t{0}, size_t{3}, size_t{64}, size_t{127}, size_t{128}, size_t{129}, size_t{4999}}) {
+        for (const size_t length :
+             {size_t{0}, size_t{3}, size_t{64}, size_t{127}, size_t{128}, size_t{129}, size_t{4999}}) {
             ASSERT_EQ(GetParam().update(state, buffer.data() + 1, length),
                       Crc32Paths::updateTable(state, buffer.data() + 1, length))
                 << "state " << state << " length " << length;

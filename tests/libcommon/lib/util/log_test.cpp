@@ -1,20 +1,20 @@
 #include "lib/util/log.h"
 
-#include <cerrno>
-#include <cstdio>
-#include <cstdlib>
-#include <cstring>
 #include <fcntl.h>
-#include <functional>
 #include <sched.h>
-#include <sstream>
-#include <string>
 #include <sys/mount.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <syslog.h>
-#include <thread>
 #include <unistd.h>
+#include <cerrno>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <functional>
+#include <sstream>
+#include <string>
+#include <thread>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -109,16 +109,14 @@ TEST(LogThreshold, DefaultWritesPrioritiesTwoToFour) {
 
 TEST(LogThreshold, LevelSevenWritesAll) {
     const ProcessResult result = logInChild(LOG_OUTPUT_STDOUT, 7, logAtPriorities);
-    EXPECT_EQ(result.out,
-              "priority 2\npriority 3\npriority 4\npriority 5\npriority 6\npriority 7\n" + kThisFile +
-                  ":1 error\nwarning\ninfo\ndebug\n");
+    EXPECT_EQ(result.out, "priority 2\npriority 3\npriority 4\npriority 5\npriority 6\npriority 7\n" + kThisFile +
+                              ":1 error\nwarning\ninfo\ndebug\n");
 }
 
 TEST(LogThreshold, LevelSixWritesAllButDebug) {
     const ProcessResult result = logInChild(LOG_OUTPUT_STDOUT, 6, logAtPriorities);
     EXPECT_EQ(result.out,
-              "priority 2\npriority 3\npriority 4\npriority 5\npriority 6\n" + kThisFile +
-                  ":1 error\nwarning\ninfo\n");
+              "priority 2\npriority 3\npriority 4\npriority 5\npriority 6\n" + kThisFile + ":1 error\nwarning\ninfo\n");
 }
 
 TEST(LogThreshold, LevelTwoWritesOnlyCritical) {
@@ -221,7 +219,8 @@ TEST(LogLines, EmbeddedNewlineGivesTwoLines) {
 TEST(LogLines, TrailingNewlineIsNotDoubled) {
     const ProcessResult result = recordInChild(LOG_OUTPUT_STDERR, 4, [] {
         LOGW << "done\n";
-        LOGW << "split" << "\n";
+        LOGW << "split"
+             << "\n";
         LOGW << "endl" << std::endl;
     });
     EXPECT_EQ(result.out, "{done\n}{split\n}{endl\n}");
@@ -255,9 +254,13 @@ TEST(LogLines, SeveralNewlinesInOnePiece) {
 
 TEST(LogLines, PartialLineThenRest) {
     const ProcessResult result = recordInChild(LOG_OUTPUT_STDERR, 4, [] {
-        LOGW << "par" << "tial\nrest\nmore";
-        LOGW << "ab" << "cd" << 'e' << 42;
-        LOGW << "x" << "y\n" << "z\n";
+        LOGW << "par"
+             << "tial\nrest\nmore";
+        LOGW << "ab"
+             << "cd" << 'e' << 42;
+        LOGW << "x"
+             << "y\n"
+             << "z\n";
     });
     EXPECT_EQ(result.out, "{partial\n}{rest\n}{more\n}{abcde42\n}{xy\n}{z\n}");
 }
@@ -282,8 +285,8 @@ TEST(LogLines, LongLinesArriveWhole) {
         LOGW << threeThousand;
         LOGW << "short";
     });
-    EXPECT_EQ(result.out, "{" + eighty + "\n}{" + eighty + "!\n}{" + threeHundred + "\n}{" + threeThousand +
-                              "\n}{short\n}");
+    EXPECT_EQ(result.out,
+              "{" + eighty + "\n}{" + eighty + "!\n}{" + threeHundred + "\n}{" + threeThousand + "\n}{short\n}");
 }
 
 TEST(LogLines, VeryLongLineInPieces) {
@@ -407,8 +410,8 @@ TEST(LogFormat, FlagsAreRestoredAfterEachStatement) {
         LOGE_AT(12) << std::hex << 10;
         LOGE_AT(12) << 10;
     });
-    EXPECT_EQ(result.out, "0x10 0x11\n16\n0XFF true\n0xff\n1\nff\n0xff\n" + kThisFile + ":12 0xa\n" + kThisFile +
-                              ":12 10\n");
+    EXPECT_EQ(result.out,
+              "0x10 0x11\n16\n0XFF true\n0xff\n1\nff\n0xff\n" + kThisFile + ":12 0xa\n" + kThisFile + ":12 10\n");
 }
 
 // ---------------------------------------------------------------------------
@@ -548,26 +551,25 @@ ProcessResult syslogInChild(int threshold, const std::function<void()>& body) {
         std::vector<char> buffer(1 << 16);
         ssize_t length;
         while ((length = recv(sock, buffer.data(), buffer.size(), MSG_DONTWAIT)) >= 0) {
-            const std::string text =
-                describeDatagram(std::string(buffer.data(), static_cast<size_t>(length)));
+            const std::string text = describeDatagram(std::string(buffer.data(), static_cast<size_t>(length)));
             std::fwrite(text.data(), 1, text.size(), stdout);
         }
         return errno == EAGAIN ? 0 : 95;
     });
 }
 
-#define SKIP_UNLESS_ROOT()                                                                       \
-    if (geteuid() != 0) {                                                                        \
+#define SKIP_UNLESS_ROOT()                                                                          \
+    if (geteuid() != 0) {                                                                           \
         GTEST_SKIP() << "needs root to give a child its own /dev/log in a private mount namespace"; \
     }
 
-#define SKIP_IF_UNSHARE_REFUSED(result)                                                                  \
-    if ((result).exitStatus == kUnsharePermissionDenied) {                                              \
-        GTEST_SKIP() << "unshare(CLONE_NEWNS) refused with EPERM in this environment";                  \
-    }                                                                                                   \
-    if ((result).exitStatus == kNoMountToMakePrivate) {                                                 \
+#define SKIP_IF_UNSHARE_REFUSED(result)                                                                   \
+    if ((result).exitStatus == kUnsharePermissionDenied) {                                                \
+        GTEST_SKIP() << "unshare(CLONE_NEWNS) refused with EPERM in this environment";                    \
+    }                                                                                                     \
+    if ((result).exitStatus == kNoMountToMakePrivate) {                                                   \
         GTEST_SKIP() << "neither / nor /dev is a mount point here (a chroot?): a private /dev/log would " \
-                        "show outside the test";                                                        \
+                        "show outside the test";                                                          \
     }
 
 TEST(LogSyslog, CriticalGoesToSyslogAndStandardErrorErrorOnlyToSyslog) {
@@ -597,8 +599,9 @@ TEST(LogSyslog, StatementsCarryTheirPriority) {
     });
     SKIP_IF_UNSHARE_REFUSED(result);
     ASSERT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(result.out, "{10|crit\n}{11|" + kThisFile + ":12 err\n}{12|warn\n}{14|info\n}{15|debug\n}{14|a\n}{14|b\n}"
-                          "{14|bare\n}");
+    EXPECT_EQ(result.out, "{10|crit\n}{11|" + kThisFile +
+                              ":12 err\n}{12|warn\n}{14|info\n}{15|debug\n}{14|a\n}{14|b\n}"
+                              "{14|bare\n}");
     EXPECT_EQ(result.err, "crit\n");
 }
 

@@ -1,12 +1,12 @@
 #include "lib/util/run_command.h"
 
-#include <csignal>
-#include <cstdio>
 #include <fcntl.h>
-#include <functional>
-#include <string>
 #include <sys/resource.h>
 #include <unistd.h>
+#include <csignal>
+#include <cstdio>
+#include <functional>
+#include <string>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -121,8 +121,8 @@ TEST(RunCommand, LargeOutput) {
 }
 
 // Child's standard output carries "<status>|<output>".
-ProcessResult runInChildReporting(const std::string& command, bool ignoreStatus,
-                                  const std::function<bool()>& prepare = [] { return true; }) {
+ProcessResult runInChildReporting(
+    const std::string& command, bool ignoreStatus, const std::function<bool()>& prepare = [] { return true; }) {
     return runInChild([&] {
         if (!prepare()) return 90;
         std::string output = "untouched";

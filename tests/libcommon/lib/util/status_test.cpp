@@ -2,11 +2,11 @@
 
 #include <cerrno>
 #include <filesystem>
+#include <functional>
 #include <future>
 #include <ios>
-#include <system_error>
-#include <functional>
 #include <string>
+#include <system_error>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -108,8 +108,8 @@ TEST(StatusReport, FixedLineReportNamesThisFile) {
 TEST(StatusReport, ReportCarriesTheSourceLine) {
     const ProcessResult result = reportInChild(4, [] { LOG_STATUS(STATUS_FAILED); });
     const int line = __LINE__ - 1;
-    EXPECT_EQ(result.out, "[tests/libcommon/lib/util/status_test:" + std::to_string(line) +
-                              "] err_code = 52 (STATUS_FAILED)\n");
+    EXPECT_EQ(result.out,
+              "[tests/libcommon/lib/util/status_test:" + std::to_string(line) + "] err_code = 52 (STATUS_FAILED)\n");
 }
 
 TEST(StatusReport, ExplicitSourcePath) {

@@ -26,8 +26,7 @@ using Kind = GetOptHelper::OptionKind;
 
 const Kind kUnknownKind = static_cast<Kind>(9);
 
-Row row(int32_t id, const char* name, int32_t hasArg, Kind kind, const char* help = "",
-         const char* defaultValue = "") {
+Row row(int32_t id, const char* name, int32_t hasArg, Kind kind, const char* help = "", const char* defaultValue = "") {
     return Row{id, name, defaultValue, hasArg, help, kind, {}, nullptr};
 }
 
@@ -168,15 +167,11 @@ TEST(GetOptHelperTables, EmptyTableParseCallsEndOfOptionsThenFinishWithAllArgume
 // both option tables are built from.
 std::vector<Row> mixedTable(uint8_t* seen) {
     return {
-        row('a', "alpha", 0, Kind::Plain),
-        row('b', nullptr, 1, Kind::Plain),
+        row('a', "alpha", 0, Kind::Plain),       row('b', nullptr, 1, Kind::Plain),
         row('c', "gamma", 2, Kind::Plain),  // optional argument: one ':' only
-        choiceRow(1000, "thousand", {{"x", 1}}),
-        flagRow('d', "delta", seen),
-        row('t', "text", 1, Kind::Text),
-        row('u', "unknown", 1, kUnknownKind),
-        choiceRow('e', "", {{"y", 2}}),
-        row(7, "bell", 0, Kind::Plain),
+        choiceRow(1000, "thousand", {{"x", 1}}), flagRow('d', "delta", seen),
+        row('t', "text", 1, Kind::Text),         row('u', "unknown", 1, kUnknownKind),
+        choiceRow('e', "", {{"y", 2}}),          row(7, "bell", 0, Kind::Plain),
         row(200, "high", 1, Kind::Plain),
     };
 }
@@ -197,8 +192,8 @@ TEST(GetOptHelperTables, LongOptionsHoldNamedRegisteredRowsWithNullFlagAndEndWit
         int val;
     };
     const std::vector<Expected> expected = {
-        {table[0].name, 0, 'a'},    {table[2].name, 2, 'c'}, {table[3].name, 1, 1000},
-        {table[4].name, 0, 'd'},    {table[8].name, 0, 7},   {table[9].name, 1, 200},
+        {table[0].name, 0, 'a'}, {table[2].name, 2, 'c'}, {table[3].name, 1, 1000},
+        {table[4].name, 0, 'd'}, {table[8].name, 0, 7},   {table[9].name, 1, 200},
     };
     ASSERT_EQ(helper.longOptions.size(), expected.size() + 1);
     for (size_t i = 0; i < expected.size(); ++i) {
@@ -353,9 +348,9 @@ TEST(GetOptHelperParse, ChoiceHitCallsHandleChoiceWithItsValue) {
 
 TEST(GetOptHelperParse, ChoiceMissCallsInvalidChoiceWithExactMatchingOnly) {
     ChoiceRecorder helper(kChoiceSpecs);
-    EXPECT_EQ(helper.parseArgs({"prog", "--type=bogus", "--type", "Simple", "--type", "simple ", "--type", "",
-                                "-k", "lu"}),
-              STATUS_OK);
+    EXPECT_EQ(
+        helper.parseArgs({"prog", "--type=bogus", "--type", "Simple", "--type", "simple ", "--type", "", "-k", "lu"}),
+        STATUS_OK);
     EXPECT_EQ(helper.eventText(),
               "invalid 1000 bogus\n"
               "invalid 1000 Simple\n"
@@ -444,8 +439,7 @@ TEST(GetOptHelperParse, FlagRowWithNullFlagIsAcceptedWithoutEffect) {
 }
 
 TEST(GetOptHelperParse, TextAndUnknownKindRowsAreNotOptions) {
-    const std::vector<Row> table = {row('t', "text", 0, Kind::Text, "Heading\n"),
-                                     row('u', "unknown", 0, kUnknownKind)};
+    const std::vector<Row> table = {row('t', "text", 0, Kind::Text, "Heading\n"), row('u', "unknown", 0, kUnknownKind)};
     const ProcessResult result = parseInChild(table, {"prog", "-t", "--unknown"});
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(result.out, "option 63 <null>\noption 63 <null>\noption -1 <null>\nfinish\n");
@@ -457,7 +451,7 @@ TEST(GetOptHelperParse, FirstRowWithTheIdDecidesTheKind) {
     // 'a' is registered by its Plain row but the Text row comes first, so
     // the option is ignored; 'b' is Plain first and reaches handleOption.
     const std::vector<Row> table = {row('a', "", 0, Kind::Text, "Heading\n"), row('a', "alpha", 0, Kind::Plain),
-                                     row('b', "bee", 0, Kind::Plain), row('b', "", 0, kUnknownKind)};
+                                    row('b', "bee", 0, Kind::Plain), row('b', "", 0, kUnknownKind)};
     RecordingHelper helper(table);
     EXPECT_EQ(helper.parseArgs({"prog", "-a", "--alpha", "-b"}), STATUS_OK);
     EXPECT_EQ(helper.eventText(), "option 98 <null>\noption -1 <null>\nfinish\n");
@@ -468,8 +462,8 @@ TEST(GetOptHelperParse, FirstRowWithTheIdDecidesTheKind) {
 
 TEST(GetOptHelperOptFor, FindsTheFirstRowWithTheCharacterAsId) {
     const std::vector<Row> table = {row('b', "base", 1, Kind::Plain, "first", "/var/x"),
-                                     row('b', "other", 1, Kind::Plain, "second", "/y"),
-                                     row(232, "high", 0, Kind::Plain)};
+                                    row('b', "other", 1, Kind::Plain, "second", "/y"),
+                                    row(232, "high", 0, Kind::Plain)};
     RecordingHelper helper(table);
     const Row* found = helper.optFor('b');
     ASSERT_NE(found, nullptr);
@@ -520,14 +514,10 @@ TEST(GetOptHelperUsage, EmptyTableGivesEmptyText) { EXPECT_EQ(usageOf({}), ""); 
 TEST(GetOptHelperUsage, OptionPartForms) {
     uint8_t flag = 0;
     const std::vector<Row> table = {
-        row('a', "alpha", 0, Kind::Plain, "Alpha help."),
-        choiceRow('b', "beta", {}),
-        row(1000, "gamma", 1, Kind::Plain, "Gamma help."),
-        flagRow(1001, "delta", &flag),
-        row('e', nullptr, 1, Kind::Plain, "Eps help."),
-        row('f', "", 0, Kind::Plain, "Phi help."),
-        row(1002, nullptr, 0, Kind::Plain, "Anonymous."),
-        row('g', nullptr, 2, Kind::Plain, "Optional."),
+        row('a', "alpha", 0, Kind::Plain, "Alpha help."),  choiceRow('b', "beta", {}),
+        row(1000, "gamma", 1, Kind::Plain, "Gamma help."), flagRow(1001, "delta", &flag),
+        row('e', nullptr, 1, Kind::Plain, "Eps help."),    row('f', "", 0, Kind::Plain, "Phi help."),
+        row(1002, nullptr, 0, Kind::Plain, "Anonymous."),  row('g', nullptr, 2, Kind::Plain, "Optional."),
         row('h', "eta", 2, Kind::Plain, "Optional long."),
     };
     EXPECT_EQ(usageOf(table),
@@ -571,22 +561,21 @@ TEST(GetOptHelperUsage, NullHelpDefaultAndTextShowNothing) {
 
 TEST(GetOptHelperUsage, OptionPartOf24StaysOnTheLineAnd25MovesHelpToTheNextLine) {
     const std::vector<Row> table = {
-        row('a', "sixteen-chars-ab", 0, Kind::Plain, "Fits."),          // col 24
-        row('b', "seventeen-chars-a", 0, Kind::Plain, "Next line."),    // col 25
+        row('a', "sixteen-chars-ab", 0, Kind::Plain, "Fits."),         // col 24
+        row('b', "seventeen-chars-a", 0, Kind::Plain, "Next line."),   // col 25
         row(1000, "seventeen-chars-b", 1, Kind::Plain, "Long only."),  // col 25
         row(1001, "a-name-of-thirty-characters-xx", 0, Kind::Plain, "Far."),
     };
     EXPECT_EQ(usageOf(table),
               "  -a, --sixteen-chars-ab  Fits.\n"
               "  -b, --seventeen-chars-a\n" +
-                  kHelpIndent + "Next line.\n" +
-                  "  --seventeen-chars-b=arg\n" + kHelpIndent + "Long only.\n" +
+                  kHelpIndent + "Next line.\n" + "  --seventeen-chars-b=arg\n" + kHelpIndent + "Long only.\n" +
                   "  --a-name-of-thirty-characters-xx\n" + kHelpIndent + "Far.\n");
 }
 
 TEST(GetOptHelperUsage, LongOptionPartWithEmptyHelpGivesAnEmptyLine) {
     const std::vector<Row> table = {row('b', "seventeen-chars-a", 0, Kind::Plain, ""),
-                                     row('a', "alpha", 0, Kind::Plain, "")};
+                                    row('a', "alpha", 0, Kind::Plain, "")};
     EXPECT_EQ(usageOf(table), "  -b, --seventeen-chars-a\n\n  -a, --alpha\n");
 }
 
@@ -629,8 +618,8 @@ TEST(GetOptHelperUsage, WrappingTable) {
         {"53 characters with a blank break at it (strict comparison)", a26 + " " + b26,
          kFirst + a26 + "\n" + kHelpIndent + b26 + "\n"},
         {"53 characters without a blank stay whole", std::string(53, 'x'), kFirst + std::string(53, 'x') + "\n"},
-        {"the last blank before the first character that does not fit", std::string(50, 'w') + " " +
-                                                                              std::string(10, 'x'),
+        {"the last blank before the first character that does not fit",
+         std::string(50, 'w') + " " + std::string(10, 'x'),
          kFirst + std::string(50, 'w') + "\n" + kHelpIndent + std::string(10, 'x') + "\n"},
         {"a blank exactly at position 53", std::string(53, 'a') + " b",
          kFirst + std::string(53, 'a') + "\n" + kHelpIndent + "b\n"},
@@ -667,7 +656,7 @@ TEST(GetOptHelperUsage, TrailingBlanksAtABreakAreSkippedToTheEnd) {
 TEST(GetOptHelperUsage, HelpColumnAndWidthAreParameters) {
     // avail = 30 - (10 + 1) = 19
     const std::vector<Row> table = {row('a', "al", 0, Kind::Plain, "one two three four five six", "x"),
-                                     row('b', nullptr, 0, Kind::Plain, "short")};
+                                    row('b', nullptr, 0, Kind::Plain, "short")};
     EXPECT_EQ(usageOf(table, 10, 30),
               "  -a, --al\n"
               "          one two three four\n"

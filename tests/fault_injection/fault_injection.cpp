@@ -25,6 +25,13 @@ Environment faultEnv(const std::string& call, unsigned long nth, const std::stri
     return env;
 }
 
+Environment faultFromEnv(const std::string& call, unsigned long nth, const std::string& action,
+                         const std::string& pathSubstr, const std::string& countFile) {
+    Environment env = faultEnv(call, nth, action, pathSubstr, countFile);
+    env["FAULT_NTH"] += "+";
+    return env;
+}
+
 Environment faultCountEnv(const std::string& call, const std::string& countFile, const std::string& pathSubstr) {
     Environment env = preloadEnv();
     env["FAULT_CALL"] = call;

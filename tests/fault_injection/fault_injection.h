@@ -29,6 +29,10 @@ Environment preloadEnv();
 Environment faultEnv(const std::string& call, unsigned long nth, const std::string& action,
                      const std::string& pathSubstr = "", const std::string& countFile = "");
 
+// faultEnv acting on the `nth` matching call and on every later one.
+Environment faultFromEnv(const std::string& call, unsigned long nth, const std::string& action,
+                         const std::string& pathSubstr = "", const std::string& countFile = "");
+
 // Only counts the calls matching `call` into `countFile` (absolute).
 Environment faultCountEnv(const std::string& call, const std::string& countFile, const std::string& pathSubstr = "");
 

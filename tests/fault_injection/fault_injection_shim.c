@@ -26,8 +26,9 @@
  *                      name. The 64-bit and fortified variants (open64,
  *                      __open_2, pwrite64, ...) count as their base name.
  *   FAULT_NTH          1-based number of the one matching call to act on;
- *                      later calls are made normally. Without it calls are
- *                      only counted.
+ *                      later calls are made normally. "N+" acts on the Nth
+ *                      and on every later one. Without it calls are only
+ *                      counted.
  *   FAULT_ACTION       required with FAULT_NTH:
  *                        errno:NAME or errno:NUMBER  the call is not made
  *                          and fails with that errno (NULL for fopen)
@@ -215,6 +216,7 @@ static struct {
     int family;           /* -1: match by function name */
     const char* function; /* static name from kFunctions */
     unsigned long nth;    /* 0: count only */
+    int fromNthOn;        /* act on every call from the nth on */
     enum Action action;
     int error;
     size_t shortLength;
@@ -400,8 +402,15 @@ static void loadConfig(void) {
         config.family = -1;
         parseCall(call);
     }
-    if (nth != NULL && (!parseUnsigned(nth, &config.nth) || config.nth == 0)) {
-        configError("FAULT_NTH", nth, "expected a number from 1");
+    if (nth != NULL) {
+        char digits[32];
+        const size_t length = strlen(nth);
+        config.fromNthOn = length > 1 && nth[length - 1] == '+';
+        if (!copyValue(digits, sizeof digits, nth)) configError("FAULT_NTH", nth, "expected a number from 1");
+        if (config.fromNthOn) digits[length - 1] = '\0';
+        if (!parseUnsigned(digits, &config.nth) || config.nth == 0) {
+            configError("FAULT_NTH", nth, "expected a number from 1, or one followed by +");
+        }
     }
     if (nth != NULL && action == NULL) configError("FAULT_ACTION", NULL, "missing, but FAULT_NTH is set");
     if (nth == NULL && action != NULL) configError("FAULT_NTH", NULL, "missing, but FAULT_ACTION is set");
@@ -532,7 +541,7 @@ static enum Verdict decide(const char* function, enum Family family, int mutatin
     const unsigned long count = __atomic_add_fetch(&seen, 1, __ATOMIC_ACQ_REL);
     (void)writeCountFile(count); /* checked at load */
     errno = saved;
-    if (count != config.nth) return VERDICT_PROCEED;
+    if (count != config.nth && !(config.fromNthOn && count > config.nth)) return VERDICT_PROCEED;
     switch (config.action) {
         case ACTION_CRASH:
             crashNow();

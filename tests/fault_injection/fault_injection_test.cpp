@@ -240,6 +240,27 @@ TEST_P(FaultInjection, ActsOnExactlyTheNthMatchingCall) {
     }
 }
 
+// "N+": the unlink and the remove of the script both fail from the first on;
+// from the second on only the remove.
+TEST_P(FaultInjection, ActsOnEveryCallFromTheNthOn) {
+    for (const unsigned long nth : {1ul, 2ul}) {
+        ScratchDir dir;
+        prepareScriptDir(dir.path());
+        const ProcessResult result =
+            runScript(dir.path(), testing_support::faultFromEnv("unlink", nth, "errno:EACCES", "", countFile()));
+        EXPECT_EQ(result.exitStatus, 0) << nth;
+        std::string expected = scriptOutput(kScript.size(), "remove", "failed 13");
+        if (nth == 1) {
+            const std::string ok = "\nunlink 0\n";
+            const size_t at = expected.find(ok);
+            ASSERT_NE(at, std::string::npos);
+            expected.replace(at, ok.size(), "\nunlink failed 13\n");
+        }
+        EXPECT_EQ(result.out, expected) << nth;
+        EXPECT_EQ(count(), 2u) << nth;
+    }
+}
+
 TEST_P(FaultInjection, CountsWithoutActing) {
     const std::vector<std::pair<const char*, unsigned long>> rows = {
         {"mutating", 12}, {"open", 3},    {"openat", 0}, {"write", 1},  {"pwrite", 1}, {"truncate", 1},
@@ -304,9 +325,11 @@ TEST_P(FaultInjection, BadSettingsEndTheProcessAtLoad) {
     const std::vector<Row> rows = {
         {{{"FAULT_CALL", "bogus"}}, "fault_injection: FAULT_CALL=\"bogus\": names no call family or function\n"},
         {{{"FAULT_CALL", "rename"}, {"FAULT_NTH", "0"}, {"FAULT_ACTION", "crash"}},
-         "fault_injection: FAULT_NTH=\"0\": expected a number from 1\n"},
+         "fault_injection: FAULT_NTH=\"0\": expected a number from 1, or one followed by +\n"},
         {{{"FAULT_CALL", "rename"}, {"FAULT_NTH", "2x"}, {"FAULT_ACTION", "crash"}},
-         "fault_injection: FAULT_NTH=\"2x\": expected a number from 1\n"},
+         "fault_injection: FAULT_NTH=\"2x\": expected a number from 1, or one followed by +\n"},
+        {{{"FAULT_CALL", "rename"}, {"FAULT_NTH", "+"}, {"FAULT_ACTION", "crash"}},
+         "fault_injection: FAULT_NTH=\"+\": expected a number from 1, or one followed by +\n"},
         {{{"FAULT_CALL", "rename"}, {"FAULT_NTH", "1"}, {"FAULT_ACTION", "errno:EWHAT"}},
          "fault_injection: FAULT_ACTION=\"errno:EWHAT\": unknown errno\n"},
         {{{"FAULT_CALL", "rename"}, {"FAULT_NTH", "1"}, {"FAULT_ACTION", "explode"}},

@@ -209,6 +209,17 @@ INSTANTIATE_TEST_SUITE_P(
                       LaterRow{"both_unknown", {false, {2, 0}}, {false, {1, 0}}, false}),
     [](const auto& info) { return std::string(info.param.name); });
 
+// A read error (a directory passed off as an 8-byte check file) fails it.
+TEST(ReadCheckValue, AReadErrorFails) {
+    ScratchDir dir;
+    std::filesystem::create_directory(dir / "data.chk");
+    Opened file = opened(dir / "data.chk");
+    file.status.st_size = 8;
+    uint64_t value = 7;
+    EXPECT_EQ(Storage::readCheckValue(file.fd.get(), file.status, value), STATUS_FAILED);
+    EXPECT_EQ(value, 7u);
+}
+
 // A directory passed off as a check file is not 8 bytes long: not read.
 TEST(ReadCheckValue, DirectoryFails) {
     ScratchDir dir;

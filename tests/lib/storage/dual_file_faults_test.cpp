@@ -333,6 +333,19 @@ TEST_F(DualFileFaults, EraseCannotRemoveTheData) {
     expectReopenedAs(holding(old_));
 }
 
+// The copy's directory is gone and cannot be made again (at opening, nor
+// by erase): nothing to remove, and the commit cannot happen.
+TEST_F(DualFileFaults, EraseCannotMakeTheCopyDirectory) {
+    prepare();
+    fs::remove_all(base() / "1");
+    const ProcessResult result = drive({"erase"}, testing_support::faultFromEnv("mkdir", 1, "errno:EROFS", path("1")));
+    EXPECT_EQ(result.exitStatus, 1);
+    EXPECT_EQ(result.out,
+              "[lib/storage/storage_target:427] err_code = 30 (<unknown>)\nerase: 30\n" + stateLine(holding(old_)));
+    EXPECT_EQ(describeTree(base()), "d 2\n" + copyLines("2", old_));
+    expectReopenedAs(holding(old_));
+}
+
 TEST_F(DualFileFaults, BeginWriteCannotRemoveTheData) {
     prepare();
     const ProcessResult result = drive({"beginWrite", "finalise"}, faultEnv("unlink", 1, "errno:EIO", path("1/data")));

@@ -369,6 +369,20 @@ TEST_F(DualFileStore, ReadWhenTheCopyDirectoryBecameAFile) {
     EXPECT_EQ(count, 42u);
 }
 
+// Each operation reaches the base afresh: once it is gone, so is the blob.
+TEST_F(DualFileStore, ReadAfterTheBaseDirectoryWentAway) {
+    store_test::writeCopy(copyDir(0), bytesOf("only"), kPast);
+    auto target = open();
+    TargetSlot& slot = slotOf(*target);
+    fs::rename(base(), dir / "elsewhere");
+    uint8_t buffer[8] = {};
+    size_t count = 42;
+    EXPECT_EQ(slot.readSome(buffer, sizeof buffer, 0, count), STATUS_NOT_FOUND);
+    EXPECT_EQ(count, 42u);
+    EXPECT_FALSE(slot.exists());
+    EXPECT_TRUE(slot.isValid());
+}
+
 // Something that exists but cannot be opened for reading: the open's errno.
 TEST_F(DualFileStore, ReadOfADataPathThatExistsButCannotBeOpened) {
     store_test::writeCopy(copyDir(0), bytesOf("only"), kPast);

@@ -22,8 +22,12 @@ if [ "${1:-}" != --report-only ]; then
 fi
 
 summary=$build/coverage-summary.json
-gcovr --root . --object-directory "$build" --filter 'lib/' --filter 'libcommon/' \
-  --exclude-throw-branches --exclude-unreachable-branches -j 2 \
+# The crash and power-cut tests kill children with SIGKILL; one killed
+# while it writes its counts leaves a count gcov prints as negative. Such a
+# line is skipped (gcovr says so on stderr) rather than failing the report.
+# One job: in parallel mode gcovr hung after such an error in CI.
+timeout 900 gcovr --root . --object-directory "$build" --filter 'lib/' --filter 'libcommon/' \
+  --exclude-throw-branches --exclude-unreachable-branches --gcov-ignore-parse-errors \
   --json-summary-pretty --output "$summary" --txt "$build/coverage-uncovered.txt"
 
 python3 - "$summary" <<'EOF'

@@ -35,8 +35,9 @@ if mount -t devpts -o newinstance,ptmxmode=0666,mode=0620 devpts /dev/pts 2>/dev
 fi
 
 # The loop devices keep their own names too: mount and the kernel report them.
+# On the ARM64 device they are the eMMC's own, made once.
 make_block() {
-  mknod -m 0660 "$1" b "$2" "$3" || fail "cannot make $1"
+  [ -e "$1" ] || mknod -m 0660 "$1" b "$2" "$3" || fail "cannot make $1"
 }
 make_block /dev/mmcblk0 "$disk_major" "$disk_minor"
 make_block /dev/mmcblk0p1 "$boot_major" "$boot_minor"

@@ -17,18 +17,13 @@ set -uo pipefail
 
 readonly program=run_on_device.sh
 readonly skip_status=77
-readonly sector=512
-# Partition layout in sectors.
-readonly boot_start=2048 boot_sectors=131072              # 64 MiB
-readonly resources_start=133120 resources_sectors=262144  # 128 MiB
-readonly third_start=395264
-readonly image_bytes=$((16 * 1024 * 1024 * 1024))
 
 # Only bash built-ins until the tools have been checked.
 case "${BASH_SOURCE[0]}" in
   */*) here=${BASH_SOURCE[0]%/*} ;;
   *) here=. ;;
 esac
+. "$here/device_layout.sh"
 
 usage() {
   echo "usage: $program [--image-variant normal|low|badrecord|norecord|nofree] [--boot-bin FILE] [--boot0010-bin FILE] [--record HEX40] -- COMMAND [ARGS...]" >&2
@@ -66,7 +61,7 @@ while [ $# -gt 0 ]; do
 done
 [ $# -ge 1 ] || usage
 case "$variant" in
-  normal|badrecord|norecord) free_start=30703616 ;;
+  normal|badrecord|norecord) free_start=$normal_free_start ;;
   low) free_start=2048000 ;;
   nofree) free_start=0 ;;
   *) echo "$program: unknown image variant '$variant'" >&2; usage ;;
@@ -77,6 +72,15 @@ if [ -n "$record_override" ]; then
 fi
 
 [ "$EUID" -eq 0 ] || unavailable "not running as root"
+
+# On the emulated ARM64 device (tests/device/arm64/init.sh names its eMMC in
+# /run/arm64-device) the disk is real: a variant with the card's own
+# partition table is made afresh on it, record and file systems, instead of
+# on loop devices. The others still get an image of their own.
+real_disk=
+if [ -f /run/arm64-device ]; then
+  case "$variant" in normal|badrecord|norecord) read -r real_disk </run/arm64-device ;; esac
+fi
 for tool in unshare losetup mount umount mknod mkfs.ext4 sfdisk truncate dd stat mktemp rm sleep; do
   command -v "$tool" >/dev/null 2>&1 || unavailable "$tool not found"
 done
@@ -191,44 +195,17 @@ device_numbers() {
   echo "$((16#$1)) $((16#$2))"
 }
 
-# Prints the 20-byte record for value 0x01020304 as hex, checksums included.
-make_record() {
-  local -a b=(0x01 0x02 0x03 0x04 0x53 0x49 0x4d 0x01 0
-              0x00 0x11 0x22 0x33 0x44 0x55 0x66 0x77 0x88 0 0)
-  local i sum=0 c=0
-  for i in 0 1 2 3 4 5 6 7; do sum=$((sum + b[i])); done
-  b[8]=$((sum & 0xff))
-  for ((i = 0; i < 18; i++)); do
-    c=$(( ((c >> 1) | ((c & 1) << 15)) + b[i] ))
-    c=$((c & 0xffff))
+if [ -n "$real_disk" ]; then
+  image=$real_disk
+  # The file systems are made again below; nothing may hold them meanwhile.
+  for mount_point in /media/boot /media/resources; do
+    if mountpoint -q "$mount_point"; then umount "$mount_point" || fail "cannot unmount $mount_point"; fi
   done
-  b[18]=$((c & 0xff))
-  b[19]=$((c >> 8))
-  printf '%02x' "${b[@]}"
-}
-
-write_hex() {
-  local hex=$1 offset_sectors=$2
-  printf "$(sed 's/../\\x&/g' <<<"$hex")" |
-    dd of="$image" bs="$sector" seek="$offset_sectors" conv=notrunc status=none
-}
-
-# The boot files' default contents: text lines, sizes not a block multiple.
-default_boot_file() {
-  local name=$1 lines=$2 i
-  for ((i = 1; i <= lines; i++)); do printf '%s line %05d\n' "$name" "$i"; done
-}
-
-truncate -s "$image_bytes" "$image" || fail "cannot create $image"
-# The third partition ends where the last free area begins.
-third="start=$third_start, size=$((free_start - third_start)), type=83"
-[ "$variant" != nofree ] || third="start=$third_start, type=83"
-sfdisk -q "$image" >/dev/null <<EOF || fail "sfdisk could not partition $image"
-label: dos
-start=$boot_start, size=$boot_sectors, type=83
-start=$resources_start, size=$resources_sectors, type=83
-$third
-EOF
+else
+  truncate -s "$image_bytes" "$image" || fail "cannot create $image"
+  # The third partition ends where the last free area begins.
+  partition_table "$free_start" | sfdisk -q "$image" >/dev/null || fail "sfdisk could not partition $image"
+fi
 
 record=
 case "$variant" in
@@ -241,24 +218,34 @@ case "$variant" in
 esac
 [ -z "$record_override" ] || record=$record_override
 if [ -n "$record" ]; then
-  write_hex "$record" "$free_start" || fail "cannot write the boot vector record"
+  write_hex "$record" "$free_start" "$image" || fail "cannot write the boot vector record"
+elif [ -n "$real_disk" ]; then
+  # A real disk keeps what an earlier test wrote; a fresh image reads zeros.
+  write_hex "$(printf '%040d' 0)" "$free_start" "$image" || fail "cannot clear the boot vector sector"
 fi
 
 mkdir "$scratch/boot" "$scratch/resources" || fail "cannot create the partitions' contents"
 if [ -n "$boot_bin" ]; then cp "$boot_bin" "$scratch/BOOT.BIN"; else default_boot_file BOOT.BIN 500 >"$scratch/BOOT.BIN"; fi || fail "cannot make BOOT.BIN"
 if [ -n "$boot0010_bin" ]; then cp "$boot0010_bin" "$scratch/BOOT0010.BIN"; else default_boot_file BOOT0010.BIN 500 >"$scratch/BOOT0010.BIN"; fi || fail "cannot make BOOT0010.BIN"
 cp "$scratch/BOOT.BIN" "$scratch/BOOT0010.BIN" "$scratch/boot/" || fail "cannot stage the boot files"
-echo "simulated resource partition" >"$scratch/resources/resources.id" || fail "cannot stage the resource files"
+echo "$resources_marker_text" >"$scratch/resources/resources.id" || fail "cannot stage the resource files"
 
-attach || unavailable "cannot attach a loop device"
-disk_loop=$attached
-attach -o $((boot_start * sector)) --sizelimit $((boot_sectors * sector)) || fail "cannot attach the boot partition"
-boot_loop=$attached
-attach -o $((resources_start * sector)) --sizelimit $((resources_sectors * sector)) || fail "cannot attach the resource partition"
-resources_loop=$attached
+if [ -n "$real_disk" ]; then
+  disk_loop=$real_disk
+  boot_loop=${real_disk}p1
+  resources_loop=${real_disk}p2
+else
+  attach || unavailable "cannot attach a loop device"
+  disk_loop=$attached
+  attach -o $((boot_start * sector)) --sizelimit $((boot_sectors * sector)) || fail "cannot attach the boot partition"
+  boot_loop=$attached
+  attach -o $((resources_start * sector)) --sizelimit $((resources_sectors * sector)) || fail "cannot attach the resource partition"
+  resources_loop=$attached
+fi
 
-mkfs.ext4 -q -L boot -d "$scratch/boot" "$boot_loop" || fail "mkfs.ext4 failed on the boot partition"
-mkfs.ext4 -q -L resources -d "$scratch/resources" "$resources_loop" || fail "mkfs.ext4 failed on the resource partition"
+# No discard: on the emulated device's card it costs a minute.
+mkfs.ext4 -q -F -E nodiscard -L boot -d "$scratch/boot" "$boot_loop" || fail "mkfs.ext4 failed on the boot partition"
+mkfs.ext4 -q -F -E nodiscard -L resources -d "$scratch/resources" "$resources_loop" || fail "mkfs.ext4 failed on the resource partition"
 
 cat >"$scratch/fstab" <<EOF
 # simulated device

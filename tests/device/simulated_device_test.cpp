@@ -16,6 +16,7 @@
 #include <csignal>
 #include <cstdlib>
 #include <fstream>
+#include <set>
 #include <thread>
 
 #include <gtest/gtest.h>
@@ -404,6 +405,13 @@ protected:
                 go.string()};
     }
 
+    // The variant whose disk is an image behind loop devices everywhere; on
+    // the emulated ARM64 device the others are made on its real eMMC.
+    static std::vector<std::string> onLoopDevices(std::vector<std::string> args) {
+        args.insert(args.begin(), {"--image-variant", "low"});
+        return args;
+    }
+
     testing_support::ScratchDir tmp_;
     testing_support::ScratchDir work_;
     std::map<std::string, std::string> env_;
@@ -445,10 +453,15 @@ TEST_F(SimulatedDeviceLifecycle, NothingIsVisibleOutsideWhileItRuns) {
     const std::string fstabBefore = testing_support::readText("/etc/fstab");
     const bool diskExistedOutside = fs::exists(simulated_device::kDisk);
     const std::optional<simulated_device::MountEntry> mediaBefore = simulated_device::findMount("/media");
+    // A device's own eMMC is mounted outside as it always was.
+    std::set<std::string> mountsBefore;
+    for (const simulated_device::MountEntry& entry : simulated_device::readMounts()) {
+        mountsBefore.insert(entry.source + " " + entry.mountPoint);
+    }
     const fs::path ready = work_ / "ready";
     const fs::path go = work_ / "go";
     std::atomic<int> status{-2};
-    std::thread runner([&] { status = run(waitingCommand(ready, go)).exitStatus; });
+    std::thread runner([&] { status = run(onLoopDevices(waitingCommand(ready, go))).exitStatus; });
     const bool started = waitFor(ready, std::chrono::seconds(60));
     if (started) {
         const fs::path dir = trimmed(testing_support::readText(ready));
@@ -457,6 +470,7 @@ TEST_F(SimulatedDeviceLifecycle, NothingIsVisibleOutsideWhileItRuns) {
         EXPECT_EQ(testing_support::readText("/etc/fstab"), fstabBefore);
         EXPECT_EQ(fs::exists(simulated_device::kDisk), diskExistedOutside);
         for (const simulated_device::MountEntry& entry : simulated_device::readMounts()) {
+            if (mountsBefore.count(entry.source + " " + entry.mountPoint) != 0) continue;
             EXPECT_EQ(entry.source.rfind("/dev/mmcblk0", 0), std::string::npos)
                 << entry.source << " " << entry.mountPoint;
             EXPECT_NE(entry.source, "simulated-dev");
@@ -491,7 +505,7 @@ TEST_F(SimulatedDeviceLifecycle, KilledRunIsClearedByTheNextRun) {
         GTEST_SKIP() << "without setpriv the command outlives a killed runner";
     }
     const fs::path ready = work_ / "ready";
-    const pid_t pid = spawn(waitingCommand(ready, work_ / "never"));
+    const pid_t pid = spawn(onLoopDevices(waitingCommand(ready, work_ / "never")));
     ASSERT_GT(pid, 0);
     const bool started = waitFor(ready, std::chrono::seconds(60));
     ASSERT_EQ(::kill(pid, SIGKILL), 0);
@@ -521,7 +535,7 @@ TEST_F(SimulatedDeviceLifecycle, FailedSetUpLeavesNothing) {
         const std::string block(1 << 20, 'x');
         for (int i = 0; i < 70; ++i) out << block;
     }
-    const ProcessResult result = run({"--boot-bin", big.string(), "--", "/bin/true"});
+    const ProcessResult result = run(onLoopDevices({"--boot-bin", big.string(), "--", "/bin/true"}));
     EXPECT_EQ(result.exitStatus, 1);
     const std::string last = "run_on_device.sh: mkfs.ext4 failed on the boot partition\n";
     ASSERT_GE(result.err.size(), last.size()) << result.err;
@@ -574,15 +588,18 @@ TEST_F(SimulatedDeviceLifecycle, NonRootSkipsUnlessTheDeviceIsRequired) {
     if (!fs::exists("/usr/bin/setpriv")) GTEST_SKIP() << "needs setpriv to drop root";
     const std::vector<std::string> dropRoot{"/usr/bin/setpriv", "--reuid=65534", "--regid=65534", "--clear-groups"};
     // The checkout may lie below a directory that nobody cannot enter (/root
-    // is mode 700): nobody runs a copy of the runner from a scratch directory
-    // open to all. The refusal comes before the runner needs anything beside it.
+    // is mode 700): nobody runs a copy of the runner, with the layout it
+    // reads, from a scratch directory open to all.
     testing_support::ScratchDir copy;
     const fs::path runner = copy / "run_on_device.sh";
     fs::copy_file(simulated_device::runnerPath(), runner);
+    fs::copy_file(simulated_device::runnerPath().parent_path() / "device_layout.sh", copy / "device_layout.sh");
     fs::permissions(copy.path(), fs::perms::owner_all | fs::perms::group_read | fs::perms::group_exec |
                                      fs::perms::others_read | fs::perms::others_exec);
-    fs::permissions(runner,
-                    fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read | fs::perms::others_read);
+    for (const fs::path& file : {runner, copy / "device_layout.sh"}) {
+        fs::permissions(
+            file, fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read | fs::perms::others_read);
+    }
     std::vector<std::string> canRead = dropRoot;
     canRead.insert(canRead.end(), {"/usr/bin/test", "-r", runner.string()});
     if (runProgram(canRead).exitStatus != 0) {

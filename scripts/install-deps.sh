@@ -4,7 +4,8 @@
 #                           partitioned with sfdisk and formatted with mkfs.ext4;
 #                           the crash exploration compares its records with
 #                           strace; a program is built against the installed
-#                           package with make and pkg-config)
+#                           package with make and pkg-config; the power-cut
+#                           campaign's judgement is tested with Python)
 #   install-deps.sh cross   also the ARM64 cross compiler, the emulator that
 #                           runs its programs, and GoogleTest's sources to
 #                           build for ARM64
@@ -12,6 +13,12 @@
 #                           coverage report
 #   install-deps.sh format  also clang-format
 #   install-deps.sh fuzz    also clang and its libFuzzer runtime
+#   install-deps.sh device  also what builds and boots the emulated ARM64
+#                           device: qemu-system-aarch64, cpio, the file
+#                           system and module tools, Python for its lists;
+#                           and Debian's arm64 packages become reachable
+#                           (dpkg --add-architecture arm64), where the
+#                           guest's kernel and programs come from
 #   install-deps.sh bench   also the micro-benchmark library, zlib (the CRC
 #                           reference), sfdisk (run by every registry
 #                           opening), hyperfine, and the peers and tools that
@@ -20,10 +27,15 @@
 set -euo pipefail
 
 packages=(cmake ninja-build g++ libgtest-dev)
+arm64_packages=0
 for group in "$@"; do
   case "$group" in
-    tests) packages+=(fdisk e2fsprogs strace make pkgconf) ;;
-    coverage) packages+=(fdisk e2fsprogs strace make pkgconf gcovr) ;;
+    device)
+      packages+=(qemu-system-arm cpio fdisk e2fsprogs kmod python3 binutils)
+      arm64_packages=1
+      ;;
+    tests) packages+=(fdisk e2fsprogs strace make pkgconf python3) ;;
+    coverage) packages+=(fdisk e2fsprogs strace make pkgconf python3 gcovr) ;;
     cross) packages+=(g++-aarch64-linux-gnu qemu-user googletest file) ;;
     format) packages+=(clang-format) ;;
     fuzz) packages+=(clang libclang-rt-14-dev) ;;
@@ -36,12 +48,21 @@ missing=()
 for package in "${packages[@]}"; do
   dpkg-query -W -f='${Status}' "$package" 2>/dev/null | grep -q '^install ok installed$' || missing+=("$package")
 done
-[ ${#missing[@]} -eq 0 ] && exit 0
+# Whether apt knows the arm64 packages (the kernel's meta package stands for them).
+arm64_known() {
+  apt-cache policy linux-image-arm64:arm64 2>/dev/null | grep -q 'Candidate: [0-9]'
+}
+if [ ${#missing[@]} -eq 0 ] && { [ "$arm64_packages" -eq 0 ] || arm64_known; }; then
+  exit 0
+fi
 
 if [ "$(id -u)" -ne 0 ]; then
   echo "missing Debian packages: ${missing[*]} (run as root to install them)" >&2
   exit 1
 fi
 export DEBIAN_FRONTEND=noninteractive
+if [ "$arm64_packages" -eq 1 ]; then
+  dpkg --print-foreign-architectures | grep -qx arm64 || dpkg --add-architecture arm64
+fi
 apt-get update -qq
-apt-get install -y -qq --no-install-recommends "${missing[@]}"
+[ ${#missing[@]} -eq 0 ] || apt-get install -y -qq --no-install-recommends "${missing[@]}"

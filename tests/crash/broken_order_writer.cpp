@@ -1,10 +1,14 @@
-// A deliberately broken writer, for proving that the crash exploration can
-// fail: it replaces the blob of a one-slot dual-file store the way the
-// store does, except that it commits the new copy's check file before the
-// data is written, then writes the data and commits again. A power cut in
-// between can leave a valid, newest copy that holds an empty blob.
+// A deliberately broken writer, for proving that the crash exploration and
+// the power cuts of the ARM64 device can fail: it replaces the blob of a
+// one-slot dual-file store the way the store does, except that it commits
+// the new copy's check file before the data is written, then writes the
+// data and commits again. A power cut in between can leave a valid, newest
+// copy that holds an empty blob. With --in-place it instead rewrites the
+// current copy itself, data (synced) then check file: a power cut in
+// between leaves only the older copy valid, although the current one was
+// acknowledged.
 //
-//   broken_order_writer BASE FILE
+//   broken_order_writer [--in-place] BASE FILE
 //
 // Exit status 0 when every call succeeded, 1 otherwise.
 #include <fcntl.h>
@@ -102,13 +106,33 @@ bool commit(const Copy& copy, const timespec& previous) {
     return true;
 }
 
-bool replace(const fs::path& base, const testing_support::Bytes& blob) {
+bool syncStore(const fs::path& base) {
+    const int directory = ::open(base.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    const bool synced = directory >= 0 && ::syncfs(directory) == 0;
+    if (directory >= 0) ::close(directory);
+    return synced || fail("syncfs", base);
+}
+
+bool replace(const fs::path& base, const testing_support::Bytes& blob, bool inPlace) {
     const Copy first = inspect(base / "1");
     const Copy second = inspect(base / "2");
     const bool secondCurrent = second.valid && (!first.valid || newer(second.checkTime, first.checkTime));
     const Copy& current = secondCurrent ? second : first;
     const Copy& target = secondCurrent ? first : second;
 
+    if (inPlace) {
+        // The broken place: the only copy that opening would choose.
+        fs::create_directories(current.data.parent_path());
+        const int fd = ::open(current.data.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+        if (fd < 0) return fail("open", current.data);
+        // Made durable at once, as a careful writer would: the power can now
+        // be cut between the new data and its check file.
+        const bool written =
+            ::write(fd, blob.data(), blob.size()) == static_cast<ssize_t>(blob.size()) && ::fsync(fd) == 0;
+        ::close(fd);
+        if (!written) return fail("write", current.data);
+        return commit(current, target.valid ? target.checkTime : timespec{}) && syncStore(base);
+    }
     if (::unlink(target.check.c_str()) != 0 && errno != ENOENT) return fail("unlink", target.check);
     const int fd = ::open(target.data.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
     if (fd < 0) return fail("open", target.data);
@@ -117,19 +141,16 @@ bool replace(const fs::path& base, const testing_support::Bytes& blob) {
     ok = ok && ::write(fd, blob.data(), blob.size()) == static_cast<ssize_t>(blob.size());
     ::close(fd);
     ok = ok && commit(target, current.checkTime);
-    if (!ok) return false;
-    const int directory = ::open(base.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    const bool synced = directory >= 0 && ::syncfs(directory) == 0;
-    if (directory >= 0) ::close(directory);
-    return synced || fail("syncfs", base);
+    return ok && syncStore(base);
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-    if (argc != 3) {
-        std::fprintf(stderr, "usage: broken_order_writer BASE FILE\n");
+    const bool inPlace = argc == 4 && std::string(argv[1]) == "--in-place";
+    if (argc != 3 && !inPlace) {
+        std::fprintf(stderr, "usage: broken_order_writer [--in-place] BASE FILE\n");
         return 2;
     }
-    return replace(argv[1], testing_support::readBytes(argv[2])) ? 0 : 1;
+    return replace(argv[argc - 2], testing_support::readBytes(argv[argc - 1]), inPlace) ? 0 : 1;
 }

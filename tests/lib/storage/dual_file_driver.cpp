@@ -2,7 +2,7 @@
 // reports them on standard output, so that tests can run the store in a
 // child process under the fault-injection shim or end it part-way.
 //
-//   dual_file_driver [-l LEVEL] BASE SLOTS SLOT [STEP...]
+//   dual_file_driver [-l LEVEL] [-s] BASE SLOTS SLOT [STEP...]
 //
 //   STEP: write FILE | writeAt OFFSET FILE | beginWrite | finalise | erase
 //
@@ -14,7 +14,11 @@
 //
 //   state: exists=E valid=V read=STATUS data=HEX
 //
-// from readSome of the whole blob at offset 0 (HEX empty when it failed).
+// from readSome of the whole blob (up to 1 MiB) at offset 0 (HEX empty when
+// it failed); with -s the size and CRC-32 of those bytes instead of them:
+//
+//   state: exists=E valid=V read=STATUS size=N crc32=XXXXXXXX
+//
 // Exit status: 0 when every step returned STATUS_OK, 1 when one failed, 2
 // for a usage error.
 #include <cerrno>
@@ -27,6 +31,7 @@
 #include <vector>
 
 #include "lib/storage/dual_file_target.h"
+#include "lib/util/crc32.h"
 #include "lib/util/log.h"
 
 namespace {
@@ -60,16 +65,20 @@ bool readFile(const char* path, Bytes& data) {
     return !in.bad();
 }
 
-void printState(Storage::TargetSlot& slot) {
+void printState(Storage::TargetSlot& slot, bool summary) {
     Bytes buffer(1 << 20);
     size_t count = 0;
     const bool exists = slot.exists();
     const bool valid = slot.isValid();
     const Status status = slot.readSome(buffer.data(), buffer.size(), 0, count);
-    std::printf("state: exists=%d valid=%d read=%u data=", exists ? 1 : 0, valid ? 1 : 0, status);
-    if (status == STATUS_OK) {
-        for (size_t i = 0; i < count; ++i) std::printf("%02x", buffer[i]);
+    std::printf("state: exists=%d valid=%d read=%u", exists ? 1 : 0, valid ? 1 : 0, status);
+    if (status != STATUS_OK) count = 0;
+    if (summary) {
+        std::printf(" size=%zu crc32=%08x\n", count, crc32Finish(crc32Update(kCrc32Initial, buffer.data(), count)));
+        return;
     }
+    std::printf(" data=");
+    for (size_t i = 0; i < count; ++i) std::printf("%02x", buffer[i]);
     std::printf("\n");
 }
 
@@ -112,6 +121,8 @@ int main(int argc, char** argv) {
         setLogLevel(static_cast<int>(level));
         first = 3;
     }
+    const bool summary = argc > first && std::string(argv[first]) == "-s";
+    if (summary) ++first;
     if (argc - first < 3) return usage("expected BASE SLOTS SLOT [STEP...]");
     int64_t slotCount = 0;
     int64_t slotIndex = 0;
@@ -132,6 +143,6 @@ int main(int argc, char** argv) {
         std::printf("%s: %u\n", step.name.c_str(), status);
         ok = ok && status == STATUS_OK;
     }
-    printState(*slot.get());
+    printState(*slot.get(), summary);
     return ok ? 0 : 1;
 }

@@ -1,0 +1,127 @@
+#!/usr/bin/env bash
+# The device, emulated: an ARM64 system (qemu-system-aarch64, Debian's
+# arm64 kernel) whose eMMC is an SD card over a sparse 16 GiB image.
+#   arm64-device.sh build            assemble the guest and its card (build/arm64-device/)
+#   arm64-device.sh test             boot it and run the whole ARM64 test suite there
+#   arm64-device.sh shell            boot it with a shell on this terminal
+#   arm64-device.sh power-cuts N [SEED]
+#                                    cut its power N times at random moments (see power_cuts.py)
+# test, shell and power-cuts build first when needed. Exit status: 0 when
+# everything passed; 1 otherwise (a failed test, a boot that did not reach
+# its end in time, a violation).
+set -euo pipefail
+cd "$(dirname "$0")/.."
+root=$(pwd)
+out=$root/build/arm64-device
+guest=$root/tests/device/arm64
+kernel=$out/vmlinuz
+initramfs=$out/initramfs.cpio.gz
+card=$out/card.img
+
+usage() {
+  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED]" >&2
+  exit 2
+}
+
+# The card as the device leaves the factory: the simulated device's
+# partition table with a data partition for /var/nonvolatile, the record in
+# the first sector of the last free area, made without loop devices.
+make_card() {
+  . "$root/tests/device/device_layout.sh"
+  local staging=$out/card-staging
+  rm -rf "$staging" "$card.new"
+  mkdir -p "$staging/boot" "$staging/resources"
+  default_boot_file BOOT.BIN 500 >"$staging/boot/BOOT.BIN"
+  default_boot_file BOOT0010.BIN 500 >"$staging/boot/BOOT0010.BIN"
+  echo "$resources_marker_text" >"$staging/resources/resources.id"
+  truncate -s "$image_bytes" "$card.new"
+  partition_table "$normal_free_start" | sfdisk -q "$card.new" >/dev/null
+  make_fs() {
+    local start=$1 sectors=$2 label=$3 contents=$4
+    mkfs.ext4 -q -F -L "$label" ${contents:+-d "$contents"} -E offset=$((start * sector)) "$card.new" \
+      "$((sectors * sector / 1024))k"
+  }
+  make_fs "$boot_start" "$boot_sectors" boot "$staging/boot"
+  make_fs "$resources_start" "$resources_sectors" resources "$staging/resources"
+  make_fs "$third_start" $((normal_free_start - third_start)) nonvolatile ""
+  write_hex "$(make_record)" "$normal_free_start" "$card.new"
+  mv "$card.new" "$card"
+  rm -rf "$staging"
+}
+
+build() {
+  local start=$SECONDS
+  scripts/install-deps.sh cross device
+  # The test list's programs run as they are on the device, not under qemu-user.
+  cmake --preset arm64-device >/dev/null
+  cmake --build --preset arm64-device
+  ctest --preset arm64-device --show-only=json-v1 >"$out/tests.json"
+  python3 "$guest/test_list.py" /usr/bin/qemu-aarch64 -L /usr/aarch64-linux-gnu \
+    <"$out/tests.json" >"$out/arm64-device-tests.list"
+  python3 "$guest/assemble_guest.py" "$out/guest" "$root" "$out" "$initramfs" "$kernel"
+  make_card
+  echo "=== arm64-device: built in $((SECONDS - start)) s ($(grep -c '^t ' "$out/arm64-device-tests.list") tests)"
+}
+
+built() {
+  [ -f "$kernel" ] && [ -f "$initramfs" ] && [ -f "$card" ]
+}
+
+# The words that boot the guest in MODE (the kernel command line's
+# arm64_device=MODE and what follows it) on the card image DISK.
+qemu_words() {
+  local mode=$1 disk=$2
+  words=(qemu-system-aarch64 -M virt -cpu cortex-a53 -smp 2 -m 2048 -no-reboot -nic none -nographic
+    -kernel "$kernel" -initrd "$initramfs" -append "console=ttyAMA0 panic=-1 quiet arm64_device=$mode"
+    -drive if=none,id=card,file="$disk",format=raw,cache=writethrough -device sdhci-pci -device sd-card,drive=card)
+}
+
+# Boots the guest in MODE on DISK, the console on standard output; ends
+# qemu after LIMIT seconds.
+boot() {
+  local mode=$1 limit=$2 disk=$3 words
+  qemu_words "$mode" "$disk"
+  timeout -s KILL "$limit" "${words[@]}"
+}
+
+fresh_card() {
+  local copy=$1
+  cp --sparse=always "$card" "$copy"
+}
+
+run_tests() {
+  built || build
+  local log=$out/test-console.log work=$out/test-card.img start=$SECONDS
+  fresh_card "$work"
+  boot test 3600 "$work" </dev/null | sed -u 's/\r$//' | tee "$log" | grep --line-buffered -E '^(@@ (FAILED|SKIPPED|summary|end)|arm64-device:)' || true
+  rm -f "$work"
+  local summary
+  summary=$(grep -E '^@@ summary ' "$log" | tail -n 1)
+  echo "=== arm64-device test: $((SECONDS - start)) s"
+  if ! grep -q '^@@ end of tests' "$log"; then
+    echo "arm64-device: the guest did not reach the end of the tests (console: $log)" >&2
+    return 1
+  fi
+  echo "arm64-device: ${summary#@@ summary }"
+  grep -E '^@@ skipped ' "$log" | sed 's/^@@ /  /' || true
+  case $summary in *" failed=0") ;; *) return 1 ;; esac
+}
+
+case ${1:-} in
+  build) mkdir -p "$out"; build ;;
+  test) mkdir -p "$out"; run_tests ;;
+  shell)
+    mkdir -p "$out"
+    built || build
+    fresh_card "$out/shell-card.img"
+    boot shell 86400 "$out/shell-card.img"
+    ;;
+  power-cuts)
+    [ $# -ge 2 ] || usage
+    mkdir -p "$out"
+    built || build
+    qemu_words @MODE@ @CARD@
+    python3 "$guest/power_cuts.py" "$out" "$2" "${3:-$RANDOM}" -- "${words[@]}"
+    ;;
+  *) usage ;;
+esac

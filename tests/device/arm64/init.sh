@@ -1,0 +1,56 @@
+#!/bin/busybox sh
+# The emulated ARM64 device's first process: the mounts every Linux system
+# has, the eMMC's driver and the file systems, the card's partitions as
+# /etc/fstab says, then what the kernel command line asks for with
+# arm64_device=MODE:
+#   test      run the test list, report over the console, power off
+#   shell     an interactive shell on the console; power off when it ends
+#   workload  the power-cut workload, until the host cuts the power
+#   verify    print what every store of the workload holds, power off
+/bin/busybox --install -s
+export PATH=/usr/sbin:/usr/bin:/sbin:/bin
+export HOME=/root
+
+mount -t proc proc /proc
+mount -t sysfs sysfs /sys
+mount -t devtmpfs devtmpfs /dev
+mkdir -p /dev/pts /dev/shm
+mount -t devpts devpts /dev/pts
+mount -t tmpfs -o mode=1777 tmpfs /dev/shm
+mount -t tmpfs -o mode=1777 tmpfs /tmp
+mount -t tmpfs -o mode=0755 tmpfs /run
+# Only the kernel's errors on the console: the tests report over it.
+dmesg -n 1
+
+. /etc/arm64-device.conf
+for module in $modules; do
+    modprobe "$module" || echo "arm64-device: cannot load $module"
+done
+# The card's partitions appear once the host controller has probed it.
+waited=0
+while [ ! -b /dev/mmcblk0p3 ] && [ "$waited" -lt 200 ]; do
+    sleep 0.05
+    waited=$((waited + 1))
+done
+mount -a || echo "arm64-device: not every file system of /etc/fstab could be mounted"
+# Tests that need the simulated device use this eMMC instead of loop devices.
+echo /dev/mmcblk0 >/run/arm64-device
+
+mode=
+for word in $(cat /proc/cmdline); do
+    case $word in arm64_device=*) mode=${word#arm64_device=} ;; esac
+done
+echo "arm64-device: ready after $(cut -d ' ' -f 1 /proc/uptime) s, mode ${mode:-none}"
+
+guest=$source_dir/tests/device/arm64
+case $mode in
+    test) sh "$guest/run_tests.sh" "$build_dir/arm64-device-tests.list" ;;
+    shell) setsid cttyhack sh -l ;;
+    workload) sh "$guest/workload.sh" ;;
+    verify) sh "$guest/workload.sh" verify ;;
+    *) echo "arm64-device: unknown mode '$mode'" ;;
+esac
+cd /
+sync
+umount -a -r 2>/dev/null
+poweroff -f

@@ -1,0 +1,212 @@
+#!/usr/bin/env python3
+"""Cuts the emulated device's power at random moments while its workload
+(workload.sh) writes the stores, and checks after every cut what the next
+boot finds.
+
+    power_cuts.py OUT CUTS SEED -- QEMU_WORDS...
+
+QEMU_WORDS boot the device; in them @CARD@ stands for the card image and
+@MODE@ for the kernel command line's mode words. Two campaigns run, each
+on a fresh copy of OUT/card.img:
+
+- the store's own writers (migrate_settings and the store driver), CUTS
+  cuts; every slot must then hold the blob of its last acknowledged
+  operation, or the one of the operation in flight, whole;
+  --query-present must say the same;
+- the broken writer, which rewrites the current copy in place, until its
+  first violation or BROKEN_LIMIT cuts: it must be caught.
+
+Each cut: boot with arm64_op=NEXT, wait for the stores' report, let the
+workload run for a random time (uniform in 0..4 s, from SEED), then end qemu
+with SIGKILL. A last boot in verify mode checks the last cut. The totals,
+one line per campaign:
+
+    power cuts: N cuts, A acknowledged, O old, W new, F in flight, V violations
+    broken writer: N cuts, A acknowledged, O old, W new, F in flight, V violations
+
+F counts the cuts that met an operation in flight; of those, O found the
+slot as it was before the operation and W as the operation leaves it. Exit
+status 0 when the store's campaign had no violation and the broken one
+had at least one.
+"""
+
+import random
+import subprocess
+import sys
+import threading
+import time
+from pathlib import Path
+
+BROKEN_LIMIT = 60
+LONGEST_RUN_SECONDS = 4.0
+BOOT_LIMIT_SECONDS = 120
+
+
+class Boot:
+    """One run of qemu, its console read line by line as it comes."""
+
+    def __init__(self, words, log):
+        self.lines = []
+        self.report_done = threading.Event()
+        self.ended = threading.Event()
+        self.process = subprocess.Popen(words, stdin=subprocess.DEVNULL, stdout=subprocess.PIPE,
+                                        stderr=subprocess.STDOUT)
+        self.log = log
+        threading.Thread(target=self._read, daemon=True).start()
+
+    def _read(self):
+        for raw in self.process.stdout:
+            line = raw.decode(errors="replace").rstrip("\r\n")
+            self.log.write(line + "\n")
+            self.lines.append(line)
+            if line == "@@ state done":
+                self.report_done.set()
+        self.ended.set()
+
+    def cut(self):
+        self.process.kill()
+        self.process.wait()
+        self.ended.wait()
+
+    def wait(self):
+        try:
+            self.process.wait(timeout=BOOT_LIMIT_SECONDS)
+        except subprocess.TimeoutExpired:
+            self.process.kill()
+            self.process.wait()
+        self.ended.wait()
+
+
+class Campaign:
+    def __init__(self, name, words, card, log):
+        self.name = name
+        self.words = words
+        self.card = card
+        self.log = log
+        self.acked = {}        # KEY -> state after its last acknowledged operation
+        self.in_flight = None  # (op, key, expected state) announced, not acknowledged
+        self.next_op = 0
+        self.cuts = self.acknowledged = self.old = self.new = self.flights = self.violations = 0
+
+    def boot(self, mode):
+        words = [w.replace("@CARD@", str(self.card)).replace("@MODE@", mode) for w in self.words]
+        self.log.write(f"### {self.name}: boot {mode}\n")
+        return Boot(words, self.log)
+
+    def violation(self, text):
+        self.violations += 1
+        print(f"{self.name}: violation: {text}", flush=True)
+
+    def check(self, lines):
+        """Checks a boot's report of the stores against what was acknowledged."""
+        if "@@ state done" not in lines:
+            self.violation("the device did not report its stores after the cut")
+            return False
+        states = {}
+        for line in lines:
+            if line.startswith("@@ state ") and line != "@@ state done":
+                _, _, key, state = line.split(" ", 3)
+                states[key] = state
+        first = not self.acked
+        flight = self.in_flight
+        if flight:
+            self.flights += 1
+        for key, state in states.items():
+            if first:
+                # A fresh card: the stores' first states are the baseline.
+                if "exists=0" not in state:
+                    self.violation(f"{key} on the fresh card: {state}")
+                self.acked[key] = state
+                continue
+            before = self.acked.get(key)
+            if flight and flight[1] == key:
+                if state == before:
+                    self.old += 1
+                elif state == flight[2]:
+                    self.new += 1
+                    self.acked[key] = state
+                else:
+                    self.violation(f"op {flight[0]} on {key} in flight: found {state}, "
+                                   f"expected {before} or {flight[2]}")
+            elif state != before:
+                self.violation(f"{key}: found {state}, last acknowledged {before}")
+        for line in lines:
+            if line.startswith("@@ query "):
+                _, _, key, status = line.split(" ")
+                present = "exists=1" in states.get(key, "")
+                if (status == "0") != present:
+                    self.violation(f"{key}: --query-present exited {status}, the slot reads {states.get(key)}")
+        self.in_flight = None
+        return True
+
+    def follow(self, lines):
+        """Takes the operations of a boot's console into account."""
+        for line in lines:
+            words = line.split(" ")
+            if line.startswith("@@ op "):
+                op, key = int(words[2]), words[3]
+                self.in_flight = (op, key, line.split(" expect=", 1)[1])
+                self.next_op = op + 1
+            elif line.startswith("@@ ack ") and self.in_flight and int(words[2]) == self.in_flight[0]:
+                state = " ".join(words[4:])
+                op, key, expected = self.in_flight
+                if state != expected:
+                    self.violation(f"op {op} on {key} acknowledged {state}, expected {expected}")
+                self.acked[key] = state
+                self.acknowledged += 1
+                self.in_flight = None
+
+    def cut_once(self, rng):
+        boot = self.boot(f"workload arm64_op={self.next_op}")
+        if not boot.report_done.wait(BOOT_LIMIT_SECONDS):
+            boot.cut()
+            self.violation("the device did not boot to its workload")
+            return
+        checked = self.check(list(boot.lines))
+        time.sleep(rng.uniform(0, LONGEST_RUN_SECONDS))
+        boot.cut()
+        self.cuts += 1
+        if checked:
+            self.follow(boot.lines)
+
+    def verify_last(self):
+        boot = self.boot("verify")
+        boot.wait()
+        self.check(boot.lines)
+
+    def totals(self):
+        return (f"{self.cuts} cuts, {self.acknowledged} acknowledged, {self.old} old, {self.new} new, "
+                f"{self.flights} in flight, {self.violations} violations")
+
+
+def main():
+    if len(sys.argv) < 5 or sys.argv[4] != "--":
+        sys.exit("usage: power_cuts.py OUT CUTS SEED -- QEMU_WORDS...")
+    out, cuts, seed, words = Path(sys.argv[1]), int(sys.argv[2]), int(sys.argv[3]), sys.argv[5:]
+    print(f"campaign seed: {seed}", flush=True)
+    rng = random.Random(seed)
+    results = []
+    for name, writer, limit in (("power cuts", "store", cuts), ("broken writer", "broken", BROKEN_LIMIT)):
+        card = out / f"power-cuts-{writer}.img"
+        subprocess.run(["cp", "--sparse=always", str(out / "card.img"), str(card)], check=True)
+        with open(out / f"power-cuts-{writer}.log", "w") as log:
+            campaign = Campaign(name, [w.replace("@MODE@", f"@MODE@ arm64_writer={writer}") for w in words],
+                                card, log)
+            started = time.monotonic()
+            for number in range(limit):
+                campaign.cut_once(rng)
+                if writer == "broken" and campaign.violations:
+                    break
+                if (number + 1) % 50 == 0:
+                    print(f"so far, {name}: {campaign.totals()}", flush=True)
+            campaign.verify_last()
+        card.unlink()
+        print(f"{name}: {campaign.totals()}", flush=True)
+        print(f"=== {name}: {time.monotonic() - started:.0f} s", flush=True)
+        results.append(campaign)
+    store, broken = results
+    sys.exit(0 if store.violations == 0 and broken.violations > 0 else 1)
+
+
+if __name__ == "__main__":
+    main()

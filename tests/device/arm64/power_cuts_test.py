@@ -1,0 +1,91 @@
+#!/usr/bin/env python3
+"""The power-cut campaign's judgement, on consoles written by hand: what
+it accepts after a cut, what it counts and what it calls a violation."""
+
+import io
+import sys
+import unittest
+from pathlib import Path
+
+sys.dont_write_bytecode = True  # the source tree stays clean
+sys.path.insert(0, str(Path(__file__).resolve().parent))
+import power_cuts  # noqa: E402
+
+EMPTY = "exists=0 valid=0 read=1 size=0 crc32=00000000"
+FIRST = "exists=1 valid=1 read=0 size=100 crc32=11111111"
+SECOND = "exists=1 valid=1 read=0 size=4000 crc32=22222222"
+MIX = "exists=1 valid=1 read=0 size=4000 crc32=33333333"
+
+
+def report(settings, driver, query="10"):
+    return [f"@@ state settings {settings}", f"@@ state driver {driver}", f"@@ query settings {query}",
+            "@@ state done"]
+
+
+def campaign():
+    return power_cuts.Campaign("test", [], Path("card"), io.StringIO())
+
+
+class Judgement(unittest.TestCase):
+    def started(self):
+        """A campaign past its first boot, FIRST acknowledged in settings."""
+        c = campaign()
+        self.assertTrue(c.check(report(EMPTY, EMPTY)))
+        c.follow(["@@ op 0 settings expect=" + FIRST, "@@ ack 0 0 " + FIRST])
+        self.assertEqual(c.acknowledged, 1)
+        return c
+
+    def test_a_fresh_card_must_read_empty(self):
+        c = campaign()
+        c.check(report(FIRST, EMPTY, "0"))
+        self.assertEqual(c.violations, 1)
+
+    def test_the_acknowledged_blob_passes(self):
+        c = self.started()
+        c.check(report(FIRST, EMPTY, "0"))
+        self.assertEqual((c.violations, c.flights), (0, 0))
+
+    def test_an_operation_in_flight_may_leave_the_old_or_the_new_blob(self):
+        for found, old, new in ((FIRST, 1, 0), (SECOND, 0, 1)):
+            c = self.started()
+            c.follow(["@@ op 1 settings expect=" + SECOND])
+            c.check(report(found, EMPTY, "0"))
+            self.assertEqual((c.violations, c.flights, c.old, c.new), (0, 1, old, new))
+            self.assertEqual(c.acked["settings"], found)
+            self.assertEqual(c.next_op, 2)
+
+    def test_a_mix_or_an_older_blob_is_a_violation(self):
+        for found in (MIX, EMPTY):
+            c = self.started()
+            c.follow(["@@ op 1 settings expect=" + SECOND])
+            c.check(report(found, EMPTY, "0" if found == MIX else "10"))
+            self.assertEqual(c.violations, 1, found)
+
+    def test_a_slot_no_operation_touched_must_not_change(self):
+        c = self.started()
+        c.follow(["@@ op 1 settings expect=" + SECOND])
+        c.check(report(SECOND, FIRST, "0"))
+        self.assertEqual(c.violations, 1)
+
+    def test_an_acknowledgement_must_match_the_expected_state(self):
+        c = self.started()
+        c.follow(["@@ op 1 settings expect=" + SECOND, "@@ ack 1 0 " + MIX])
+        self.assertEqual(c.violations, 1)
+
+    def test_query_present_must_agree_with_the_slot(self):
+        c = self.started()
+        c.check(report(FIRST, EMPTY, "10"))
+        self.assertEqual(c.violations, 1)
+
+    def test_a_boot_without_its_report_is_a_violation(self):
+        c = self.started()
+        self.assertFalse(c.check(["arm64-device: ready after 3.00 s, mode workload"]))
+        self.assertEqual(c.violations, 1)
+
+    def test_totals_read_as_scripts_expect(self):
+        c = self.started()
+        self.assertEqual(c.totals(), "0 cuts, 1 acknowledged, 0 old, 0 new, 0 in flight, 0 violations")
+
+
+if __name__ == "__main__":
+    unittest.main()

@@ -6,7 +6,7 @@
 #   arm64-device.sh shell            boot it with a shell on this terminal
 #   arm64-device.sh power-cuts N [SEED]
 #                                    cut its power N times at random moments (see power_cuts.py)
-# test, shell and power-cuts build first when needed. Exit status: 0 when
+# test, shell and power-cuts build first (again only what changed). Exit status: 0 when
 # everything passed; 1 otherwise (a failed test, a boot that did not reach
 # its end in time, a violation).
 set -euo pipefail
@@ -17,6 +17,7 @@ guest=$root/tests/device/arm64
 kernel=$out/vmlinuz
 initramfs=$out/initramfs.cpio.gz
 card=$out/card.img
+assembled=$out/guest-assembled
 
 usage() {
   echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED]" >&2
@@ -55,16 +56,26 @@ build() {
   # The test list's programs run as they are on the device, not under qemu-user.
   cmake --preset arm64-device >/dev/null
   cmake --build --preset arm64-device
-  ctest --preset arm64-device --show-only=json-v1 >"$out/tests.json"
-  python3 "$guest/test_list.py" /usr/bin/qemu-aarch64 -L /usr/aarch64-linux-gnu \
-    <"$out/tests.json" >"$out/arm64-device-tests.list"
-  python3 "$guest/assemble_guest.py" "$out/guest" "$root" "$out" "$initramfs" "$kernel"
-  make_card
+  if guest_is_stale; then
+    ctest --preset arm64-device --show-only=json-v1 >"$out/tests.json"
+    python3 "$guest/test_list.py" --time-factor 4 /usr/bin/qemu-aarch64 -L /usr/aarch64-linux-gnu \
+      <"$out/tests.json" >"$out/arm64-device-tests.list"
+    python3 "$guest/assemble_guest.py" "$out/guest" "$root" "$out" "$initramfs" "$kernel"
+    touch "$assembled"
+  fi
+  [ "$card" -nt tests/device/device_layout.sh ] && [ "$card" -nt "$0" ] || make_card
   echo "=== arm64-device: built in $((SECONDS - start)) s ($(grep -c '^t ' "$out/arm64-device-tests.list") tests)"
 }
 
-built() {
-  [ -f "$kernel" ] && [ -f "$initramfs" ] && [ -f "$card" ]
+# The guest holds the sources and the build's programs: it is stale when
+# any of them is newer than it.
+guest_is_stale() {
+  [ -f "$assembled" ] || return 0
+  local newer
+  newer=$(find "$root" \( -path "$root/.git" -o -path "$out/guest" -o \
+    \( -path "$root/build/*" ! -path "$out" ! -path "$out/*" \) \) -prune -o \
+    -type f -newer "$assembled" \( ! -path "$out/*" -o -perm -u+x \) -print -quit)
+  [ -n "$newer" ]
 }
 
 # The words that boot the guest in MODE (the kernel command line's
@@ -90,7 +101,7 @@ fresh_card() {
 }
 
 run_tests() {
-  built || build
+  build
   local log=$out/test-console.log work=$out/test-card.img start=$SECONDS
   fresh_card "$work"
   boot test 3600 "$work" </dev/null | sed -u 's/\r$//' | tee "$log" | grep --line-buffered -E '^(@@ (FAILED|SKIPPED|summary|end)|arm64-device:)' || true
@@ -112,14 +123,14 @@ case ${1:-} in
   test) mkdir -p "$out"; run_tests ;;
   shell)
     mkdir -p "$out"
-    built || build
+    build
     fresh_card "$out/shell-card.img"
     boot shell 86400 "$out/shell-card.img"
     ;;
   power-cuts)
     [ $# -ge 2 ] || usage
     mkdir -p "$out"
-    built || build
+    build
     qemu_words @MODE@ @CARD@
     python3 "$guest/power_cuts.py" "$out" "$2" "${3:-$RANDOM}" -- "${words[@]}"
     ;;

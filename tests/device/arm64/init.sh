@@ -44,7 +44,7 @@ echo "arm64-device: ready after $(cut -d ' ' -f 1 /proc/uptime) s, mode ${mode:-
 
 guest=$source_dir/tests/device/arm64
 case $mode in
-    test) sh "$guest/run_tests.sh" "$build_dir/arm64-device-tests.list" ;;
+    test) bash "$guest/run_tests.sh" "$build_dir/arm64-device-tests.list" ;;
     shell) setsid cttyhack sh -l ;;
     workload) sh "$guest/workload.sh" ;;
     verify) sh "$guest/workload.sh" verify ;;

@@ -1,4 +1,4 @@
-#!/bin/sh
+#!/bin/bash
 # Runs the build's tests on the device (the list test_list.py made), the
 # ones that must run alone first, the others two at a time, and reports
 # over the console in lines that scripts/arm64-device.sh reads:
@@ -8,17 +8,65 @@
 #   @@ summary run=N passed=P skipped=S failed=F
 #   @@ end of tests
 #   run_tests.sh LIST
+# Every program started here costs dearly on an emulated CPU, so a test
+# costs one process besides its own: the rest are bash builtins.
 list=$1
 results=/tmp/test-results
-rm -rf "$results"
-mkdir -p "$results"
-: >"$results/verdicts"
 # The tests run on the device itself: what needs one must not be skipped.
 export REQUIRE_SIMULATED_DEVICE=1
 
+# t SERIAL DEVICE NAME DIR SKIP_CODE LIMIT PASS_RE SKIP_RE WILL_FAIL COMMAND...
+t() {
+    local name=$3 dir=$4 skip_code=$5 limit=$6 pass_re=$7 skip_re=$8 will_fail=$9
+    shift 9
+    local log=$results/${name//\//_}.log started code took verdict=FAILED reason
+    started=${EPOCHREALTIME/./}
+    (cd "$dir" && exec timeout -s KILL "$limit" "$@") >"$log" 2>&1 </dev/null
+    code=$?
+    took=$((10#${EPOCHREALTIME/./} - 10#$started))
+    if [ -n "$skip_code" ] && [ "$code" = "$skip_code" ]; then
+        verdict=SKIPPED
+    elif [ -n "$skip_re" ] && grep -Eq -- "$skip_re" "$log"; then
+        verdict=SKIPPED
+    elif [ -n "$pass_re" ]; then
+        grep -Eq -- "$pass_re" "$log" && verdict=PASSED
+    elif [ "$code" = 0 ]; then
+        verdict=PASSED
+    fi
+    if [ "$will_fail" = 1 ] && [ "$verdict" != SKIPPED ]; then
+        if [ "$verdict" = PASSED ]; then verdict=FAILED; else verdict=PASSED; fi
+    fi
+    echo "@@ $verdict $name $((took / 1000000)).$((took / 100000 % 10))"
+    echo "$verdict $name $code" >>"$results/verdicts"
+    if [ "$verdict" = SKIPPED ]; then
+        reason=$(grep -A 1 -e ': Skipped$' "$log" | tail -n 1)
+        [ -n "$reason" ] || reason=$(tail -n 1 "$log")
+        echo "@@ skipped $name: $reason" | tee -a "$results/skip-reasons"
+    fi
+}
+
+# A worker takes the next test not yet taken, until none is left (one file
+# per test; a rename claims it).
+worker() {
+    local test
+    for test in "$results"/queue/*; do
+        mv "$test" "$test.taken-by-$1" 2>/dev/null || continue
+        . "$test.taken-by-$1"
+    done
+}
+
+if [ "${2:-}" = --worker ]; then
+    worker "$3"
+    exit
+fi
+
+rm -rf "$results"
+mkdir -p "$results"
+: >"$results/verdicts"
+
 # All but the device tests expect a build host: no eMMC under /dev and
-# nothing under /media. They get that view in a mount namespace of their
-# own: a /dev without the card's nodes, an empty /media.
+# nothing under /media. Their workers run in a mount namespace of their
+# own with that view: a /dev without the card's nodes, an empty /media.
 host_dev=/run/host-view-dev
 mkdir -p "$host_dev"
 mount -t tmpfs -o mode=0755 tmpfs "$host_dev"
@@ -35,62 +83,21 @@ as_build_host() {
         mount -t tmpfs -o mode=0755 tmpfs /media && exec "$@"' "$host_dev" "$@"
 }
 
-# t SERIAL DEVICE NAME DIR SKIP_CODE LIMIT PASS_RE SKIP_RE WILL_FAIL COMMAND...
-t() {
-    device=$2 name=$3 dir=$4 skip_code=$5 limit=$6 pass_re=$7 skip_re=$8 will_fail=$9
-    shift 9
-    view=as_build_host
-    [ "$device" = 0 ] || view=
-    log=$results/$(echo "$name" | tr '/' '_').log
-    started=$(cut -d ' ' -f 1 /proc/uptime)
-    (cd "$dir" && $view timeout -s KILL "$limit" "$@") >"$log" 2>&1 </dev/null
-    code=$?
-    ended=$(cut -d ' ' -f 1 /proc/uptime)
-    verdict=FAILED
-    if [ -n "$skip_code" ] && [ "$code" = "$skip_code" ]; then
-        verdict=SKIPPED
-    elif [ -n "$skip_re" ] && grep -Eq -- "$skip_re" "$log"; then
-        verdict=SKIPPED
-    elif [ -n "$pass_re" ]; then
-        grep -Eq -- "$pass_re" "$log" && verdict=PASSED
-    elif [ "$code" = 0 ]; then
-        verdict=PASSED
-    fi
-    if [ "$will_fail" = 1 ] && [ "$verdict" != SKIPPED ]; then
-        if [ "$verdict" = PASSED ]; then verdict=FAILED; else verdict=PASSED; fi
-    fi
-    echo "@@ $verdict $name $(awk "BEGIN { printf \"%.1f\", $ended - $started }")"
-    echo "$verdict $name $code" >>"$results/verdicts"
-    if [ "$verdict" = SKIPPED ]; then
-        reason=$(grep -A 1 -e ': Skipped$' "$log" | tail -n 1)
-        [ -n "$reason" ] || reason=$(tail -n 1 "$log")
-        echo "@@ skipped $name: $reason" | tee -a "$results/skip-reasons"
-    fi
-}
-
-# Tests that must run alone first; the others in two workers, each taking
-# the next test not yet taken (one file per test; a rename claims it).
+# The device tests alone first; then the others in two workers.
 grep '^t 1 ' "$list" >"$results/serial"
 mkdir "$results/queue"
 grep -v '^t 1 ' "$list" | split -l 1 -a 5 -d - "$results/queue/"
-worker() {
-    for test in "$results"/queue/*; do
-        mv "$test" "$test.taken-by-$1" 2>/dev/null || continue
-        . "$test.taken-by-$1"
-    done
-}
-
 . "$results/serial"
-worker 0 &
+as_build_host bash "$0" "$list" --worker 0 &
 first=$!
-worker 1 &
+as_build_host bash "$0" "$list" --worker 1 &
 second=$!
 wait "$first" "$second"
 
 # The output of every failed test, after all the results.
 grep '^FAILED ' "$results/verdicts" | while read -r verdict name code; do
     echo "@@ output $name (exit status $code)"
-    tail -n 200 "$results/$(echo "$name" | tr '/' '_').log"
+    tail -n 200 "$results/${name//\//_}.log"
     echo "@@ end $name"
 done
 run=$(wc -l <"$results/verdicts")

@@ -6,7 +6,11 @@ alone (1 or 0), whether it is a device test (label "device": it gets the
 eMMC; the others see the device as a build host, 1 or 0), its name, working directory, skip return code, time limit,
 pass and skip expressions and expected failure, then its command.
 
-    test_list.py EMULATOR_WORDS... < tests.json > tests.list
+    test_list.py [--time-factor N] EMULATOR_WORDS... < tests.json > tests.list
+
+Time limits are the tests' own, multiplied by N (default 1): an emulated
+CPU runs the programs several times slower than the machines the limits
+were set on.
 
 Leading words of a command that are the build's emulator (qemu-aarch64 and
 its options, which gtest_discover_tests puts before every test program) are
@@ -30,6 +34,10 @@ def labels(test):
 
 def main():
     emulator = sys.argv[1:]
+    time_factor = 1
+    if emulator[:1] == ["--time-factor"]:
+        time_factor = int(emulator[1])
+        emulator = emulator[2:]
     tests = json.load(sys.stdin)["tests"]
     # The long kinds first, so that parallel workers end together.
     tests.sort(key=lambda test: not LONG_LABELS & set(labels(test)))
@@ -44,7 +52,7 @@ def main():
             test["name"],
             properties.get("WORKING_DIRECTORY", "/"),
             str(properties.get("SKIP_RETURN_CODE", "")),
-            str(int(float(properties.get("TIMEOUT", DEFAULT_TIME_LIMIT)))),
+            str(int(float(properties.get("TIMEOUT", DEFAULT_TIME_LIMIT))) * time_factor),
             "|".join(properties.get("PASS_REGULAR_EXPRESSION", [])),
             "|".join(properties.get("SKIP_REGULAR_EXPRESSION", [])),
             "1" if properties.get("WILL_FAIL") else "0",

@@ -6,9 +6,9 @@
 #   arm64-device.sh shell            boot it with a shell on this terminal
 #   arm64-device.sh power-cuts N [SEED]
 #                                    cut its power N times at random moments (see power_cuts.py)
-# test, shell and power-cuts build first (again only what changed). Exit status: 0 when
-# everything passed; 1 otherwise (a failed test, a boot that did not reach
-# its end in time, a violation).
+# test, shell and power-cuts build first (again only what changed). Exit
+# status: 0 when everything passed; 1 otherwise (a failed test, a boot that
+# did not reach its end in time, a violation).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 root=$(pwd)

@@ -8,8 +8,9 @@
 #   @@ summary run=N passed=P skipped=S failed=F
 #   @@ end of tests
 #   run_tests.sh LIST
-# Every program started here costs dearly on an emulated CPU, so a test
-# costs one process besides its own: the rest are bash builtins.
+# Every program started costs dearly on an emulated CPU: around a test the
+# harness starts only the rename that claims it and the time limit, and
+# does the rest with bash builtins.
 list=$1
 results=/tmp/test-results
 # The tests run on the device itself: what needs one must not be skipped.

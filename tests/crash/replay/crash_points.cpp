@@ -79,8 +79,9 @@ void addTorn(const WriteLog& log, size_t index, const CrashPointChoice& choice, 
             for (size_t sector = 0; sector < sectors; ++sector) {
                 point.fates.push_back(static_cast<SectorFate>(random() % 4));
             }
-            mixed = std::any_of(point.fates.begin(), point.fates.end(),
-                                [](SectorFate fate) { return fate == SectorFate::kZeros || fate == SectorFate::kErased; }) ||
+            mixed = std::any_of(
+                        point.fates.begin(), point.fates.end(),
+                        [](SectorFate fate) { return fate == SectorFate::kZeros || fate == SectorFate::kErased; }) ||
                     (std::count(point.fates.begin(), point.fates.end(), SectorFate::kOld) > 0 &&
                      std::count(point.fates.begin(), point.fates.end(), SectorFate::kNew) > 0);
         }

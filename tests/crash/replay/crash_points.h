@@ -29,9 +29,9 @@ enum class SectorFate : uint8_t { kOld, kNew, kZeros, kErased };
 
 struct CrashPoint {
     CrashKind kind = CrashKind::kPrefix;
-    size_t prefix = 0;          // the log's first `prefix` entries applied in order
-    std::vector<size_t> extra;  // kReordered: further entries applied, ascending
-    size_t torn = 0;            // kTorn: the entry landed in part
+    size_t prefix = 0;              // the log's first `prefix` entries applied in order
+    std::vector<size_t> extra;      // kReordered: further entries applied, ascending
+    size_t torn = 0;                // kTorn: the entry landed in part
     std::vector<SectorFate> fates;  // kTorn: one per sector of that entry
 
     // The last entry whose effect the point includes, plus one: the marks

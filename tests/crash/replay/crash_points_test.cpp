@@ -37,8 +37,8 @@ LogEntry mark(const std::string& text) {
 // 0 w, 1 w, 2 mark, 3 flush, 4 w(FUA), 5 w, 6 w, 7 w, 8 flush
 WriteLog sample() {
     WriteLog log;
-    log.entries = {write(0, 1, 0x11), write(1, 2, 0x22),       mark("ack 1"), flush(), write(3, 1, 0x33, kFua),
-                   write(4, 1, 0x44), write(5, 1, 0x55),       write(0, 1, 0x66), flush()};
+    log.entries = {write(0, 1, 0x11), write(1, 2, 0x22), mark("ack 1"),     flush(), write(3, 1, 0x33, kFua),
+                   write(4, 1, 0x44), write(5, 1, 0x55), write(0, 1, 0x66), flush()};
     return log;
 }
 
@@ -128,7 +128,9 @@ TEST(CrashPoints, TornWritesAreNeverWhollyOldOrWhollyNew) {
         EXPECT_EQ(point.prefix, point.torn);
         EXPECT_EQ(point.reach(), point.torn + 1);
         ASSERT_EQ(point.fates.size(), sample().entries[point.torn].sectorCount);
-        const auto count = [&point](SectorFate fate) { return std::count(point.fates.begin(), point.fates.end(), fate); };
+        const auto count = [&point](SectorFate fate) {
+            return std::count(point.fates.begin(), point.fates.end(), fate);
+        };
         EXPECT_NE(static_cast<size_t>(count(SectorFate::kOld)), point.fates.size());
         EXPECT_NE(static_cast<size_t>(count(SectorFate::kNew)), point.fates.size());
     }
@@ -141,8 +143,10 @@ TEST(CrashPoints, TheDefaultChoiceGivesEveryKindInTurn) {
         if (runs.empty() || runs.back().first != point.kind) runs.emplace_back(point.kind, 0);
         ++runs.back().second;
     }
-    EXPECT_EQ(runs, (std::vector<std::pair<CrashKind, size_t>>{
-                        {CrashKind::kBarrier, 3}, {CrashKind::kPrefix, 10}, {CrashKind::kReordered, 16}, {CrashKind::kTorn, 24}}));
+    EXPECT_EQ(
+        runs,
+        (std::vector<std::pair<CrashKind, size_t>>{
+            {CrashKind::kBarrier, 3}, {CrashKind::kPrefix, 10}, {CrashKind::kReordered, 16}, {CrashKind::kTorn, 24}}));
 }
 
 TEST(CrashPoints, APrefixLeavesTheWritesInOrderAndADiscardLeavesZeros) {
@@ -178,11 +182,8 @@ TEST(CrashPoints, ATornWriteLeavesEachSectorToItsFate) {
     WriteLog log;
     log.entries = {write(0, 4, 0x11), write(0, 4, 0x22)};
     std::vector<uint8_t> device(4 * kSector, 0xcc);
-    const CrashPoint point{CrashKind::kTorn,
-                           1,
-                           {},
-                           1,
-                           {SectorFate::kOld, SectorFate::kNew, SectorFate::kZeros, SectorFate::kErased}};
+    const CrashPoint point{
+        CrashKind::kTorn, 1, {}, 1, {SectorFate::kOld, SectorFate::kNew, SectorFate::kZeros, SectorFate::kErased}};
     applyCrashPoint(log, point, device);
     EXPECT_EQ(device[0], 0x11);
     EXPECT_EQ(device[kSector], 0x22);

@@ -20,96 +20,15 @@ namespace fs = std::filesystem;
 using store_test::SlotContent;
 using testing_support::ProcessResult;
 
-constexpr int64_t kClockStart = 1700000000;
 constexpr size_t kReportedViolations = 20;
-// Multi-slot scenarios update this slot; the others hold a blob and an
-// erased blob that must survive every crash untouched.
-constexpr size_t kUpdatedSlot = 1;
-// A writeAt outside a begun write that crosses a block boundary.
-constexpr int64_t kPatchOffset = 4000;
-constexpr size_t kPatchSize = 300;
 
-int64_t clockOf(Clock clock, size_t run) {
-    const int64_t step = static_cast<int64_t>(run);
-    switch (clock) {
-        case Clock::kForward:
-            return kClockStart + 10 * step;
-        case Clock::kEqual:
-            return kClockStart;
-        case Clock::kBackward:
-            return kClockStart - 100 * step;
-    }
-    return kClockStart;
-}
-
-const char* clockName(Clock clock) {
-    switch (clock) {
-        case Clock::kForward:
-            return "forward";
-        case Clock::kEqual:
-            return "equal";
-        case Clock::kBackward:
-            return "backward";
-    }
-    return "?";
-}
-
-// A blob of a little over one block, different for every run.
-Bytes blobFor(size_t run, size_t salt) {
-    return store_test::patternBytes(kBlockSize + 1000 + 211 * run, static_cast<uint32_t>(run * 7919 + salt));
-}
-
-// The "state:" line that the driver and the broken writer end with.
-SlotContent reportedState(const std::string& out) {
-    const size_t line = out.rfind("state: ");
-    if (line == std::string::npos) throw std::runtime_error("no state line in:\n" + out);
-    int exists = 0;
-    int valid = 0;
-    unsigned status = 0;
-    if (std::sscanf(out.c_str() + line, "state: exists=%d valid=%d read=%u", &exists, &valid, &status) != 3) {
-        throw std::runtime_error("bad state line in:\n" + out);
-    }
-    SlotContent content;
-    content.exists = exists != 0;
-    content.valid = valid != 0;
-    content.status = static_cast<Status>(status);
-    const size_t data = out.find("data=", line) + 5;
-    content.data = testing_support::fromHex(out.substr(data, out.find('\n', data) - data));
-    return content;
-}
+const ScenarioPrograms kPrograms{DUAL_FILE_DRIVER, BROKEN_ORDER_WRITER};
 
 std::string text(const SlotContent& content) {
     std::ostringstream out;
     out << content;
     std::string shown = out.str();
     return shown.size() > 120 ? shown.substr(0, 120) + "..." : shown;
-}
-
-// What an update should leave, when the store's rules say so without
-// looking at the copies: a writeAt outside a begun write starts from the
-// other copy's leftover data when no blob is current.
-bool expectedAfter(char update, const SlotContent& before, const Bytes& blob, SlotContent& expected) {
-    switch (update) {
-        case 'W':
-        case 'B':
-        case 'X':
-            expected = store_test::holding(blob);
-            return true;
-        case 'E':
-            expected = store_test::absentBlob();
-            return true;
-        case 'A': {
-            if (!before.exists) return false;
-            Bytes patched = before.data;
-            const size_t end = static_cast<size_t>(kPatchOffset) + kPatchSize;
-            if (patched.size() < end) patched.resize(end);
-            std::copy(blob.begin(), blob.begin() + kPatchSize, patched.begin() + kPatchOffset);
-            expected = store_test::holding(patched);
-            return true;
-        }
-        default:
-            throw std::invalid_argument(std::string("unknown update ") + update);
-    }
 }
 
 }  // namespace
@@ -155,7 +74,7 @@ public:
             const Bytes blob = blobFor(run + 1, scenario_.slotCount);
             const fs::path recordFile = inputs_ / ("record" + std::to_string(run));
             const ProcessResult outcome = testing_support::runProgram(
-                commandFor(update, slot, blob),
+                updateCommand(kPrograms, update, root_, scenario_.slotCount, slot, blob, inputs_),
                 testing_support::recordEnv(recordFile.string(), root_.string() + "/", clockOf(scenario_.clock, run)));
             if (outcome.exitStatus != 0) {
                 throw std::runtime_error(std::string("update ") + update + " failed:\n" + outcome.out + outcome.err);
@@ -182,41 +101,6 @@ public:
     }
 
 private:
-    std::vector<std::string> commandFor(char update, size_t slot, const Bytes& blob) {
-        const fs::path blobFile = inputs_ / "blob";
-        testing_support::writeBytes(blobFile, blob);
-        if (update == 'X') return {BROKEN_ORDER_WRITER, root_.string(), blobFile.string()};
-        std::vector<std::string> command = {DUAL_FILE_DRIVER, root_.string(), std::to_string(scenario_.slotCount),
-                                            std::to_string(slot)};
-        switch (update) {
-            case 'W':
-                command.insert(command.end(), {"write", blobFile.string()});
-                break;
-            case 'B': {
-                const size_t half = blob.size() / 2;
-                const fs::path head = inputs_ / "head";
-                const fs::path tail = inputs_ / "tail";
-                testing_support::writeBytes(head, Bytes(blob.begin(), blob.begin() + half));
-                testing_support::writeBytes(tail, Bytes(blob.begin() + half, blob.end()));
-                command.insert(command.end(), {"beginWrite", "writeAt", "0", head.string(), "writeAt",
-                                               std::to_string(half), tail.string(), "finalise"});
-                break;
-            }
-            case 'A': {
-                const fs::path patch = inputs_ / "patch";
-                testing_support::writeBytes(patch, Bytes(blob.begin(), blob.begin() + kPatchSize));
-                command.insert(command.end(), {"writeAt", std::to_string(kPatchOffset), patch.string()});
-                break;
-            }
-            case 'E':
-                command.push_back("erase");
-                break;
-            default:
-                throw std::invalid_argument(std::string("unknown update ") + update);
-        }
-        return command;
-    }
-
     SlotContent openedState(size_t slot) const {
         Storage::DualFileTarget target(root_, scenario_.slotCount);
         return store_test::contentOf(*target.getSlot(slot).get());
@@ -225,21 +109,13 @@ private:
     // Slot 0 holds a blob, slot 2 an erased one; written before the record
     // starts, so they are on disk.
     void populateOtherSlots(std::vector<SlotContent>& initial) {
-        const fs::path blobFile = inputs_ / "other";
-        const Bytes other = blobFor(0, 99);
-        testing_support::writeBytes(blobFile, other);
-        const std::string slots = std::to_string(scenario_.slotCount);
         for (const std::vector<std::string>& command :
-             {std::vector<std::string>{DUAL_FILE_DRIVER, root_.string(), slots, "0", "write", blobFile.string()},
-              std::vector<std::string>{DUAL_FILE_DRIVER, root_.string(), slots, "2", "write", blobFile.string(),
-                                       "erase"}}) {
+             populateCommands(kPrograms, root_, scenario_.slotCount, inputs_, initial)) {
             // At a fixed time, so that every scenario starts from the same files.
             const ProcessResult result =
                 testing_support::runProgram(command, testing_support::recordEnv("", "", kClockStart));
             if (result.exitStatus != 0) throw std::runtime_error("populating failed:\n" + result.out + result.err);
         }
-        initial[0] = store_test::holding(other);
-        initial[2] = store_test::absentBlob();
     }
 
     // Every acknowledged update ends with the one syncfs of its commit.

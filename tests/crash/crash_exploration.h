@@ -14,16 +14,11 @@
 #include <vector>
 
 #include "crash_states.h"
+#include "scenario_runs.h"
 #include "scratch_dir.h"
 #include "store_files.h"
 
 namespace crash {
-
-enum class Clock {
-    kForward,   // every run ten seconds after the one before
-    kEqual,     // every run at the same second
-    kBackward,  // every run a hundred seconds before the one before
-};
 
 // Updates, one letter and one program run each:
 //   W  write

@@ -14,7 +14,7 @@ namespace {
 
 constexpr size_t kSuperSize = 8 + 8 + 8 + 4;
 constexpr size_t kHeaderSize = 8 * 4;
-constexpr uint64_t kKnownFlags = kFlush | kFua | kDiscard | kMark;
+constexpr uint64_t kKnownFlags = kFlush | kFua | kDiscard | kMark | kMetadata;
 
 // Reads `size` bytes at `offset`; false when they are not all there.
 using ReadAt = std::function<bool(uint64_t offset, void* buffer, size_t size)>;

@@ -25,6 +25,7 @@ enum EntryFlag : uint64_t {
     kFua = 2,
     kDiscard = 4,
     kMark = 8,
+    kMetadata = 16,  // a write the file system marked as its metadata
 };
 
 struct LogEntry {

@@ -39,8 +39,8 @@ LogEntry discard(uint64_t sector, uint64_t count) {
 
 WriteLog sample() {
     WriteLog log;
-    log.entries = {write(8, 2, 0, 0xa1),   mark("op 1 begin"), write(100, 1, kFua, 0xb2),
-                   write(0, 0, kFlush, 0), discard(64, 16),    mark("op 1 ack")};
+    log.entries = {write(8, 2, kMetadata, 0xa1), mark("op 1 begin"), write(100, 1, kFua, 0xb2),
+                   write(0, 0, kFlush, 0),       discard(64, 16),    mark("op 1 ack")};
     return log;
 }
 
@@ -63,6 +63,7 @@ TEST(WriteLog, ReadsBackEveryFieldOfEveryKindOfEntry) {
     ASSERT_EQ(log.entries.size(), 6u);
     EXPECT_EQ(log.entries[0].sector, 8u);
     EXPECT_EQ(log.entries[0].sectorCount, 2u);
+    EXPECT_EQ(log.entries[0].flags, kMetadata);
     EXPECT_EQ(log.entries[0].data, std::vector<uint8_t>(1024, 0xa1));
     EXPECT_TRUE(log.entries[0].writes());
     EXPECT_FALSE(log.entries[0].isBarrier());
@@ -136,7 +137,7 @@ INSTANTIATE_TEST_SUITE_P(
                       Damage{"sector_size_small", 24, 256, "sector size 256"},
                       Damage{"sector_size_odd", 24, 1536, "sector size 1536"},
                       Damage{"more_entries", 16, 7, "entry 6 lies beyond the end"},
-                      Damage{"unknown_flag", 512 + 16, 16, "entry 0 has unknown flags 16"},
+                      Damage{"unknown_flag", 512 + 16, 32 | kFua, "entry 0 has unknown flags 34"},
                       Damage{"long_text", 2048 + 24, 481, "entry 1 has text longer than its sector"},
                       Damage{"data_beyond", 2560 + 8, 40, "entry 2's data lies beyond the end"},
                       Damage{"huge", 512 + 8, uint64_t{1} << 40, "entry 0 is implausibly long"}),

@@ -22,7 +22,7 @@ using testing_support::ProcessResult;
 
 constexpr size_t kReportedViolations = 20;
 
-const ScenarioPrograms kPrograms{DUAL_FILE_DRIVER, BROKEN_ORDER_WRITER};
+const ScenarioPrograms kPrograms{DUAL_FILE_DRIVER, {BROKEN_ORDER_WRITER}};
 
 std::string text(const SlotContent& content) {
     std::ostringstream out;

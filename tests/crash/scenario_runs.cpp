@@ -54,7 +54,11 @@ std::vector<std::string> updateCommand(const ScenarioPrograms& programs, char up
                                        const fs::path& inputs) {
     const fs::path blobFile = inputs / "blob";
     testing_support::writeBytes(blobFile, blob);
-    if (update == 'X') return {programs.brokenWriter, root.string(), blobFile.string()};
+    if (update == 'X') {
+        std::vector<std::string> command = programs.brokenWriter;
+        command.insert(command.end(), {root.string(), blobFile.string()});
+        return command;
+    }
     std::vector<std::string> command = {programs.driver, root.string(), std::to_string(slotCount),
                                         std::to_string(slot)};
     switch (update) {

@@ -30,11 +30,11 @@ constexpr int64_t kClockStart = 1700000000;
 // erased blob that must survive every crash untouched.
 constexpr size_t kUpdatedSlot = 1;
 
-// The programs the runs are made by: the store's driver
-// (tests/lib/storage/tools) and the test-only broken writer.
+// The programs the runs are made by: the store's driver and the words
+// that start the test-only broken writer (its path and options).
 struct ScenarioPrograms {
     std::string driver;
-    std::string brokenWriter;
+    std::vector<std::string> brokenWriter;
 };
 
 // A blob of a little over one 4 KiB block, different for every run.

@@ -7,38 +7,19 @@
 
 #include <gtest/gtest.h>
 
+#include "log_entries.h"
+
 namespace replay {
 namespace {
 
 constexpr uint32_t kSector = 512;
 
-LogEntry write(uint64_t sector, uint64_t count, uint8_t fill, uint64_t flags = 0) {
-    LogEntry entry;
-    entry.sector = sector;
-    entry.sectorCount = count;
-    entry.flags = flags;
-    entry.data.assign(count * kSector, fill);
-    return entry;
-}
-
-LogEntry flush() {
-    LogEntry entry;
-    entry.flags = kFlush;
-    return entry;
-}
-
-LogEntry mark(const std::string& text) {
-    LogEntry entry;
-    entry.flags = kMark;
-    entry.mark = text;
-    return entry;
-}
-
 // 0 w, 1 w, 2 mark, 3 flush, 4 w(FUA), 5 w, 6 w, 7 w, 8 flush
 WriteLog sample() {
     WriteLog log;
-    log.entries = {write(0, 1, 0x11), write(1, 2, 0x22), mark("ack 1"),     flush(), write(3, 1, 0x33, kFua),
-                   write(4, 1, 0x44), write(5, 1, 0x55), write(0, 1, 0x66), flush()};
+    log.entries = {writeEntry(0, 1, 0x11), writeEntry(1, 2, 0x22),       markEntry("ack 1"),
+                   flushEntry(),           writeEntry(3, 1, 0x33, kFua), writeEntry(4, 1, 0x44),
+                   writeEntry(5, 1, 0x55), writeEntry(0, 1, 0x66),       flushEntry()};
     return log;
 }
 
@@ -92,8 +73,8 @@ TEST(CrashPoints, ASmallEpochGivesEverySubsetButNoneAndAll) {
 
 TEST(CrashPoints, ALargeEpochGivesTheChosenNumberOfDistinctSeededSubsets) {
     WriteLog log;
-    for (uint8_t i = 0; i < 12; ++i) log.entries.push_back(write(i, 1, i));
-    log.entries.push_back(flush());
+    for (uint8_t i = 0; i < 12; ++i) log.entries.push_back(writeEntry(i, 1, i));
+    log.entries.push_back(flushEntry());
     CrashPointChoice choice = none();
     choice.subsetsPerEpoch = 20;
     const std::vector<CrashPoint> points = crashPoints(log, choice);
@@ -151,11 +132,7 @@ TEST(CrashPoints, TheDefaultChoiceGivesEveryKindInTurn) {
 
 TEST(CrashPoints, APrefixLeavesTheWritesInOrderAndADiscardLeavesZeros) {
     WriteLog log = sample();
-    LogEntry discard;
-    discard.flags = kDiscard;
-    discard.sector = 4;
-    discard.sectorCount = 2;
-    log.entries.push_back(discard);
+    log.entries.push_back(discardEntry(4, 2));
     std::vector<uint8_t> device(8 * kSector, 0xcc);
     applyCrashPoint(log, CrashPoint{CrashKind::kPrefix, log.entries.size(), {}, 0, {}}, device);
     const auto sectorByte = [&device](size_t sector) { return device[sector * kSector + 7]; };
@@ -180,7 +157,7 @@ TEST(CrashPoints, AReorderedPointLeavesOnlyItsChosenWrites) {
 
 TEST(CrashPoints, ATornWriteLeavesEachSectorToItsFate) {
     WriteLog log;
-    log.entries = {write(0, 4, 0x11), write(0, 4, 0x22)};
+    log.entries = {writeEntry(0, 4, 0x11), writeEntry(0, 4, 0x22)};
     std::vector<uint8_t> device(4 * kSector, 0xcc);
     const CrashPoint point{
         CrashKind::kTorn, 1, {}, 1, {SectorFate::kOld, SectorFate::kNew, SectorFate::kZeros, SectorFate::kErased}};
@@ -194,7 +171,7 @@ TEST(CrashPoints, ATornWriteLeavesEachSectorToItsFate) {
 
 TEST(CrashPoints, AnEntryBeyondTheDeviceIsAnError) {
     WriteLog log;
-    log.entries = {write(3, 2, 0x11)};
+    log.entries = {writeEntry(3, 2, 0x11)};
     std::vector<uint8_t> device(4 * kSector, 0);
     EXPECT_THROW(applyCrashPoint(log, CrashPoint{CrashKind::kPrefix, 1, {}, 0, {}}, device), std::out_of_range);
 }

@@ -7,40 +7,18 @@
 
 #include <gtest/gtest.h>
 
+#include "log_entries.h"
+
 #include "files.h"
 #include "scratch_dir.h"
 
 namespace replay {
 namespace {
 
-LogEntry write(uint64_t sector, uint64_t count, uint64_t flags, uint8_t fill, uint32_t sectorSize = 512) {
-    LogEntry entry;
-    entry.sector = sector;
-    entry.sectorCount = count;
-    entry.flags = flags;
-    entry.data.assign(count * sectorSize, fill);
-    return entry;
-}
-
-LogEntry mark(const std::string& text) {
-    LogEntry entry;
-    entry.flags = kMark;
-    entry.mark = text;
-    return entry;
-}
-
-LogEntry discard(uint64_t sector, uint64_t count) {
-    LogEntry entry;
-    entry.sector = sector;
-    entry.sectorCount = count;
-    entry.flags = kDiscard;
-    return entry;
-}
-
 WriteLog sample() {
     WriteLog log;
-    log.entries = {write(8, 2, kMetadata, 0xa1), mark("op 1 begin"), write(100, 1, kFua, 0xb2),
-                   write(0, 0, kFlush, 0),       discard(64, 16),    mark("op 1 ack")};
+    log.entries = {writeEntry(8, 2, 0xa1, kMetadata), markEntry("op 1 begin"), writeEntry(100, 1, 0xb2, kFua),
+                   writeEntry(0, 0, 0, kFlush),       discardEntry(64, 16),    markEntry("op 1 ack")};
     return log;
 }
 
@@ -97,7 +75,7 @@ TEST(WriteLog, LayoutIsHeaderSectorsWithTheirDataBehind) {
 TEST(WriteLog, ALargerSectorSizeScalesEverything) {
     WriteLog log;
     log.sectorSize = 4096;
-    log.entries = {write(3, 1, kFua, 0x5a, 4096)};
+    log.entries = {writeEntry(3, 1, 0x5a, kFua, 4096)};
     const std::vector<uint8_t> bytes = encodeWriteLog(log);
     EXPECT_EQ(bytes.size(), 3u * 4096);
     const WriteLog back = parseWriteLog(bytes);

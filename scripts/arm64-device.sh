@@ -64,7 +64,7 @@ build() {
     touch "$assembled"
   fi
   [ "$card" -nt tests/device/device_layout.sh ] && [ "$card" -nt "$0" ] || make_card
-  echo "=== arm64-device: built in $((SECONDS - start)) s ($(grep -c '^t ' "$out/arm64-device-tests.list") tests)"
+  echo "=== arm64-device: built in $((SECONDS - start)) s ($(sed -n 's/^# \([0-9]*\) tests$/\1/p' "$out/arm64-device-tests.list") tests)"
 }
 
 # The guest holds the sources and the build's programs: it is stale when

@@ -24,13 +24,6 @@ constexpr size_t kReportedViolations = 20;
 
 const ScenarioPrograms kPrograms{DUAL_FILE_DRIVER, {BROKEN_ORDER_WRITER}};
 
-std::string text(const SlotContent& content) {
-    std::ostringstream out;
-    out << content;
-    std::string shown = out.str();
-    return shown.size() > 120 ? shown.substr(0, 120) + "..." : shown;
-}
-
 }  // namespace
 
 // One run of a scenario: where its record ends, and what it acknowledged.
@@ -87,8 +80,8 @@ public:
             const SlotContent reported = update == 'X' ? openedState(slot) : reportedState(outcome.out);
             SlotContent expected;
             if (expectedAfter(update, current[slot], blob, expected) && reported != expected) {
-                throw std::runtime_error(std::string("update ") + update + " left " + text(reported) + ", not " +
-                                         text(expected));
+                throw std::runtime_error(std::string("update ") + update + " left " + reportText(reported) + ", not " +
+                                         reportText(expected));
             }
             current[slot] = reported;
             result.segments.push_back(Segment{raw.size(), slot, reported});
@@ -247,7 +240,7 @@ Totals Explorer::explore(const Scenario& scenario) {
                     const bool inFlightHere = inFlight != nullptr && inFlight->slot == slot;
                     const bool allowed =
                         shown == acknowledged[slot] || (inFlightHere && shown == inFlight->acknowledged);
-                    if (!allowed) problem = "slot " + std::to_string(slot) + " shows " + text(shown);
+                    if (!allowed) problem = "slot " + std::to_string(slot) + " shows " + reportText(shown);
                 }
                 if (problem.empty()) return;
                 ++totals.violations;

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cstdio>
+#include <sstream>
 #include <stdexcept>
 
 #include "crash_states.h"
@@ -120,6 +121,13 @@ SlotContent reportedState(const std::string& out) {
     const size_t data = out.find("data=", line) + 5;
     content.data = testing_support::fromHex(out.substr(data, out.find('\n', data) - data));
     return content;
+}
+
+std::string reportText(const SlotContent& content) {
+    std::ostringstream out;
+    out << content;
+    const std::string shown = out.str();
+    return shown.size() > 120 ? shown.substr(0, 120) + "..." : shown;
 }
 
 bool expectedAfter(char update, const SlotContent& before, const std::vector<uint8_t>& blob, SlotContent& expected) {

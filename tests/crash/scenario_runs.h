@@ -59,6 +59,9 @@ std::vector<std::vector<std::string>> populateCommands(const ScenarioPrograms& p
 // Throws std::runtime_error when there is none or it is malformed.
 store_test::SlotContent reportedState(const std::string& out);
 
+// A slot's content as a report shows it: at most 120 characters.
+std::string reportText(const store_test::SlotContent& content);
+
 // What an update should leave, when the store's rules say so without
 // looking at the copies: false for a writeAt outside a begun write when
 // no blob is current (it starts from the other copy's leftover data).

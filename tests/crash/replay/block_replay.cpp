@@ -224,13 +224,6 @@ Expectation expectationAt(const Recording& recording, size_t reach) {
     return expectation;
 }
 
-std::string shown(const SlotContent& content) {
-    std::ostringstream out;
-    out << content;
-    const std::string text = out.str();
-    return text.size() > 120 ? text.substr(0, 120) + "..." : text;
-}
-
 // The problem with the device as the cut at `point` left it, or "".
 std::string check(const Options& options, const Recording& recording, const replay::CrashPoint& point, size_t slotCount,
                   Totals& totals) {
@@ -256,7 +249,7 @@ std::string check(const Options& options, const Recording& recording, const repl
             const bool allowed =
                 first[slot] == expected.acknowledged[slot] ||
                 (expected.inFlight != nullptr && expected.inFlightSlot == slot && first[slot] == *expected.inFlight);
-            if (!allowed) problem = "slot " + std::to_string(slot) + " shows " + shown(first[slot]);
+            if (!allowed) problem = "slot " + std::to_string(slot) + " shows " + crash::reportText(first[slot]);
         }
         if (problem.empty() && first != second) problem = "a second opening disagrees";
     } catch (const std::exception& error) {

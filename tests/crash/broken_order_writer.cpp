@@ -6,19 +6,24 @@
 // copy that holds an empty blob. With --in-place it instead rewrites the
 // current copy itself, data (synced) then check file: a power cut in
 // between leaves only the older copy valid, although the current one was
-// acknowledged.
+// acknowledged. --pause-ms=N waits N ms between the two, so that the power
+// cuts of the ARM64 device, which come at random times, meet that window
+// within a few tries.
 //
-//   broken_order_writer [--in-place] BASE FILE
+//   broken_order_writer [--in-place [--pause-ms=N]] BASE FILE
 //
 // Exit status 0 when every call succeeded, 1 otherwise.
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <string>
+#include <thread>
 
 #include "files.h"
 #include "lib/storage/check_value.h"
@@ -113,7 +118,7 @@ bool syncStore(const fs::path& base) {
     return synced || fail("syncfs", base);
 }
 
-bool replace(const fs::path& base, const testing_support::Bytes& blob, bool inPlace) {
+bool replace(const fs::path& base, const testing_support::Bytes& blob, bool inPlace, long pauseMs) {
     const Copy first = inspect(base / "1");
     const Copy second = inspect(base / "2");
     const bool secondCurrent = second.valid && (!first.valid || newer(second.checkTime, first.checkTime));
@@ -131,6 +136,8 @@ bool replace(const fs::path& base, const testing_support::Bytes& blob, bool inPl
             ::write(fd, blob.data(), blob.size()) == static_cast<ssize_t>(blob.size()) && ::fsync(fd) == 0;
         ::close(fd);
         if (!written) return fail("write", current.data);
+        // Busy elsewhere before the check file: the window a cut must meet.
+        std::this_thread::sleep_for(std::chrono::milliseconds(pauseMs));
         return commit(current, target.valid ? target.checkTime : timespec{}) && syncStore(base);
     }
     if (::unlink(target.check.c_str()) != 0 && errno != ENOENT) return fail("unlink", target.check);
@@ -147,10 +154,21 @@ bool replace(const fs::path& base, const testing_support::Bytes& blob, bool inPl
 }  // namespace
 
 int main(int argc, char** argv) {
-    const bool inPlace = argc == 4 && std::string(argv[1]) == "--in-place";
-    if (argc != 3 && !inPlace) {
-        std::fprintf(stderr, "usage: broken_order_writer [--in-place] BASE FILE\n");
+    bool inPlace = false;
+    long pauseMs = 0;
+    int next = 1;
+    for (; next < argc && std::strncmp(argv[next], "--", 2) == 0; ++next) {
+        if (std::strcmp(argv[next], "--in-place") == 0) {
+            inPlace = true;
+        } else if (std::strncmp(argv[next], "--pause-ms=", 11) == 0) {
+            pauseMs = std::strtol(argv[next] + 11, nullptr, 10);
+        } else {
+            break;
+        }
+    }
+    if (argc - next != 2 || pauseMs < 0 || (pauseMs > 0 && !inPlace)) {
+        std::fprintf(stderr, "usage: broken_order_writer [--in-place [--pause-ms=N]] BASE FILE\n");
         return 2;
     }
-    return replace(argv[argc - 2], testing_support::readBytes(argv[argc - 1]), inPlace) ? 0 : 1;
+    return replace(argv[next], testing_support::readBytes(argv[next + 1]), inPlace, pauseMs) ? 0 : 1;
 }

@@ -37,7 +37,7 @@ import threading
 import time
 from pathlib import Path
 
-BROKEN_LIMIT = 60
+BROKEN_LIMIT = 30
 LONGEST_RUN_SECONDS = 4.0
 BOOT_LIMIT_SECONDS = 120
 

@@ -1,7 +1,7 @@
 #!/bin/busybox sh
 # The emulated ARM64 device's first process: the mounts every Linux system
-# has, the eMMC's driver and the file systems, the card's partitions as
-# /etc/fstab says, then what the kernel command line asks for with
+# has, the eMMC's driver and the file systems, the card's partitions checked
+# and mounted as /etc/fstab says, then what the kernel command line asks for with
 # arm64_device=MODE:
 #   test      run the test list, report over the console, power off
 #   shell     an interactive shell on the console; power off when it ends
@@ -32,6 +32,19 @@ while [ ! -b /dev/mmcblk0p3 ] && [ "$waited" -lt 200 ]; do
     sleep 0.05
     waited=$((waited + 1))
 done
+# As the device's boot does, e2fsck repairs the file systems /etc/fstab
+# gives a pass number before they are mounted: after a power cut during a
+# journal commit, this kernel refuses to mount ("Structure needs
+# cleaning") until the torn transaction is dropped.
+while read -r device directory type options dump pass; do
+    case $device in /dev/*) ;; *) continue ;; esac
+    [ "$type" = ext4 ] && [ "${pass:-0}" -gt 0 ] || continue
+    e2fsck -p "$device" >/tmp/e2fsck.log 2>&1
+    status=$?
+    [ "$status" -eq 0 ] && continue
+    echo "arm64-device: e2fsck -p $device exited $status:"
+    sed 's/^/arm64-device:   /' /tmp/e2fsck.log
+done </etc/fstab
 mount -a || echo "arm64-device: not every file system of /etc/fstab could be mounted"
 # Tests that need the simulated device use this eMMC instead of loop devices.
 echo /dev/mmcblk0 >/run/arm64-device

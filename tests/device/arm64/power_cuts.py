@@ -25,7 +25,8 @@ one line per campaign:
     broken writer: N cuts, A acknowledged, O old, W new, F in flight, V violations
 
 F counts the cuts that met an operation in flight; of those, O found the
-slot as it was before the operation and W as the operation leaves it. Exit
+slot as it was before the operation and W as the operation leaves it. A
+second line per campaign counts the repairs e2fsck made at boot. Exit
 status 0 when the store's campaign had no violation and the broken one
 had at least one.
 """
@@ -87,6 +88,7 @@ class Campaign:
         self.in_flight = None  # (op, key, expected state) announced, not acknowledged
         self.next_op = 0
         self.cuts = self.acknowledged = self.old = self.new = self.flights = self.violations = 0
+        self.repairs = 0  # boots on which e2fsck had to repair a file system first
 
     def boot(self, mode):
         words = [w.replace("@CARD@", str(self.card)).replace("@MODE@", mode) for w in self.words]
@@ -99,6 +101,7 @@ class Campaign:
 
     def check(self, lines):
         """Checks a boot's report of the stores against what was acknowledged."""
+        self.repairs += sum(1 for line in lines if line.startswith("arm64-device: e2fsck -p "))
         if "@@ state done" not in lines:
             self.violation("the device did not report its stores after the cut")
             return False
@@ -202,6 +205,7 @@ def main():
             campaign.verify_last()
         card.unlink()
         print(f"{name}: {campaign.totals()}", flush=True)
+        print(f"{name}: {campaign.repairs} file system repairs by e2fsck at boot", flush=True)
         print(f"=== {name}: {time.monotonic() - started:.0f} s", flush=True)
         results.append(campaign)
     store, broken = results

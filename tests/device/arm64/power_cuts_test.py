@@ -40,6 +40,14 @@ class Judgement(unittest.TestCase):
         c.check(report(FIRST, EMPTY, "0"))
         self.assertEqual(c.violations, 1)
 
+    def test_a_repair_at_boot_is_counted_and_judged_like_any_boot(self):
+        c = self.started()
+        repaired = ["arm64-device: e2fsck -p /dev/mmcblk0p3 exited 1:",
+                    "arm64-device:   nonvolatile: Journal transaction 52 was corrupt, replay was aborted."]
+        c.check(repaired + report(FIRST, EMPTY, "0"))
+        c.check(report(FIRST, EMPTY, "0"))
+        self.assertEqual((c.repairs, c.violations), (1, 0))
+
     def test_the_acknowledged_blob_passes(self):
         c = self.started()
         c.check(report(FIRST, EMPTY, "0"))

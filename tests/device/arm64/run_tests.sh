@@ -142,9 +142,11 @@ as_build_host() {
         mount -t tmpfs -o mode=0755 tmpfs /media && exec "$@"' "$host_dev" "$@"
 }
 
-# The device tests one after the other on the card, while a worker in the
-# build-host view takes the others; a second one joins it when the device
-# tests are done.
+# The device tests one after the other on the card, while two workers in
+# the build-host view take the others, so that the two longest (the crash
+# exploration and the soak) start at once; a third joins them when the
+# device tests are done. The device tests wait on the card much of the
+# time, which leaves the CPUs to the workers.
 grep '^t 1 ' "$list" >"$results/serial"
 mkdir "$results/queue"
 grep -v '^t 1 ' "$list" | split -l 1 -a 5 -d - "$results/queue/"
@@ -152,10 +154,12 @@ grep -v '^t 1 ' "$list" | split -l 1 -a 5 -d - "$results/queue/"
     . "$results/serial"
     as_build_host bash "$0" "$list" --worker 0
 ) &
-first=$!
-as_build_host bash "$0" "$list" --worker 1 &
-second=$!
-wait "$first" "$second"
+lanes=$!
+for worker in 1 2; do
+    as_build_host bash "$0" "$list" --worker "$worker" &
+    lanes="$lanes $!"
+done
+wait $lanes
 
 # The output of every failed test, after all the results.
 grep '^FAILED ' "$results/verdicts" | while read -r verdict name code; do

@@ -2,7 +2,7 @@
 # Runs the build's tests on the device (the list test_list.py made: t lines
 # for single tests, g lines for groups of one program's cases): the ones
 # that must run alone (the device tests) one after the other, beside them
-# the others, two at a time once the device tests are done; and reports
+# the others, two at a time, three once the device tests are done; and reports
 # over the console in lines that scripts/arm64-device.sh reads:
 #   @@ PASSED|FAILED|SKIPPED NAME SECONDS
 #   @@ skipped NAME: REASON

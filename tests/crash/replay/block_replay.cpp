@@ -2,14 +2,18 @@
 // checks every crash point of the log: the device's file system behind the
 // kernel's log-writes target, the store driver's runs with a mark before
 // each and after its acknowledgement; then, for every crash point, the
-// device as the cut left it, mounted (the file system's own recovery), and
-// a fresh store opened on it twice.
+// device as the cut left it, mounted (the file system's own recovery, and
+// the boot's repair when the mount refuses), and a fresh store opened on it
+// twice. The tree each point shows is also checked against the crash model
+// of tests/crash for the runs' recorded operations.
 //
-//   block_replay FS DATA LOG WORK [options] [UPDATES...]
+//   block_replay FS DATA LOG ORIGIN COW WORK [options] [UPDATES...]
 //     FS      ext4 | ext4-journal | ext4-writeback | f2fs
 //     DATA    the block device the file system lives on (all of it is used)
 //     LOG     the block device the log is written to
-//     WORK    a directory for the device images (best in memory)
+//     ORIGIN  a block device as large as DATA, for the device as the log started
+//     COW     a block device as large as DATA, for each point's changes
+//     WORK    a directory for mount points and the runs' inputs
 //   options:
 //     --slots=1,3                    store sizes
 //     --clocks=forward,equal,backward
@@ -17,32 +21,40 @@
 //     --broken                       the broken writer's scenario instead
 //   UPDATES: scenarios (default: every sequence of three of W, B, A, E).
 //
-// Needs root, the log-writes target, dmsetup, mount and the file system's
-// mkfs. Prints one line per scenario and the totals:
-//   replay FS: S scenarios, E log entries, P crash points, D distinct states, V violations
-// (or "broken writer FS: ..."). Exit status 0 without violations (with
-// --broken: with at least one), 1 otherwise, 2 for a bad command line.
+// Needs root, the log-writes and snapshot targets, dmsetup and the file
+// system's mkfs and fsck. Prints one line per scenario and the totals:
+//   replay FS: S scenarios, E log entries, P crash points, D distinct states, V violations, M outside the model
+// (or "broken writer FS: ..."). Exit status 0 without violations and, on
+// ext4 with its defaults (the file system the model describes), without
+// states outside the model; with --broken, 0 when there was a violation.
+// 1 otherwise, 2 for a bad command line.
 #include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdio>
 #include <cstring>
-#include <fstream>
+#include <functional>
 #include <map>
 #include <set>
 #include <sstream>
 #include <stdexcept>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "child_process.h"
 #include "crash_points.h"
+#include "crash_states.h"
 #include "fault_injection.h"
 #include "files.h"
 #include "fs_image.h"
+#include "fs_record.h"
 #include "lib/storage/dual_file_target.h"
+#include "model_states.h"
+#include "point_device.h"
 #include "scenario_runs.h"
 #include "write_log.h"
 
@@ -56,27 +68,35 @@ using testing_support::ProcessResult;
 // The broken writer rewrites the current copy in place: a cut after its
 // synced data and before its check file leaves only the older copy valid.
 const crash::ScenarioPrograms kPrograms{DUAL_FILE_DRIVER, {BROKEN_ORDER_WRITER, "--in-place"}};
-constexpr const char* kTargetName = "block-replay";
-constexpr size_t kReportedViolations = 20;
+constexpr size_t kReportedProblems = 20;
 
 struct FileSystem {
     std::string name;
     std::string type;
     std::string options;
-    std::vector<std::string> mkfs;  // the device is appended
+    std::vector<std::string> mkfs;    // the device is appended
+    std::vector<std::string> repair;  // what the boot runs when a mount refuses; the device is appended
+    bool modelled;                    // the crash model describes it
 };
 
+const std::vector<std::string> kMakeExt4 = {"/sbin/mke2fs", "-q", "-F", "-t", "ext4", "-E", "nodiscard"};
+const std::vector<std::string> kRepairExt4 = {"/sbin/e2fsck", "-p"};
 const std::vector<FileSystem> kFileSystems = {
-    {"ext4", "ext4", "", {"/sbin/mke2fs", "-q", "-F", "-t", "ext4", "-E", "nodiscard"}},
-    {"ext4-journal", "ext4", "data=journal", {"/sbin/mke2fs", "-q", "-F", "-t", "ext4", "-E", "nodiscard"}},
-    {"ext4-writeback", "ext4", "data=writeback", {"/sbin/mke2fs", "-q", "-F", "-t", "ext4", "-E", "nodiscard"}},
-    {"f2fs", "f2fs", "", {"/sbin/mkfs.f2fs", "-q", "-f"}},
+    {"ext4", "ext4", "", kMakeExt4, kRepairExt4, true},
+    {"ext4-journal", "ext4", "data=journal", kMakeExt4, kRepairExt4, false},
+    {"ext4-writeback", "ext4", "data=writeback", kMakeExt4, kRepairExt4, false},
+    {"f2fs", "f2fs", "", {"/sbin/mkfs.f2fs", "-q", "-f"}, {"/sbin/fsck.f2fs", "-a"}, false},
 };
 
 struct Options {
     const FileSystem* fileSystem = nullptr;
+    // The mapped devices' names: one replay per file system may run at once.
+    std::string logTarget;
+    std::string pointTarget;
     fs::path data;
     fs::path log;
+    fs::path origin;
+    fs::path cow;
     fs::path work;
     std::vector<size_t> slotCounts = {1, 3};
     std::vector<Clock> clocks = {Clock::kForward, Clock::kEqual, Clock::kBackward};
@@ -90,6 +110,8 @@ struct Totals {
     size_t entries = 0;
     size_t points = 0;
     size_t violations = 0;
+    size_t outsideModel = 0;
+    size_t repaired = 0;
     std::set<std::string> states;
 };
 
@@ -102,8 +124,12 @@ void run(const std::vector<std::string>& command, const std::map<std::string, st
     }
 }
 
+bool tryMount(const FileSystem& fileSystem, const fs::path& device, const fs::path& at) {
+    return ::mount(device.c_str(), at.c_str(), fileSystem.type.c_str(), 0, fileSystem.options.c_str()) == 0;
+}
+
 void mountDevice(const FileSystem& fileSystem, const fs::path& device, const fs::path& at) {
-    if (::mount(device.c_str(), at.c_str(), fileSystem.type.c_str(), 0, fileSystem.options.c_str()) != 0) {
+    if (!tryMount(fileSystem, device, at)) {
         throw std::runtime_error("mount " + device.string() + ": " + std::strerror(errno));
     }
 }
@@ -115,16 +141,16 @@ void unmount(const fs::path& at) {
 // The mapped device of the log-writes target, as a node of our own: without
 // udev nothing appears under /dev/mapper.
 fs::path createLogTarget(const Options& options, uint64_t sectors) {
-    run({"/sbin/dmsetup", "create", kTargetName, "--table",
+    run({"/sbin/dmsetup", "create", options.logTarget, "--table",
          "0 " + std::to_string(sectors) + " log-writes " + options.data.string() + " " + options.log.string()});
-    const ProcessResult numbers =
-        testing_support::runProgram({"/sbin/dmsetup", "info", "-c", "--noheadings", "-o", "major,minor", kTargetName});
+    const ProcessResult numbers = testing_support::runProgram(
+        {"/sbin/dmsetup", "info", "-c", "--noheadings", "-o", "major,minor", options.logTarget});
     unsigned major = 0;
     unsigned minor = 0;
     if (numbers.exitStatus != 0 || std::sscanf(numbers.out.c_str(), "%u:%u", &major, &minor) != 2) {
         throw std::runtime_error("dmsetup info: " + numbers.out + numbers.err);
     }
-    const fs::path node = options.work / "log-writes-device";
+    const fs::path node = options.work / options.logTarget;
     fs::remove(node);
     if (::mknod(node.c_str(), S_IFBLK | 0600, makedev(major, minor)) != 0) {
         throw std::runtime_error("mknod " + node.string() + ": " + std::strerror(errno));
@@ -132,16 +158,21 @@ fs::path createLogTarget(const Options& options, uint64_t sectors) {
     return node;
 }
 
-void mark(const std::string& text) { run({"/sbin/dmsetup", "message", kTargetName, "0", "mark", text}); }
+void mark(const Options& options, const std::string& text) {
+    run({"/sbin/dmsetup", "message", options.logTarget, "0", "mark", text});
+}
 
-// One scenario's record: the device before the log, the log, and what
-// each run acknowledged.
+// One scenario's record: the device before the log, the log, what each
+// run acknowledged, and the operations the runs made, for the model.
 struct Recording {
     std::vector<uint8_t> base;
     replay::WriteLog log;
     std::vector<SlotContent> initial;
     std::vector<size_t> slots;              // per run
     std::vector<SlotContent> acknowledged;  // per run
+    std::vector<size_t> runEnds;            // per run: the operations recorded when it ended
+    crash::FsImage durable;
+    std::vector<crash::FsOp> ops;
 };
 
 std::vector<SlotContent> openStore(const fs::path& root, size_t slotCount) {
@@ -156,6 +187,7 @@ Recording record(const Options& options, const std::string& updates, size_t slot
     const fs::path mountPoint = options.work / "mnt";
     const fs::path inputs = options.work / "inputs";
     fs::create_directories(mountPoint);
+    fs::remove_all(inputs);
     fs::create_directories(inputs);
     std::vector<std::string> mkfs = fileSystem.mkfs;
     mkfs.push_back(options.data.string());
@@ -172,38 +204,49 @@ Recording record(const Options& options, const std::string& updates, size_t slot
             run(command, testing_support::recordEnv("", "", crash::kClockStart));
         }
     }
+    recording.durable = crash::snapshotTree(root);
     unmount(mountPoint);
     recording.base = testing_support::readBytes(options.data);
 
     const fs::path node = createLogTarget(options, recording.base.size() / 512);
     mountDevice(fileSystem, node, mountPoint);
+    std::vector<crash::FsOp> raw;
     for (size_t index = 0; index < updates.size(); ++index) {
         const char update = updates[index];
         const std::vector<uint8_t> blob = crash::blobFor(index + 1, slotCount);
         const std::vector<std::string> command =
             crash::updateCommand(kPrograms, update, root, slotCount, slot, blob, inputs);
-        mark("begin:" + std::to_string(index));
-        const ProcessResult outcome =
-            testing_support::runProgram(command, testing_support::recordEnv("", "", crash::clockOf(clock, index)));
+        const fs::path recordFile = inputs / ("record" + std::to_string(index));
+        mark(options, "begin:" + std::to_string(index));
+        const ProcessResult outcome = testing_support::runProgram(
+            command, testing_support::recordEnv(recordFile.string(), root.string() + "/", crash::clockOf(clock, index)));
         if (outcome.exitStatus != 0)
             throw std::runtime_error(std::string("update ") + update + " failed:\n" + outcome.err);
-        mark("ack:" + std::to_string(index));
+        mark(options, "ack:" + std::to_string(index));
+        const std::vector<crash::FsOp> ops = crash::readFsRecord(recordFile);
+        raw.insert(raw.end(), ops.begin(), ops.end());
+        recording.runEnds.push_back(raw.size());
         recording.slots.push_back(slot);
         recording.acknowledged.push_back(update == 'X' ? openStore(root, slotCount)[slot]
                                                        : crash::reportedState(outcome.out));
     }
     unmount(mountPoint);
-    run({"/sbin/dmsetup", "remove", kTargetName});
+    run({"/sbin/dmsetup", "remove", options.logTarget});
     recording.log = replay::readWriteLog(options.log);
+    recording.ops = crash::prepareRecord(raw, root, recording.durable);
+    if (recording.ops.size() != raw.size()) throw std::runtime_error("a run's record reaches outside the store");
     return recording;
 }
 
 // What the marks before `reach` say: every slot's acknowledged content,
-// and the run in flight (or none).
+// the run in flight (or none), and the cuts of the runs' record the
+// device can be at.
 struct Expectation {
     std::vector<SlotContent> acknowledged;
     const SlotContent* inFlight = nullptr;
     size_t inFlightSlot = 0;
+    size_t firstCut = 0;
+    size_t lastCut = 0;
 };
 
 Expectation expectationAt(const Recording& recording, size_t reach) {
@@ -216,74 +259,137 @@ Expectation expectationAt(const Recording& recording, size_t reach) {
         if (std::sscanf(entry.mark.c_str(), "begin:%zu", &run) == 1) {
             expectation.inFlight = &recording.acknowledged.at(run);
             expectation.inFlightSlot = recording.slots.at(run);
+            expectation.lastCut = recording.runEnds.at(run);
         } else if (std::sscanf(entry.mark.c_str(), "ack:%zu", &run) == 1) {
             expectation.acknowledged[recording.slots.at(run)] = recording.acknowledged.at(run);
             expectation.inFlight = nullptr;
+            expectation.firstCut = expectation.lastCut = recording.runEnds.at(run);
         }
     }
     return expectation;
 }
 
-// The problem with the device as the cut at `point` left it, or "".
-std::string check(const Options& options, const Recording& recording, const replay::CrashPoint& point, size_t slotCount,
-                  Totals& totals) {
-    std::vector<uint8_t> image = recording.base;
-    replay::applyCrashPoint(recording.log, point, image);
-    const fs::path imageFile = options.work / "crash.img";
-    testing_support::writeBytes(imageFile, image);
+// What a device showed: the store's tree as mounted, and what two
+// openings of the store served. Points that leave the same bytes share it.
+struct Observation {
+    std::string problem;  // the mount or the store failed
+    bool repaired = false;
+    crash::FsImage tree;
+    std::vector<SlotContent> first;
+    std::vector<SlotContent> second;
+};
+
+Observation observe(const Options& options, const Recording& recording, const replay::SectorOverlay& overlay,
+                    size_t slotCount) {
+    const uint64_t sectors = recording.base.size() / 512;
+    replay::PointDevice device(options.pointTarget, options.origin, options.cow, sectors, overlay, recording.log.sectorSize);
+    const FileSystem& fileSystem = *options.fileSystem;
     const fs::path mountPoint = options.work / "mnt";
-    const ProcessResult mounted = testing_support::runProgram(
-        {"/bin/mount", "-t", options.fileSystem->type, "-o",
-         "loop" + (options.fileSystem->options.empty() ? "" : "," + options.fileSystem->options), imageFile.string(),
-         mountPoint.string()});
-    if (mounted.exitStatus != 0) return "the file system does not mount: " + mounted.err;
-    std::string problem;
+    Observation observation;
+    if (!tryMount(fileSystem, device.node(), mountPoint)) {
+        const std::string refusal = std::strerror(errno);
+        std::vector<std::string> repair = fileSystem.repair;
+        repair.push_back(device.node().string());
+        const ProcessResult repaired = testing_support::runProgram(repair);
+        // fsck: 1 and 2 mean errors corrected.
+        if (repaired.exitStatus < 0 || repaired.exitStatus > 2 || !tryMount(fileSystem, device.node(), mountPoint)) {
+            observation.problem = "the file system does not mount (" + refusal + "), nor after " + repair[0] +
+                                  " (exit " + std::to_string(repaired.exitStatus) + "): " + repaired.out + repaired.err;
+            return observation;
+        }
+        observation.repaired = true;
+    }
     try {
         const fs::path root = mountPoint / "store";
-        totals.states.insert(std::to_string(slotCount) + "\n" +
-                             (fs::exists(root) ? crash::fingerprint(crash::snapshotTree(root)) : "no store"));
-        const std::vector<SlotContent> first = openStore(root, slotCount);
-        const std::vector<SlotContent> second = openStore(root, slotCount);
-        const Expectation expected = expectationAt(recording, point.reach());
-        for (size_t slot = 0; slot < slotCount && problem.empty(); ++slot) {
-            const bool allowed =
-                first[slot] == expected.acknowledged[slot] ||
-                (expected.inFlight != nullptr && expected.inFlightSlot == slot && first[slot] == *expected.inFlight);
-            if (!allowed) problem = "slot " + std::to_string(slot) + " shows " + crash::reportText(first[slot]);
-        }
-        if (problem.empty() && first != second) problem = "a second opening disagrees";
+        observation.tree = crash::snapshotTree(root);
+        observation.first = openStore(root, slotCount);
+        observation.second = openStore(root, slotCount);
     } catch (const std::exception& error) {
-        problem = std::string("reading the store failed: ") + error.what();
+        observation.problem = std::string("reading the store failed: ") + error.what();
     }
-    run({"/bin/umount", mountPoint.string()});
-    return problem;
+    unmount(mountPoint);
+    return observation;
+}
+
+// The store's rules: every slot holds what was acknowledged or the run in
+// flight, and a second opening agrees.
+std::string violation(const Observation& seen, const Expectation& expected, size_t slotCount) {
+    if (!seen.problem.empty()) return seen.problem;
+    for (size_t slot = 0; slot < slotCount; ++slot) {
+        const bool allowed =
+            seen.first[slot] == expected.acknowledged[slot] ||
+            (expected.inFlight != nullptr && expected.inFlightSlot == slot && seen.first[slot] == *expected.inFlight);
+        if (!allowed) return "slot " + std::to_string(slot) + " shows " + crash::reportText(seen.first[slot]);
+    }
+    return seen.first == seen.second ? "" : "a second opening disagrees";
+}
+
+size_t hashOf(const replay::SectorOverlay& overlay) {
+    std::string text;
+    for (const auto& [sector, bytes] : overlay) {
+        text.append(reinterpret_cast<const char*>(&sector), sizeof sector);
+        text.append(bytes.begin(), bytes.end());
+    }
+    return std::hash<std::string>{}(text);
 }
 
 std::string scenarioName(const std::string& updates, size_t slotCount, Clock clock) {
     return updates + "_" + std::to_string(slotCount) + "slot_" + crash::clockName(clock);
 }
 
+struct Reports {
+    std::vector<std::string> violations;
+    std::vector<std::string> outsideModel;
+};
+
+void report(std::vector<std::string>& list, const std::string& text) {
+    if (list.size() < kReportedProblems) list.push_back(text);
+}
+
 void explore(const Options& options, const std::string& updates, size_t slotCount, Clock clock, Totals& totals,
-             std::vector<std::string>& reports) {
+             Reports& reports) {
     const Recording recording = record(options, updates, slotCount, clock);
+    testing_support::writeBytes(options.origin, recording.base);
     const std::vector<replay::CrashPoint> points = replay::crashPoints(recording.log, options.choice);
+    replay::ModelStates model(recording.durable, recording.ops);
+    const std::string name = options.fileSystem->name + " " + scenarioName(updates, slotCount, clock);
+    std::map<size_t, Observation> seen;
     size_t violations = 0;
+    size_t outside = 0;
     for (const replay::CrashPoint& point : points) {
-        const std::string problem = check(options, recording, point, slotCount, totals);
-        if (problem.empty()) continue;
-        ++violations;
-        if (reports.size() < kReportedViolations) {
-            reports.push_back(options.fileSystem->name + " " + scenarioName(updates, slotCount, clock) + ": " +
-                              point.describe() + ": " + problem);
+        const replay::SectorOverlay overlay =
+            replay::crashOverlay(recording.log, point, recording.base.size() / recording.log.sectorSize);
+        const size_t key = hashOf(overlay);
+        auto known = seen.find(key);
+        if (known == seen.end()) {
+            known = seen.emplace(key, observe(options, recording, overlay, slotCount)).first;
+            if (known->second.repaired) ++totals.repaired;
+            if (known->second.problem.empty()) {
+                totals.states.insert(std::to_string(slotCount) + "\n" + replay::visibleState(known->second.tree));
+            }
+        }
+        const Observation& observation = known->second;
+        const Expectation expected = expectationAt(recording, point.reach());
+        const std::string problem = violation(observation, expected, slotCount);
+        if (!problem.empty()) {
+            ++violations;
+            report(reports.violations, name + ": " + point.describe() + ": " + problem);
+        }
+        if (observation.problem.empty() && !model.allows(observation.tree, expected.firstCut, expected.lastCut)) {
+            ++outside;
+            report(reports.outsideModel, name + ": " + point.describe() + ": operations " +
+                                             std::to_string(expected.firstCut) + ".." +
+                                             std::to_string(expected.lastCut) + " do not give\n" +
+                                             crash::fingerprint(observation.tree));
         }
     }
     ++totals.scenarios;
     totals.entries += recording.log.entries.size();
     totals.points += points.size();
     totals.violations += violations;
-    std::printf("%s %s: %zu log entries, %zu crash points, %zu violations\n", options.fileSystem->name.c_str(),
-                scenarioName(updates, slotCount, clock).c_str(), recording.log.entries.size(), points.size(),
-                violations);
+    totals.outsideModel += outside;
+    std::printf("%s: %zu log entries, %zu crash points, %zu devices mounted, %zu violations, %zu outside the model\n",
+                name.c_str(), recording.log.entries.size(), points.size(), seen.size(), violations, outside);
     std::fflush(stdout);
 }
 
@@ -295,7 +401,7 @@ std::vector<std::string> split(const std::string& text) {
 }
 
 [[noreturn]] void usage(const std::string& problem) {
-    std::fprintf(stderr, "block_replay: %s\nusage: block_replay FS DATA LOG WORK [options] [UPDATES...]\n",
+    std::fprintf(stderr, "block_replay: %s\nusage: block_replay FS DATA LOG ORIGIN COW WORK [options] [UPDATES...]\n",
                  problem.c_str());
     std::exit(2);
 }
@@ -338,15 +444,19 @@ Options parse(int argc, char** argv) {
             positional.push_back(word);
         }
     }
-    if (positional.size() < 4) usage("FS, DATA, LOG and WORK are needed");
+    if (positional.size() < 6) usage("FS, DATA, LOG, ORIGIN, COW and WORK are needed");
     for (const FileSystem& fileSystem : kFileSystems) {
         if (fileSystem.name == positional[0]) options.fileSystem = &fileSystem;
     }
     if (options.fileSystem == nullptr) usage("unknown file system " + positional[0]);
+    options.logTarget = "replay-log-" + options.fileSystem->name;
+    options.pointTarget = "replay-point-" + options.fileSystem->name;
     options.data = positional[1];
     options.log = positional[2];
-    options.work = positional[3];
-    options.scenarios.assign(positional.begin() + 4, positional.end());
+    options.origin = positional[3];
+    options.cow = positional[4];
+    options.work = positional[5];
+    options.scenarios.assign(positional.begin() + 6, positional.end());
     if (options.broken) {
         options.scenarios = {"WXX"};
         options.slotCounts = {1};
@@ -367,7 +477,7 @@ Options parse(int argc, char** argv) {
 int main(int argc, char** argv) {
     const Options options = parse(argc, argv);
     Totals totals;
-    std::vector<std::string> reports;
+    Reports reports;
     try {
         fs::create_directories(options.work);
         for (const size_t slotCount : options.slotCounts) {
@@ -381,9 +491,17 @@ int main(int argc, char** argv) {
         std::fprintf(stderr, "block_replay: %s\n", error.what());
         return 1;
     }
-    for (const std::string& report : reports) std::printf("violation: %s\n", report.c_str());
-    std::printf("%s %s: %zu scenarios, %zu log entries, %zu crash points, %zu distinct states, %zu violations\n",
+    for (const std::string& text : reports.violations) std::printf("violation: %s\n", text.c_str());
+    for (const std::string& text : reports.outsideModel) std::printf("outside the model: %s\n", text.c_str());
+    if (totals.repaired > 0) {
+        std::printf("%s: %zu devices mounted only after %s\n", options.fileSystem->name.c_str(), totals.repaired,
+                    options.fileSystem->repair[0].c_str());
+    }
+    std::printf("%s %s: %zu scenarios, %zu log entries, %zu crash points, %zu distinct states, %zu violations, %zu "
+                "outside the model\n",
                 options.broken ? "broken writer" : "replay", options.fileSystem->name.c_str(), totals.scenarios,
-                totals.entries, totals.points, totals.states.size(), totals.violations);
-    return options.broken == (totals.violations > 0) ? 0 : 1;
+                totals.entries, totals.points, totals.states.size(), totals.violations, totals.outsideModel);
+    if (options.broken) return totals.violations > 0 ? 0 : 1;
+    const bool modelHolds = !options.fileSystem->modelled || totals.outsideModel == 0;
+    return totals.violations == 0 && modelHolds ? 0 : 1;
 }

@@ -31,35 +31,53 @@ std::vector<std::pair<size_t, size_t>> epochs(const WriteLog& log) {
     return result;
 }
 
-void addSubsets(const std::vector<size_t>& writes, size_t prefix, const CrashPointChoice& choice,
-                std::mt19937_64& random, std::vector<CrashPoint>& points) {
+// The epoch's writes that a cut keeping `members` leaves: those, and
+// every forced-unit-access write that completed before the last of them
+// (it was on the medium when it completed).
+std::vector<size_t> keptWrites(const WriteLog& log, const std::vector<size_t>& writes,
+                               const std::vector<bool>& members) {
+    std::vector<size_t> kept;
+    size_t last = 0;
+    for (size_t bit = 0; bit < writes.size(); ++bit) {
+        if (members[bit]) last = bit;
+    }
+    for (size_t bit = 0; bit < writes.size(); ++bit) {
+        const bool durable = bit < last && (log.entries[writes[bit]].flags & kFua) != 0;
+        if (members[bit] || durable) kept.push_back(writes[bit]);
+    }
+    return kept;
+}
+
+void addSubsets(const WriteLog& log, const std::vector<size_t>& writes, size_t prefix,
+                const CrashPointChoice& choice, std::mt19937_64& random, std::vector<CrashPoint>& points) {
     if (writes.size() < 2 || choice.subsetsPerEpoch == 0) return;
-    std::set<std::vector<bool>> chosen;
+    std::set<std::vector<size_t>> chosen;
+    const auto choose = [&](const std::vector<bool>& members) {
+        std::vector<size_t> kept = keptWrites(log, writes, members);
+        // All of them is the cut after the epoch, a prefix.
+        if (kept.size() < writes.size()) chosen.insert(std::move(kept));
+    };
     const bool every = writes.size() < 63 && (uint64_t{1} << writes.size()) - 2 <= choice.subsetsPerEpoch;
     if (every) {
         for (uint64_t mask = 1; mask + 1 < (uint64_t{1} << writes.size()); ++mask) {
             std::vector<bool> members(writes.size());
             for (size_t bit = 0; bit < writes.size(); ++bit) members[bit] = (mask >> bit & 1) != 0;
-            chosen.insert(members);
+            choose(members);
         }
     } else {
-        while (chosen.size() < choice.subsetsPerEpoch) {
+        // Forced writes make some draws alike: a bounded number of tries.
+        for (size_t tries = 0; chosen.size() < choice.subsetsPerEpoch && tries < 64 * choice.subsetsPerEpoch;
+             ++tries) {
             std::vector<bool> members(writes.size());
-            size_t count = 0;
-            for (size_t bit = 0; bit < writes.size(); ++bit) {
-                members[bit] = (random() & 1) != 0;
-                count += members[bit];
-            }
-            if (count > 0 && count < writes.size()) chosen.insert(members);
+            for (size_t bit = 0; bit < writes.size(); ++bit) members[bit] = (random() & 1) != 0;
+            if (std::find(members.begin(), members.end(), true) != members.end()) choose(members);
         }
     }
-    for (const std::vector<bool>& members : chosen) {
+    for (const std::vector<size_t>& kept : chosen) {
         CrashPoint point;
         point.kind = CrashKind::kReordered;
         point.prefix = prefix;
-        for (size_t bit = 0; bit < writes.size(); ++bit) {
-            if (members[bit]) point.extra.push_back(writes[bit]);
-        }
+        point.extra = kept;
         points.push_back(std::move(point));
     }
 }
@@ -89,13 +107,25 @@ void addTorn(const WriteLog& log, size_t index, const CrashPointChoice& choice, 
     }
 }
 
-uint8_t* sectorsOf(const WriteLog& log, const LogEntry& entry, std::vector<uint8_t>& device) {
-    const uint64_t begin = entry.sector * log.sectorSize;
-    const uint64_t length = entry.sectorCount * log.sectorSize;
-    if (begin > device.size() || length > device.size() - begin) {
+void checkWithin(const LogEntry& entry, uint64_t deviceSectors) {
+    if (entry.sector > deviceSectors || entry.sectorCount > deviceSectors - entry.sector) {
         throw std::out_of_range("log entry at sector " + std::to_string(entry.sector) + " lies beyond the device");
     }
-    return device.data() + begin;
+}
+
+// The bytes `entry` leaves in each of its sectors (a discard leaves zeros).
+void layEntry(const WriteLog& log, const LogEntry& entry, uint64_t deviceSectors, SectorOverlay& overlay) {
+    if (entry.isMark() || entry.sectorCount == 0) return;
+    checkWithin(entry, deviceSectors);
+    for (uint64_t i = 0; i < entry.sectorCount; ++i) {
+        std::vector<uint8_t>& bytes = overlay[entry.sector + i];
+        if (entry.isDiscard()) {
+            bytes.assign(log.sectorSize, 0);
+        } else {
+            const auto from = entry.data.begin() + static_cast<long>(i * log.sectorSize);
+            bytes.assign(from, from + log.sectorSize);
+        }
+    }
 }
 
 }  // namespace
@@ -142,42 +172,43 @@ std::vector<CrashPoint> crashPoints(const WriteLog& log, const CrashPointChoice&
         for (size_t i = 0; i <= log.entries.size(); ++i) points.push_back(CrashPoint{CrashKind::kPrefix, i, {}, 0, {}});
     }
     std::mt19937_64 random(choice.seed);
-    for (const auto& [begin, end] : epochs(log)) addSubsets(writesIn(log, begin, end), begin, choice, random, points);
+    for (const auto& [begin, end] : epochs(log)) addSubsets(log, writesIn(log, begin, end), begin, choice, random, points);
     for (const size_t index : writesIn(log, 0, log.entries.size())) addTorn(log, index, choice, random, points);
     return points;
 }
 
-void applyEntry(const WriteLog& log, const LogEntry& entry, std::vector<uint8_t>& device) {
-    if (entry.isMark() || entry.sectorCount == 0) return;
-    uint8_t* target = sectorsOf(log, entry, device);
-    if (entry.isDiscard()) {
-        std::fill_n(target, entry.sectorCount * log.sectorSize, 0);
-    } else {
-        std::copy(entry.data.begin(), entry.data.end(), target);
-    }
-}
-
-void applyCrashPoint(const WriteLog& log, const CrashPoint& point, std::vector<uint8_t>& device) {
-    for (size_t i = 0; i < point.prefix; ++i) applyEntry(log, log.entries[i], device);
-    for (const size_t i : point.extra) applyEntry(log, log.entries[i], device);
-    if (point.kind != CrashKind::kTorn) return;
+SectorOverlay crashOverlay(const WriteLog& log, const CrashPoint& point, uint64_t deviceSectors) {
+    SectorOverlay overlay;
+    for (size_t i = 0; i < point.prefix; ++i) layEntry(log, log.entries[i], deviceSectors, overlay);
+    for (const size_t i : point.extra) layEntry(log, log.entries[i], deviceSectors, overlay);
+    if (point.kind != CrashKind::kTorn) return overlay;
     const LogEntry& entry = log.entries.at(point.torn);
-    uint8_t* target = sectorsOf(log, entry, device);
+    checkWithin(entry, deviceSectors);
+    // An old sector keeps what the prefix left.
     for (size_t sector = 0; sector < point.fates.size(); ++sector) {
-        uint8_t* bytes = target + sector * log.sectorSize;
+        const uint64_t at = entry.sector + sector;
         switch (point.fates[sector]) {
             case SectorFate::kOld:
                 break;
-            case SectorFate::kNew:
-                std::copy_n(entry.data.begin() + static_cast<long>(sector * log.sectorSize), log.sectorSize, bytes);
+            case SectorFate::kNew: {
+                const auto from = entry.data.begin() + static_cast<long>(sector * log.sectorSize);
+                overlay[at].assign(from, from + log.sectorSize);
                 break;
+            }
             case SectorFate::kZeros:
-                std::fill_n(bytes, log.sectorSize, 0);
+                overlay[at].assign(log.sectorSize, 0);
                 break;
             case SectorFate::kErased:
-                std::fill_n(bytes, log.sectorSize, 0xff);
+                overlay[at].assign(log.sectorSize, 0xff);
                 break;
         }
+    }
+    return overlay;
+}
+
+void applyCrashPoint(const WriteLog& log, const CrashPoint& point, std::vector<uint8_t>& device) {
+    for (const auto& [sector, bytes] : crashOverlay(log, point, device.size() / log.sectorSize)) {
+        std::copy(bytes.begin(), bytes.end(), device.begin() + static_cast<long>(sector * log.sectorSize));
     }
 }
 

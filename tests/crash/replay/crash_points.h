@@ -5,12 +5,14 @@
 // Writes are logged in the order they completed, and only once a flush
 // covered them; a flush entry closes an epoch. Before that flush
 // completes, the epoch's writes may sit in the device's volatile cache, so
-// a cut can keep any subset of them. A write that was being programmed
+// a cut can keep any subset of them, but for a forced-unit-access write:
+// it was on the medium when it completed. A write that was being programmed
 // when the power failed may land in part: each of its sectors old, new,
 // all zeros or all 0xFF (an erased flash block).
 #pragma once
 
 #include <cstdint>
+#include <map>
 #include <string>
 #include <vector>
 
@@ -54,11 +56,17 @@ struct CrashPointChoice {
 // Every crash point of `log` the choice asks for, each kind in log order.
 std::vector<CrashPoint> crashPoints(const WriteLog& log, const CrashPointChoice& choice);
 
+// The sectors (in the log's sector size) that a point gives new bytes,
+// each with its bytes; every other sector keeps what it held when the log
+// started.
+using SectorOverlay = std::map<uint64_t, std::vector<uint8_t>>;
+
+// What `point` lays onto a device of `deviceSectors` sectors. Throws
+// std::out_of_range when an entry lies beyond the device.
+SectorOverlay crashOverlay(const WriteLog& log, const CrashPoint& point, uint64_t deviceSectors);
+
 // Lays `point` onto `device`, the device's bytes when the log started.
 // Throws std::out_of_range when an entry lies beyond the device.
 void applyCrashPoint(const WriteLog& log, const CrashPoint& point, std::vector<uint8_t>& device);
-
-// The effect of one entry on `device` (a discard leaves zeros).
-void applyEntry(const WriteLog& log, const LogEntry& entry, std::vector<uint8_t>& device);
 
 }  // namespace replay

@@ -1,0 +1,74 @@
+#include "model_states.h"
+
+#include <algorithm>
+#include <functional>
+#include <stdexcept>
+#include <string_view>
+#include <tuple>
+
+namespace replay {
+
+namespace {
+
+bool endsWith(const std::string& text, std::string_view suffix) {
+    return text.size() >= suffix.size() && text.compare(text.size() - suffix.size(), suffix.size(), suffix) == 0;
+}
+
+bool sameTime(const timespec& a, const timespec& b) { return a.tv_sec == b.tv_sec && a.tv_nsec == b.tv_nsec; }
+
+}  // namespace
+
+std::string visibleState(const crash::FsImage& image) {
+    std::string key;
+    for (const std::string& directory : image.directories) key += "d " + directory + '\n';
+    struct Check {
+        timespec mtime;
+        const std::string* name;
+    };
+    std::vector<Check> checks;
+    for (const auto& [name, inode] : image.names) {
+        const crash::FileNode& file = image.files.at(inode);
+        const std::string_view data(reinterpret_cast<const char*>(file.data.data()), file.data.size());
+        key += "f " + name + ' ' + std::to_string(file.data.size()) + ' ' +
+               std::to_string(std::hash<std::string_view>{}(data)) + '\n';
+        if (endsWith(name, ".chk")) checks.push_back(Check{file.mtime, &name});
+    }
+    // The store picks among copies by which check file is newer, so the
+    // order is all of the times it can see.
+    std::sort(checks.begin(), checks.end(), [](const Check& a, const Check& b) {
+        return std::tie(a.mtime.tv_sec, a.mtime.tv_nsec, *a.name) < std::tie(b.mtime.tv_sec, b.mtime.tv_nsec, *b.name);
+    });
+    key += "order ";
+    for (size_t i = 0; i < checks.size(); ++i) {
+        if (i > 0) key += sameTime(checks[i - 1].mtime, checks[i].mtime) ? '=' : '<';
+        key += *checks[i].name;
+    }
+    return key + '\n';
+}
+
+ModelStates::ModelStates(crash::FsImage durable, std::vector<crash::FsOp> ops)
+    : durable_(std::move(durable)), ops_(std::move(ops)) {}
+
+bool ModelStates::allows(const crash::FsImage& real, size_t firstCut, size_t lastCut) {
+    return keysOf(firstCut, lastCut).count(visibleState(real)) != 0;
+}
+
+size_t ModelStates::stateCount(size_t firstCut, size_t lastCut) { return keysOf(firstCut, lastCut).size(); }
+
+const std::set<std::string>& ModelStates::keysOf(size_t firstCut, size_t lastCut) {
+    if (firstCut > lastCut || lastCut > ops_.size()) {
+        throw std::out_of_range("no cuts from " + std::to_string(firstCut) + " to " + std::to_string(lastCut) +
+                                " in a record of " + std::to_string(ops_.size()));
+    }
+    const auto window = std::make_pair(firstCut, lastCut);
+    const auto known = windows_.find(window);
+    if (known != windows_.end()) return known->second;
+    std::set<std::string> keys;
+    for (size_t cut = firstCut; cut <= lastCut; ++cut) {
+        crash::forEachCrashState(durable_, ops_, cut, crash::MetadataOrder::kInOrder,
+                                 [&keys](const crash::FsImage& state) { keys.insert(visibleState(state)); });
+    }
+    return windows_.emplace(window, std::move(keys)).first->second;
+}
+
+}  // namespace replay

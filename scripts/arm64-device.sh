@@ -6,7 +6,9 @@
 #   arm64-device.sh shell            boot it with a shell on this terminal
 #   arm64-device.sh power-cuts N [SEED]
 #                                    cut its power N times at random moments (see power_cuts.py)
-# test, shell and power-cuts build first (again only what changed). Exit
+#   arm64-device.sh replay [--quick] record every block write of the crash scenarios and check
+#                                    every crash point of the log (tests/device/arm64/replay.sh)
+# test, shell, power-cuts and replay build first (again only what changed). Exit
 # status: 0 when everything passed; 1 otherwise (a failed test, a boot that
 # did not reach its end in time, a violation).
 set -euo pipefail
@@ -20,7 +22,7 @@ card=$out/card.img
 assembled=$out/guest-assembled
 
 usage() {
-  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED]" >&2
+  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED] | replay [--quick]" >&2
   exit 2
 }
 
@@ -118,6 +120,26 @@ run_tests() {
   case $summary in *" failed=0") ;; *) return 1 ;; esac
 }
 
+# The replay's set: quick (within ten minutes) or full (hours).
+run_replay() {
+  local set=$1 limit=$2
+  build
+  local log=$out/replay-$set-console.log work=$out/replay-card.img start=$SECONDS
+  fresh_card "$work"
+  boot "replay arm64_replay=$set" "$limit" "$work" </dev/null | sed -u 's/\r$//' | tee "$log" |
+    grep --line-buffered -E '^(@@ (replay |broken writer |violation|outside the model|[a-z0-9-]+: [0-9]+ (after|devices))|arm64-device:)' || true
+  rm -f "$work"
+  echo "=== arm64-device replay $set: $((SECONDS - start)) s"
+  if ! grep -q '^@@ end of replay' "$log"; then
+    echo "arm64-device: the guest did not reach the end of the replay (console: $log)" >&2
+    return 1
+  fi
+  if grep -E '^@@ [a-z0-9-]+: [0-9]+ after' "$log" | grep -qvE ': 0 after'; then
+    echo "arm64-device: the replay found problems (console: $log)" >&2
+    return 1
+  fi
+}
+
 case ${1:-} in
   build) mkdir -p "$out"; build ;;
   test) mkdir -p "$out"; run_tests ;;
@@ -125,7 +147,9 @@ case ${1:-} in
     mkdir -p "$out"
     build
     fresh_card "$out/shell-card.img"
-    boot shell 86400 "$out/shell-card.img"
+    # In the foreground: qemu reads this terminal.
+    qemu_words shell "$out/shell-card.img"
+    "${words[@]}"
     ;;
   power-cuts)
     [ $# -ge 2 ] || usage
@@ -133,6 +157,14 @@ case ${1:-} in
     build
     qemu_words @MODE@ @CARD@
     python3 "$guest/power_cuts.py" "$out" "$2" "${3:-$RANDOM}" -- "${words[@]}"
+    ;;
+  replay)
+    mkdir -p "$out"
+    case ${2:-} in
+      --quick) run_replay quick 900 ;;
+      "") run_replay full 172800 ;;
+      *) usage ;;
+    esac
     ;;
   *) usage ;;
 esac

@@ -36,7 +36,7 @@ WHOLE_PACKAGES = ["coreutils"]
 RUNTIME_PACKAGES = ["libc6", "libstdc++6", "libgcc-s1"]
 
 # The kernel's modules the guest loads, with what they need (modules.dep).
-MODULES = ["sdhci-pci", "ext4", "crc32c_generic", "loop", "dm-mod", "dm-log-writes", "f2fs", "vfat"]
+MODULES = ["sdhci-pci", "ext4", "crc32c_generic", "crc32_generic", "loop", "dm-mod", "dm-log-writes", "dm-snapshot", "f2fs", "vfat"]
 
 
 def run(*args, **kwargs):

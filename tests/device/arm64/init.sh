@@ -7,6 +7,8 @@
 #   shell     an interactive shell on the console; power off when it ends
 #   workload  the power-cut workload, until the host cuts the power
 #   verify    print what every store of the workload holds, power off
+#   replay    record and replay block writes (replay.sh), with
+#             arm64_replay=quick|full, report over the console, power off
 /bin/busybox --install -s
 export PATH=/usr/sbin:/usr/bin:/sbin:/bin
 export HOME=/root
@@ -52,8 +54,12 @@ mount -a || echo "arm64-device: not every file system of /etc/fstab could be mou
 echo /dev/mmcblk0 >/run/arm64-device
 
 mode=
+replay_set=
 for word in $(cat /proc/cmdline); do
-    case $word in arm64_device=*) mode=${word#arm64_device=} ;; esac
+    case $word in
+        arm64_device=*) mode=${word#arm64_device=} ;;
+        arm64_replay=*) replay_set=${word#arm64_replay=} ;;
+    esac
 done
 echo "arm64-device: ready after $(cut -d ' ' -f 1 /proc/uptime) s, mode ${mode:-none}"
 
@@ -63,6 +69,7 @@ case $mode in
     shell) setsid cttyhack sh -l ;;
     workload) sh "$guest/workload.sh" ;;
     verify) sh "$guest/workload.sh" verify ;;
+    replay) bash "$guest/replay.sh" "$replay_set" ;;
     *) echo "arm64-device: unknown mode '$mode'" ;;
 esac
 cd /

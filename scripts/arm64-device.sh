@@ -6,7 +6,8 @@
 #   arm64-device.sh shell            boot it with a shell on this terminal
 #   arm64-device.sh power-cuts N [SEED]
 #                                    cut its power N times at random moments (see power_cuts.py)
-#   arm64-device.sh replay [--quick] record every block write of the crash scenarios and check
+#   arm64-device.sh replay [--quick|--sample]
+#                                    record every block write of the crash scenarios and check
 #                                    every crash point of the log (tests/device/arm64/replay.sh)
 # test, shell, power-cuts and replay build first (again only what changed). Exit
 # status: 0 when everything passed; 1 otherwise (a failed test, a boot that
@@ -22,7 +23,7 @@ card=$out/card.img
 assembled=$out/guest-assembled
 
 usage() {
-  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED] | replay [--quick]" >&2
+  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED] | replay [--quick|--sample]" >&2
   exit 2
 }
 
@@ -120,7 +121,8 @@ run_tests() {
   case $summary in *" failed=0") ;; *) return 1 ;; esac
 }
 
-# The replay's set: quick (within ten minutes) or full (hours).
+# The replay's set: quick (within ten minutes), sample (half an hour) or
+# full (about thirteen hours).
 run_replay() {
   local set=$1 limit=$2
   build
@@ -162,6 +164,7 @@ case ${1:-} in
     mkdir -p "$out"
     case ${2:-} in
       --quick) run_replay quick 900 ;;
+      --sample) run_replay sample 7200 ;;
       "") run_replay full 172800 ;;
       *) usage ;;
     esac

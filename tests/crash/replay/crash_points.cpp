@@ -48,8 +48,8 @@ std::vector<size_t> keptWrites(const WriteLog& log, const std::vector<size_t>& w
     return kept;
 }
 
-void addSubsets(const WriteLog& log, const std::vector<size_t>& writes, size_t prefix,
-                const CrashPointChoice& choice, std::mt19937_64& random, std::vector<CrashPoint>& points) {
+void addSubsets(const WriteLog& log, const std::vector<size_t>& writes, size_t prefix, const CrashPointChoice& choice,
+                std::mt19937_64& random, std::vector<CrashPoint>& points) {
     if (writes.size() < 2 || choice.subsetsPerEpoch == 0) return;
     std::set<std::vector<size_t>> chosen;
     const auto choose = [&](const std::vector<bool>& members) {
@@ -66,8 +66,7 @@ void addSubsets(const WriteLog& log, const std::vector<size_t>& writes, size_t p
         }
     } else {
         // Forced writes make some draws alike: a bounded number of tries.
-        for (size_t tries = 0; chosen.size() < choice.subsetsPerEpoch && tries < 64 * choice.subsetsPerEpoch;
-             ++tries) {
+        for (size_t tries = 0; chosen.size() < choice.subsetsPerEpoch && tries < 64 * choice.subsetsPerEpoch; ++tries) {
             std::vector<bool> members(writes.size());
             for (size_t bit = 0; bit < writes.size(); ++bit) members[bit] = (random() & 1) != 0;
             if (std::find(members.begin(), members.end(), true) != members.end()) choose(members);
@@ -172,7 +171,8 @@ std::vector<CrashPoint> crashPoints(const WriteLog& log, const CrashPointChoice&
         for (size_t i = 0; i <= log.entries.size(); ++i) points.push_back(CrashPoint{CrashKind::kPrefix, i, {}, 0, {}});
     }
     std::mt19937_64 random(choice.seed);
-    for (const auto& [begin, end] : epochs(log)) addSubsets(log, writesIn(log, begin, end), begin, choice, random, points);
+    for (const auto& [begin, end] : epochs(log))
+        addSubsets(log, writesIn(log, begin, end), begin, choice, random, points);
     for (const size_t index : writesIn(log, 0, log.entries.size())) addTorn(log, index, choice, random, points);
     return points;
 }

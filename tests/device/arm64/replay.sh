@@ -5,6 +5,8 @@
 #
 #   replay.sh quick   ext4 with its defaults and f2fs on a subset of the
 #                     scenarios: flushes and every prefix, few reorderings
+#   replay.sh sample  every file system and every kind of point on four
+#                     scenarios, one and three slots
 #   replay.sh full    every file system, every scenario, every kind of point
 #
 # The card has no volatile cache: the kernel drops every flush before it
@@ -23,7 +25,13 @@ case $set_name in
         file_systems="ext4 f2fs"
         broken_file_systems="ext4"
         choice=(--slots=1,3 --clocks=forward --subsets=2 --torn=0)
-        scenarios=(WWW BBB AAA EEE WBA BAE AEW EWB)
+        scenarios=(WWW EEE WBA BAE AEW EWB)
+        ;;
+    sample)
+        file_systems="ext4 ext4-journal ext4-writeback f2fs"
+        broken_file_systems=$file_systems
+        choice=(--slots=1,3 --clocks=forward --subsets=20 --torn=4)
+        scenarios=(WBA BAE AEW EWB)
         ;;
     full)
         file_systems="ext4 ext4-journal ext4-writeback f2fs"
@@ -37,39 +45,50 @@ case $set_name in
         ;;
 esac
 
-# Four devices for one file system: its data, the log, the device as the
-# log started and the changes of each crash point.
-devices_for() {
+# Four loop devices for one file system, made one after the other (two
+# searches for a free device at once may find the same): its data, the
+# log, the device as the log started and the changes of each crash point.
+# Their names go to $work/NAME.devices.
+make_devices() {
     local name=$1 role size
+    : >"$work/$name.devices"
     for role in data:64M log:512M origin:64M cow:64M; do
         size=${role#*:}
         role=${role%%:*}
         truncate -s "$size" "$work/$name.$role"
-        losetup -f --show "$work/$name.$role"
+        losetup -f --show "$work/$name.$role" >>"$work/$name.devices"
     done
 }
 
 run_one() {
-    local name=$1 start=$SECONDS
+    local name=$1 start=$SECONDS line devices
     shift
-    local devices
-    mapfile -t devices < <(devices_for "$name")
+    mapfile -t devices <"$work/$name.devices"
     mkdir -p "$work/$name"
-    "$replay" "$name" "${devices[@]}" "$work/$name" "$@" 2>&1 | sed -u "s/^/@@ /"
+    "$replay" "$name" "${devices[@]}" "$work/$name" "$@" 2>&1 |
+        while IFS= read -r line; do echo "@@ $line"; done
     echo "@@ $name: ${PIPESTATUS[0]} after $((SECONDS - start)) s"
-    for device in "${devices[@]}"; do losetup -d "$device"; done
-    rm -f "$work/$name".*
+}
+
+free_devices() {
+    local name=$1 device
+    while read -r device; do losetup -d "$device"; done <"$work/$name.devices"
+    rm -rf "$work/$name" "$work/$name".*
 }
 
 start=$SECONDS
 set -- $file_systems
 while [ $# -gt 0 ]; do
-    run_one "$1" "${choice[@]}" "${scenarios[@]}" &
-    [ $# -gt 1 ] && run_one "$2" "${choice[@]}" "${scenarios[@]}" &
+    pair="$1 ${2:-}"
+    for name in $pair; do make_devices "$name"; done
+    for name in $pair; do run_one "$name" "${choice[@]}" "${scenarios[@]}" & done
     wait
+    for name in $pair; do free_devices "$name"; done
     shift $(($# > 1 ? 2 : 1))
 done
 for name in $broken_file_systems; do
+    make_devices "$name"
     run_one "$name" --broken "${choice[@]}"
+    free_devices "$name"
 done
 echo "@@ end of replay after $((SECONDS - start)) s"

@@ -19,7 +19,10 @@
 //     --clocks=forward,equal,backward
 //     --subsets=N --torn=N --seed=S  crash points (see crash_points.h)
 //     --broken                       the broken writer's scenario instead
-//   UPDATES: scenarios (default: every sequence of three of W, B, A, E).
+//   UPDATES: scenarios of the store driver's updates W, B, A and E (see
+//            scenario_runs.h), or TTT: three migrations by migrate_settings
+//            into its settings target (one slot). Default: every sequence
+//            of three of W, B, A, E, and TTT.
 //
 // Needs root, the log-writes and snapshot targets, dmsetup and the file
 // system's mkfs and fsck. Prints one line per scenario and the totals:
@@ -70,6 +73,10 @@ using testing_support::ProcessResult;
 // The broken writer rewrites the current copy in place: a cut after its
 // synced data and before its check file leaves only the older copy valid.
 const crash::ScenarioPrograms kPrograms{DUAL_FILE_DRIVER, {BROKEN_ORDER_WRITER, "--in-place"}};
+// Scenarios of the tool itself: each update a one-shot migration into its
+// one-slot settings target, which lives in this directory of its base.
+constexpr char kToolUpdate = 'T';
+constexpr const char* kToolStore = "settings";
 constexpr size_t kReportedProblems = 20;
 
 struct FileSystem {
@@ -174,9 +181,22 @@ struct Recording {
     std::vector<size_t> slots;              // per run
     std::vector<SlotContent> acknowledged;  // per run
     std::vector<size_t> runEnds;            // per run: the operations recorded when it ended
+    fs::path storeDirectory;                // below the file system's "store"
     crash::FsImage durable;
     std::vector<crash::FsOp> ops;
 };
+
+// Where the store of a scenario lives below the file system's "store".
+fs::path storeDirectory(const std::string& updates) {
+    return updates.find(kToolUpdate) == std::string::npos ? "" : kToolStore;
+}
+
+std::vector<std::string> toolCommand(const fs::path& base, const std::vector<uint8_t>& blob, const fs::path& inputs) {
+    const fs::path blobFile = inputs / "blob";
+    testing_support::writeBytes(blobFile, blob);
+    return {MIGRATE_SETTINGS_BIN, "--base", base.string(), "--target", kToolStore, "--type", "simple", "--data",
+            blobFile.string()};
+}
 
 std::vector<SlotContent> openStore(const fs::path& root, size_t slotCount) {
     Storage::DualFileTarget target(root, slotCount);
@@ -197,6 +217,7 @@ Recording record(const Options& options, const std::string& updates, size_t slot
     run(mkfs);
 
     Recording recording;
+    recording.storeDirectory = storeDirectory(updates);
     const fs::path root = mountPoint / "store";
     const size_t slot = slotCount == 1 ? 0 : crash::kUpdatedSlot;
     mountDevice(fileSystem, options.data, mountPoint);
@@ -218,7 +239,8 @@ Recording record(const Options& options, const std::string& updates, size_t slot
         const char update = updates[index];
         const std::vector<uint8_t> blob = crash::blobFor(index + 1, slotCount);
         const std::vector<std::string> command =
-            crash::updateCommand(kPrograms, update, root, slotCount, slot, blob, inputs);
+            update == kToolUpdate ? toolCommand(root, blob, inputs)
+                                  : crash::updateCommand(kPrograms, update, root, slotCount, slot, blob, inputs);
         const fs::path recordFile = inputs / ("record" + std::to_string(index));
         mark(options, "begin:" + std::to_string(index));
         const ProcessResult outcome = testing_support::runProgram(
@@ -231,8 +253,10 @@ Recording record(const Options& options, const std::string& updates, size_t slot
         raw.insert(raw.end(), ops.begin(), ops.end());
         recording.runEnds.push_back(raw.size());
         recording.slots.push_back(slot);
-        recording.acknowledged.push_back(update == 'X' ? openStore(root, slotCount)[slot]
-                                                       : crash::reportedState(outcome.out));
+        // The broken writer and the tool do not report what they left.
+        const bool reports = update != 'X' && update != kToolUpdate;
+        recording.acknowledged.push_back(reports ? crash::reportedState(outcome.out)
+                                                 : openStore(root / recording.storeDirectory, slotCount)[slot]);
     }
     unmount(mountPoint);
     run({"/sbin/dmsetup", "remove", options.logTarget});
@@ -309,8 +333,8 @@ Observation observe(const Options& options, const Recording& recording, const re
     try {
         const fs::path root = mountPoint / "store";
         observation.tree = crash::snapshotTree(root);
-        observation.first = openStore(root, slotCount);
-        observation.second = openStore(root, slotCount);
+        observation.first = openStore(root / recording.storeDirectory, slotCount);
+        observation.second = openStore(root / recording.storeDirectory, slotCount);
     } catch (const std::exception& error) {
         observation.problem = std::string("reading the store failed: ") + error.what();
     }
@@ -482,6 +506,7 @@ Options parse(int argc, char** argv) {
                 for (const char third : kinds) options.scenarios.push_back({first, second, third});
             }
         }
+        options.scenarios.push_back(std::string(3, kToolUpdate));
     }
     return options;
 }
@@ -497,6 +522,8 @@ int main(int argc, char** argv) {
         for (const size_t slotCount : options.slotCounts) {
             for (const Clock clock : options.clocks) {
                 for (const std::string& updates : options.scenarios) {
+                    // The tool's settings target has one slot.
+                    if (!storeDirectory(updates).empty() && slotCount != 1) continue;
                     explore(options, updates, slotCount, clock, totals, reports);
                 }
             }

@@ -25,7 +25,7 @@ case $set_name in
         file_systems="ext4 f2fs"
         broken_file_systems="ext4"
         choice=(--slots=1,3 --clocks=forward --subsets=2 --torn=0)
-        scenarios=(WWW EEE WBA BAE AEW EWB)
+        scenarios=(WWW EEE WBA BAE AEW EWB TTT)
         ;;
     sample)
         file_systems="ext4 ext4-journal ext4-writeback f2fs"

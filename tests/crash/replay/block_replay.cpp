@@ -122,6 +122,7 @@ struct Totals {
     size_t outsideModel = 0;
     size_t repaired = 0;
     size_t unmountable = 0;
+    size_t unmountableTornFua = 0;  // of them, a forced-unit-access write torn
     std::set<std::string> states;
 };
 
@@ -405,7 +406,13 @@ void explore(const Options& options, const std::string& updates, size_t slotCoun
         // no rule of the store's can help, and it is reported apart.
         if (observation.unmountable) {
             ++totals.unmountable;
-            report(reports.unmountable, name + ": " + point.describe() + ": " + observation.problem);
+            // An eMMC with reliable write never tears these: the kernel
+            // writes FUA requests that way.
+            const bool tornFua =
+                point.kind == replay::CrashKind::kTorn && (recording.log.entries[point.torn].flags & replay::kFua) != 0;
+            if (tornFua) ++totals.unmountableTornFua;
+            report(reports.unmountable,
+                   name + ": " + point.describe() + (tornFua ? " (FUA)" : "") + ": " + observation.problem);
             continue;
         }
         const Expectation expected = expectationAt(recording, point.reach());
@@ -536,8 +543,11 @@ int main(int argc, char** argv) {
     for (const std::string& text : reports.violations) std::printf("violation: %s\n", text.c_str());
     for (const std::string& text : reports.outsideModel) std::printf("outside the model: %s\n", text.c_str());
     if (totals.unmountable > 0) {
-        std::printf("%s: %zu crash points left a file system that does not mount, even after %s\n",
-                    options.fileSystem->name.c_str(), totals.unmountable, options.fileSystem->repair[0].c_str());
+        std::printf(
+            "%s: %zu crash points left a file system that does not mount, even after %s (%zu of them a torn "
+            "FUA write)\n",
+            options.fileSystem->name.c_str(), totals.unmountable, options.fileSystem->repair[0].c_str(),
+            totals.unmountableTornFua);
     }
     if (totals.repaired > 0) {
         std::printf("%s: %zu devices mounted only after %s\n", options.fileSystem->name.c_str(), totals.repaired,

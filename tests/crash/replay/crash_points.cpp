@@ -191,6 +191,11 @@ SectorOverlay crashOverlay(const WriteLog& log, const CrashPoint& point, uint64_
             case SectorFate::kOld:
                 break;
             case SectorFate::kNew: {
+                // A discard carries no data: its new bytes are zeros.
+                if (entry.isDiscard()) {
+                    overlay[at].assign(log.sectorSize, 0);
+                    break;
+                }
                 const auto from = entry.data.begin() + static_cast<long>(sector * log.sectorSize);
                 overlay[at].assign(from, from + log.sectorSize);
                 break;

@@ -173,6 +173,19 @@ TEST(CrashPoints, ATornWriteLeavesEachSectorToItsFate) {
     EXPECT_EQ(point.describe(), "entry 1 torn, sectors ONZF");
 }
 
+// A discard carries no data: its new sectors are zeros, as when it lands whole.
+TEST(CrashPoints, ATornDiscardLeavesZerosForItsNewSectors) {
+    WriteLog log;
+    log.entries = {writeEntry(0, 3, 0x11), discardEntry(0, 3)};
+    std::vector<uint8_t> device(4 * kSector, 0xcc);
+    const CrashPoint point{CrashKind::kTorn, 1, {}, 1, {SectorFate::kNew, SectorFate::kOld, SectorFate::kErased}};
+    applyCrashPoint(log, point, device);
+    EXPECT_EQ(device[kSector - 1], 0x00);
+    EXPECT_EQ(device[kSector], 0x11);
+    EXPECT_EQ(device[2 * kSector], 0xff);
+    EXPECT_EQ(device[3 * kSector], 0xcc);
+}
+
 TEST(CrashPoints, AnEntryBeyondTheDeviceIsAnError) {
     WriteLog log;
     log.entries = {writeEntry(3, 2, 0x11)};

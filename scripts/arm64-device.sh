@@ -122,7 +122,7 @@ run_tests() {
 }
 
 # The replay's set: quick (within ten minutes), sample (half an hour) or
-# full (about thirteen hours).
+# full (some seventeen hours).
 run_replay() {
   local set=$1 limit=$2
   build

@@ -25,6 +25,12 @@
 // An entry in the place of a check or transient file is removed or
 // replaced, never followed.
 //
+// The store relies on its file system: a torn write of the file system's
+// own super block loses it whole. Devices need an eMMC with reliable write
+// (the kernel sends forced-unit-access writes, as ext4 writes its super
+// block, as reliable writes) and the store's file system mounted with
+// barriers on: never barrier=0 or nobarrier.
+//
 // Failures are returned as errno values or STATUS_FAILED; nothing is
 // thrown but allocation failures.
 #pragma once

@@ -7,12 +7,14 @@
 // twice. The tree each point shows is also checked against the crash model
 // of tests/crash for the runs' recorded operations.
 //
-//   block_replay FS DATA LOG ORIGIN COW WORK [options] [UPDATES...]
+//   block_replay FS DATA LOG ORIGIN COWS WORK [options] [UPDATES...]
 //     FS      ext4 | ext4-journal | ext4-writeback | f2fs
 //     DATA    the block device the file system lives on (all of it is used)
 //     LOG     the block device the log is written to
 //     ORIGIN  a block device as large as DATA, for the device as the log started
-//     COW     a block device as large as DATA, for each point's changes
+//     COWS    block devices as large as DATA, comma-separated, for the
+//             points' changes in turn: with two, a point's device is removed
+//             while the next one is checked
 //     WORK    a directory for mount points and the runs' inputs
 //   options:
 //     --slots=1,3                    store sizes
@@ -24,8 +26,8 @@
 //            into its settings target (one slot). Default: every sequence
 //            of three of W, B, A, E, and TTT.
 //
-// Needs root, the log-writes and snapshot targets, dmsetup and the file
-// system's mkfs and fsck. Prints one line per scenario and the totals:
+// Needs root, the log-writes and snapshot targets, and the file system's
+// mkfs and fsck. Prints one line per scenario and the totals:
 //   replay FS: S scenarios, E log entries, P crash points, D distinct states, V violations, M outside the model
 // (or "broken writer FS: ..."), with a count of the points whose file
 // system did not mount even after the repair, which no store can survive
@@ -35,7 +37,6 @@
 // 1 otherwise, 2 for a bad command line.
 #include <sys/mount.h>
 #include <sys/stat.h>
-#include <sys/sysmacros.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -58,6 +59,7 @@
 #include "fs_image.h"
 #include "fs_record.h"
 #include "lib/storage/dual_file_target.h"
+#include "mapped_device.h"
 #include "model_states.h"
 #include "point_device.h"
 #include "scenario_runs.h"
@@ -105,7 +107,7 @@ struct Options {
     fs::path data;
     fs::path log;
     fs::path origin;
-    fs::path cow;
+    std::vector<fs::path> cows;  // for the points' devices in turn
     fs::path work;
     std::vector<size_t> slotCounts = {1, 3};
     std::vector<Clock> clocks = {Clock::kForward, Clock::kEqual, Clock::kBackward};
@@ -149,30 +151,6 @@ void unmount(const fs::path& at) {
     if (::umount(at.c_str()) != 0) throw std::runtime_error("umount " + at.string() + ": " + std::strerror(errno));
 }
 
-// The mapped device of the log-writes target, as a node of our own: without
-// udev nothing appears under /dev/mapper.
-fs::path createLogTarget(const Options& options, uint64_t sectors) {
-    run({"/sbin/dmsetup", "create", options.logTarget, "--table",
-         "0 " + std::to_string(sectors) + " log-writes " + options.data.string() + " " + options.log.string()});
-    const ProcessResult numbers = testing_support::runProgram(
-        {"/sbin/dmsetup", "info", "-c", "--noheadings", "-o", "major,minor", options.logTarget});
-    unsigned major = 0;
-    unsigned minor = 0;
-    if (numbers.exitStatus != 0 || std::sscanf(numbers.out.c_str(), "%u:%u", &major, &minor) != 2) {
-        throw std::runtime_error("dmsetup info: " + numbers.out + numbers.err);
-    }
-    const fs::path node = options.work / options.logTarget;
-    fs::remove(node);
-    if (::mknod(node.c_str(), S_IFBLK | 0600, makedev(major, minor)) != 0) {
-        throw std::runtime_error("mknod " + node.string() + ": " + std::strerror(errno));
-    }
-    return node;
-}
-
-void mark(const Options& options, const std::string& text) {
-    run({"/sbin/dmsetup", "message", options.logTarget, "0", "mark", text});
-}
-
 // One scenario's record: the device before the log, the log, what each
 // run acknowledged, and the operations the runs made, for the model.
 struct Recording {
@@ -206,6 +184,46 @@ std::vector<SlotContent> openStore(const fs::path& root, size_t slotCount) {
     return slots;
 }
 
+// Runs the scenario's updates on the file system behind the log-writes
+// target, a mark before each and after its acknowledgement; fills in what
+// each acknowledged and returns the operations the runs recorded.
+std::vector<crash::FsOp> runLogged(const Options& options, const std::string& updates, size_t slotCount, Clock clock,
+                                   Recording& recording) {
+    const fs::path mountPoint = options.work / "mnt";
+    const fs::path inputs = options.work / "inputs";
+    const fs::path root = mountPoint / "store";
+    const size_t slot = slotCount == 1 ? 0 : crash::kUpdatedSlot;
+    std::vector<crash::FsOp> raw;
+    const replay::MappedDevice logged(options.logTarget, recording.base.size() / 512,
+                                      "log-writes " + options.data.string() + " " + options.log.string());
+    mountDevice(*options.fileSystem, logged.node(), mountPoint);
+    for (size_t index = 0; index < updates.size(); ++index) {
+        const char update = updates[index];
+        const std::vector<uint8_t> blob = crash::blobFor(index + 1, slotCount);
+        const std::vector<std::string> command =
+            update == kToolUpdate ? toolCommand(root, blob, inputs)
+                                  : crash::updateCommand(kPrograms, update, root, slotCount, slot, blob, inputs);
+        const fs::path recordFile = inputs / ("record" + std::to_string(index));
+        logged.message("mark begin:" + std::to_string(index));
+        const ProcessResult outcome = testing_support::runProgram(
+            command,
+            testing_support::recordEnv(recordFile.string(), root.string() + "/", crash::clockOf(clock, index)));
+        if (outcome.exitStatus != 0)
+            throw std::runtime_error(std::string("update ") + update + " failed:\n" + outcome.err);
+        logged.message("mark ack:" + std::to_string(index));
+        const std::vector<crash::FsOp> ops = crash::readFsRecord(recordFile);
+        raw.insert(raw.end(), ops.begin(), ops.end());
+        recording.runEnds.push_back(raw.size());
+        recording.slots.push_back(slot);
+        // The broken writer and the tool do not report what they left.
+        const bool reports = update != 'X' && update != kToolUpdate;
+        recording.acknowledged.push_back(reports ? crash::reportedState(outcome.out)
+                                                 : openStore(root / recording.storeDirectory, slotCount)[slot]);
+    }
+    unmount(mountPoint);
+    return raw;
+}
+
 Recording record(const Options& options, const std::string& updates, size_t slotCount, Clock clock) {
     const FileSystem& fileSystem = *options.fileSystem;
     const fs::path mountPoint = options.work / "mnt";
@@ -220,7 +238,6 @@ Recording record(const Options& options, const std::string& updates, size_t slot
     Recording recording;
     recording.storeDirectory = storeDirectory(updates);
     const fs::path root = mountPoint / "store";
-    const size_t slot = slotCount == 1 ? 0 : crash::kUpdatedSlot;
     mountDevice(fileSystem, options.data, mountPoint);
     fs::create_directories(root);
     recording.initial.assign(slotCount, store_test::nothingStored());
@@ -233,34 +250,7 @@ Recording record(const Options& options, const std::string& updates, size_t slot
     unmount(mountPoint);
     recording.base = testing_support::readBytes(options.data);
 
-    const fs::path node = createLogTarget(options, recording.base.size() / 512);
-    mountDevice(fileSystem, node, mountPoint);
-    std::vector<crash::FsOp> raw;
-    for (size_t index = 0; index < updates.size(); ++index) {
-        const char update = updates[index];
-        const std::vector<uint8_t> blob = crash::blobFor(index + 1, slotCount);
-        const std::vector<std::string> command =
-            update == kToolUpdate ? toolCommand(root, blob, inputs)
-                                  : crash::updateCommand(kPrograms, update, root, slotCount, slot, blob, inputs);
-        const fs::path recordFile = inputs / ("record" + std::to_string(index));
-        mark(options, "begin:" + std::to_string(index));
-        const ProcessResult outcome = testing_support::runProgram(
-            command,
-            testing_support::recordEnv(recordFile.string(), root.string() + "/", crash::clockOf(clock, index)));
-        if (outcome.exitStatus != 0)
-            throw std::runtime_error(std::string("update ") + update + " failed:\n" + outcome.err);
-        mark(options, "ack:" + std::to_string(index));
-        const std::vector<crash::FsOp> ops = crash::readFsRecord(recordFile);
-        raw.insert(raw.end(), ops.begin(), ops.end());
-        recording.runEnds.push_back(raw.size());
-        recording.slots.push_back(slot);
-        // The broken writer and the tool do not report what they left.
-        const bool reports = update != 'X' && update != kToolUpdate;
-        recording.acknowledged.push_back(reports ? crash::reportedState(outcome.out)
-                                                 : openStore(root / recording.storeDirectory, slotCount)[slot]);
-    }
-    unmount(mountPoint);
-    run({"/sbin/dmsetup", "remove", options.logTarget});
+    const std::vector<crash::FsOp> raw = runLogged(options, updates, slotCount, clock, recording);
     recording.log = replay::readWriteLog(options.log);
     recording.ops = crash::prepareRecord(raw, root, recording.durable);
     if (recording.ops.size() != raw.size()) throw std::runtime_error("a run's record reaches outside the store");
@@ -309,21 +299,18 @@ struct Observation {
     std::vector<SlotContent> second;
 };
 
-Observation observe(const Options& options, const Recording& recording, const replay::SectorOverlay& overlay,
-                    size_t slotCount) {
-    const uint64_t sectors = recording.base.size() / 512;
-    replay::PointDevice device(options.pointTarget, options.origin, options.cow, sectors, overlay,
-                               recording.log.sectorSize);
+Observation observeDevice(const Options& options, const fs::path& device, const fs::path& storeDirectory,
+                          size_t slotCount) {
     const FileSystem& fileSystem = *options.fileSystem;
     const fs::path mountPoint = options.work / "mnt";
     Observation observation;
-    if (!tryMount(fileSystem, device.node(), mountPoint)) {
+    if (!tryMount(fileSystem, device, mountPoint)) {
         const std::string refusal = std::strerror(errno);
         std::vector<std::string> repair = fileSystem.repair;
-        repair.push_back(device.node().string());
+        repair.push_back(device.string());
         const ProcessResult repaired = testing_support::runProgram(repair);
         // fsck: 1 and 2 mean errors corrected.
-        if (repaired.exitStatus < 0 || repaired.exitStatus > 2 || !tryMount(fileSystem, device.node(), mountPoint)) {
+        if (repaired.exitStatus < 0 || repaired.exitStatus > 2 || !tryMount(fileSystem, device, mountPoint)) {
             observation.problem = "the file system does not mount (" + refusal + "), nor after " + repair[0] +
                                   " (exit " + std::to_string(repaired.exitStatus) + ")";
             observation.unmountable = true;
@@ -334,12 +321,20 @@ Observation observe(const Options& options, const Recording& recording, const re
     try {
         const fs::path root = mountPoint / "store";
         observation.tree = crash::snapshotTree(root);
-        observation.first = openStore(root / recording.storeDirectory, slotCount);
-        observation.second = openStore(root / recording.storeDirectory, slotCount);
+        observation.first = openStore(root / storeDirectory, slotCount);
+        observation.second = openStore(root / storeDirectory, slotCount);
     } catch (const std::exception& error) {
         observation.problem = std::string("reading the store failed: ") + error.what();
     }
     unmount(mountPoint);
+    return observation;
+}
+
+Observation observe(const Options& options, replay::PointDevices& devices, const Recording& recording,
+                    const replay::SectorOverlay& overlay, size_t slotCount) {
+    std::unique_ptr<replay::MappedDevice> device = devices.make(overlay, recording.log.sectorSize);
+    Observation observation = observeDevice(options, device->node(), recording.storeDirectory, slotCount);
+    devices.release(std::move(device));
     return observation;
 }
 
@@ -383,6 +378,7 @@ void explore(const Options& options, const std::string& updates, size_t slotCoun
              Reports& reports) {
     const Recording recording = record(options, updates, slotCount, clock);
     testing_support::writeBytes(options.origin, recording.base);
+    replay::PointDevices devices(options.pointTarget, options.origin, options.cows, recording.base.size() / 512);
     const std::vector<replay::CrashPoint> points = replay::crashPoints(recording.log, options.choice);
     replay::ModelStates model(recording.durable, recording.ops);
     const std::string name = options.fileSystem->name + " " + scenarioName(updates, slotCount, clock);
@@ -395,7 +391,7 @@ void explore(const Options& options, const std::string& updates, size_t slotCoun
         const size_t key = hashOf(overlay);
         auto known = seen.find(key);
         if (known == seen.end()) {
-            known = seen.emplace(key, observe(options, recording, overlay, slotCount)).first;
+            known = seen.emplace(key, observe(options, devices, recording, overlay, slotCount)).first;
             if (known->second.repaired) ++totals.repaired;
             if (known->second.problem.empty()) {
                 totals.states.insert(std::to_string(slotCount) + "\n" + replay::visibleState(known->second.tree));
@@ -446,7 +442,7 @@ std::vector<std::string> split(const std::string& text) {
 }
 
 [[noreturn]] void usage(const std::string& problem) {
-    std::fprintf(stderr, "block_replay: %s\nusage: block_replay FS DATA LOG ORIGIN COW WORK [options] [UPDATES...]\n",
+    std::fprintf(stderr, "block_replay: %s\nusage: block_replay FS DATA LOG ORIGIN COWS WORK [options] [UPDATES...]\n",
                  problem.c_str());
     std::exit(2);
 }
@@ -489,7 +485,7 @@ Options parse(int argc, char** argv) {
             positional.push_back(word);
         }
     }
-    if (positional.size() < 6) usage("FS, DATA, LOG, ORIGIN, COW and WORK are needed");
+    if (positional.size() < 6) usage("FS, DATA, LOG, ORIGIN, COWS and WORK are needed");
     for (const FileSystem& fileSystem : kFileSystems) {
         if (fileSystem.name == positional[0]) options.fileSystem = &fileSystem;
     }
@@ -499,7 +495,7 @@ Options parse(int argc, char** argv) {
     options.data = positional[1];
     options.log = positional[2];
     options.origin = positional[3];
-    options.cow = positional[4];
+    for (const std::string& cow : split(positional[4])) options.cows.emplace_back(cow);
     options.work = positional[5];
     options.scenarios.assign(positional.begin() + 6, positional.end());
     if (options.broken) {

@@ -5,36 +5,14 @@
 
 #include <cerrno>
 #include <cstring>
-#include <fstream>
 #include <stdexcept>
 #include <system_error>
-#include <vector>
-
-#include "child_process.h"
 
 namespace replay {
 
 namespace fs = std::filesystem;
 
 namespace {
-
-void dmsetup(const std::vector<std::string>& words) {
-    std::vector<std::string> command = {"/sbin/dmsetup"};
-    command.insert(command.end(), words.begin(), words.end());
-    const testing_support::ProcessResult result = testing_support::runProgram(command);
-    if (result.exitStatus != 0) throw std::runtime_error("dmsetup " + words.at(0) + " failed: " + result.err);
-}
-
-// Without udev nothing appears under /dev/mapper; the kernel's name for
-// the mapped device is in sysfs.
-fs::path nodeOf(const std::string& name) {
-    for (const fs::directory_entry& entry : fs::directory_iterator("/sys/block")) {
-        std::ifstream file(entry.path() / "dm" / "name");
-        std::string text;
-        if (std::getline(file, text) && text == name) return fs::path("/dev") / entry.path().filename();
-    }
-    throw std::runtime_error("no block device for the mapped device " + name);
-}
 
 void writeOverlay(const fs::path& node, const SectorOverlay& overlay, uint32_t sectorSize) {
     const int fd = ::open(node.c_str(), O_WRONLY | O_CLOEXEC);
@@ -56,27 +34,59 @@ void writeOverlay(const fs::path& node, const SectorOverlay& overlay, uint32_t s
 
 }  // namespace
 
-PointDevice::PointDevice(const std::string& name, const fs::path& origin, const fs::path& cow, uint64_t sectors,
-                         const SectorOverlay& overlay, uint32_t sectorSize)
-    : name_(name) {
-    // Non-persistent: the exceptions live in memory, so the cow device is
-    // reused as it is.
-    dmsetup({"create", name_, "--table",
-             "0 " + std::to_string(sectors) + " snapshot " + origin.string() + " " + cow.string() + " N 8"});
-    try {
-        node_ = nodeOf(name_);
-        writeOverlay(node_, overlay, sectorSize);
-    } catch (...) {
-        dmsetup({"remove", "--retry", name_});
-        throw;
-    }
+PointDevices::PointDevices(const std::string& prefix, const fs::path& origin, const std::vector<fs::path>& cows,
+                           uint64_t sectors)
+    : prefix_(prefix), origin_(origin), cows_(cows), sectors_(sectors), remover_([this] { removeReleased(); }) {
+    if (cows_.empty()) throw std::invalid_argument("point devices need a cow device");
 }
 
-PointDevice::~PointDevice() {
-    try {
-        dmsetup({"remove", "--retry", name_});
-    } catch (const std::exception&) {
-        // The next creation under this name fails and says so.
+PointDevices::~PointDevices() {
+    {
+        std::lock_guard<std::mutex> lock(mutex_);
+        closing_ = true;
+    }
+    changed_.notify_all();
+    remover_.join();
+}
+
+std::unique_ptr<MappedDevice> PointDevices::make(const SectorOverlay& overlay, uint32_t sectorSize) {
+    const fs::path& cow = cows_[made_ % cows_.size()];
+    {
+        // Two snapshots on one cow device at once would hand the older
+        // one's changes over to the newer: the device that last used this
+        // cow must be gone.
+        std::unique_lock<std::mutex> lock(mutex_);
+        changed_.wait(lock, [this] { return removing_ < cows_.size(); });
+    }
+    // Non-persistent: the exceptions live in memory, so a cow device is
+    // reused as it is.
+    auto device = std::make_unique<MappedDevice>(prefix_ + "-" + std::to_string(made_++), sectors_,
+                                                 "snapshot " + origin_.string() + " " + cow.string() + " N 8");
+    writeOverlay(device->node(), overlay, sectorSize);
+    return device;
+}
+
+void PointDevices::release(std::unique_ptr<MappedDevice> device) {
+    {
+        std::lock_guard<std::mutex> lock(mutex_);
+        released_.push_back(std::move(device));
+        ++removing_;
+    }
+    changed_.notify_all();
+}
+
+void PointDevices::removeReleased() {
+    std::unique_lock<std::mutex> lock(mutex_);
+    for (;;) {
+        changed_.wait(lock, [this] { return closing_ || !released_.empty(); });
+        if (released_.empty()) return;
+        std::unique_ptr<MappedDevice> device = std::move(released_.front());
+        released_.pop_front();
+        lock.unlock();
+        device.reset();
+        lock.lock();
+        --removing_;
+        changed_.notify_all();
     }
 }
 

@@ -45,14 +45,14 @@ case $set_name in
         ;;
 esac
 
-# Four loop devices for one file system, made one after the other (two
+# Five loop devices for one file system, made one after the other (two
 # searches for a free device at once may find the same): its data, the
-# log, the device as the log started and the changes of each crash point.
-# Their names go to $work/NAME.devices.
+# log, the device as the log started and two for the changes of the crash
+# points' devices, in turn. Their names go to $work/NAME.devices.
 make_devices() {
     local name=$1 role size
     : >"$work/$name.devices"
-    for role in data:64M log:512M origin:64M cow:64M; do
+    for role in data:64M log:512M origin:64M cow:64M cow2:64M; do
         size=${role#*:}
         role=${role%%:*}
         truncate -s "$size" "$work/$name.$role"
@@ -65,7 +65,7 @@ run_one() {
     shift
     mapfile -t devices <"$work/$name.devices"
     mkdir -p "$work/$name"
-    "$replay" "$name" "${devices[@]}" "$work/$name" "$@" 2>&1 |
+    "$replay" "$name" "${devices[@]:0:3}" "${devices[3]},${devices[4]}" "$work/$name" "$@" 2>&1 |
         while IFS= read -r line; do echo "@@ $line"; done
     echo "@@ $name: ${PIPESTATUS[0]} after $((SECONDS - start)) s"
 }

@@ -6,9 +6,11 @@
 #   arm64-device.sh shell            boot it with a shell on this terminal
 #   arm64-device.sh power-cuts N [SEED]
 #                                    cut its power N times at random moments (see power_cuts.py)
-#   arm64-device.sh replay [--quick|--sample]
+#   arm64-device.sh replay [--quick|--sample|--clock=CLOCK] [FS...]
 #                                    record every block write of the crash scenarios and check
-#                                    every crash point of the log (tests/device/arm64/replay.sh)
+#                                    every crash point of the log (tests/device/arm64/replay.sh);
+#                                    --clock: the whole matrix under one clock only; FS: only
+#                                    these file systems (ext4, ext4-journal, ext4-writeback, f2fs)
 # test, shell, power-cuts and replay build first (again only what changed). Exit
 # status: 0 when everything passed; 1 otherwise (a failed test, a boot that
 # did not reach its end in time, a violation).
@@ -23,7 +25,7 @@ card=$out/card.img
 assembled=$out/guest-assembled
 
 usage() {
-  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED] | replay [--quick|--sample]" >&2
+  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED] | replay [--quick|--sample|--clock=CLOCK] [FS...]" >&2
   exit 2
 }
 
@@ -121,14 +123,19 @@ run_tests() {
   case $summary in *" failed=0") ;; *) return 1 ;; esac
 }
 
-# The replay's set: quick (within ten minutes), sample (half an hour) or
-# full (some seventeen hours).
+# The replay's set: quick (a few minutes), sample (a quarter of an hour),
+# full (some five hours) or a third of it, full-CLOCK.
 run_replay() {
-  local set=$1 limit=$2
+  local set=$1 limit=$2 file_systems
+  shift 2
+  file_systems=$(
+    IFS=,
+    echo "$*"
+  )
   build
-  local log=$out/replay-$set-console.log work=$out/replay-card.img start=$SECONDS
+  local log=$out/replay-$set${file_systems:+-${file_systems//,/-}}-console.log work=$out/replay-card.img start=$SECONDS
   fresh_card "$work"
-  boot "replay arm64_replay=$set" "$limit" "$work" </dev/null | sed -u 's/\r$//' | tee "$log" |
+  boot "replay arm64_replay=$set${file_systems:+:$file_systems}" "$limit" "$work" </dev/null | sed -u 's/\r$//' | tee "$log" |
     grep --line-buffered -E '^(@@ (replay |broken writer |violation|outside the model|[a-z0-9-]+: [0-9]+ (after|devices))|arm64-device:)' || true
   rm -f "$work"
   echo "=== arm64-device replay $set: $((SECONDS - start)) s"
@@ -162,11 +169,17 @@ case ${1:-} in
     ;;
   replay)
     mkdir -p "$out"
-    case ${2:-} in
-      --quick) run_replay quick 900 ;;
-      --sample) run_replay sample 7200 ;;
-      "") run_replay full 172800 ;;
-      *) usage ;;
+    set_option=${2:-}
+    case $set_option in --*) shift 2 ;; *) shift 1 ;; esac
+    for file_system in "$@"; do
+      case $file_system in ext4 | ext4-journal | ext4-writeback | f2fs) ;; *) usage ;; esac
+    done
+    case $set_option in
+      --quick) run_replay quick 900 "$@" ;;
+      --sample) run_replay sample 7200 "$@" ;;
+      --clock=forward | --clock=equal | --clock=backward) run_replay "full-${set_option#--clock=}" 14400 "$@" ;;
+      --*) usage ;;
+      *) run_replay full 43200 "$@" ;;
     esac
     ;;
   *) usage ;;

@@ -8,6 +8,11 @@
 #   replay.sh sample  every file system and every kind of point on four
 #                     scenarios, one and three slots
 #   replay.sh full    every file system, every scenario, every kind of point
+#   replay.sh full-CLOCK
+#                     the same, under one clock (forward, equal or backward):
+#                     a third of it
+#   replay.sh SET:FS,FS...
+#                     a set on these file systems only
 #
 # The card has no volatile cache: the kernel drops every flush before it
 # reaches a device stacked on it. The file system therefore lives on a
@@ -17,6 +22,12 @@ set -u
 . /etc/arm64-device.conf
 replay=$build_dir/tests/crash/replay/block_replay
 set_name=${1:-quick}
+chosen_file_systems=
+case $set_name in *:*)
+    chosen_file_systems=${set_name#*:}
+    set_name=${set_name%%:*}
+    ;;
+esac
 work=/tmp/replay
 mkdir -p "$work"
 
@@ -33,10 +44,11 @@ case $set_name in
         choice=(--slots=1,3 --clocks=forward --subsets=20 --torn=4)
         scenarios=(WBA BAE AEW EWB)
         ;;
-    full)
+    full | full-forward | full-equal | full-backward)
         file_systems="ext4 ext4-journal ext4-writeback f2fs"
         broken_file_systems=$file_systems
         choice=(--subsets=20 --torn=4)
+        [ "$set_name" = full ] || choice+=("--clocks=${set_name#full-}")
         scenarios=()
         ;;
     *)
@@ -44,6 +56,10 @@ case $set_name in
         exit 1
         ;;
 esac
+if [ -n "$chosen_file_systems" ]; then
+    file_systems=${chosen_file_systems//,/ }
+    broken_file_systems=$file_systems
+fi
 
 # Five loop devices for one file system, made one after the other (two
 # searches for a free device at once may find the same): its data, the

@@ -404,11 +404,15 @@ void explore(const Options& options, const std::string& updates, size_t slotCoun
             ++totals.unmountable;
             // An eMMC with reliable write never tears these: the kernel
             // writes FUA requests that way.
-            const bool tornFua =
-                point.kind == replay::CrashKind::kTorn && (recording.log.entries[point.torn].flags & replay::kFua) != 0;
+            const bool torn = point.kind == replay::CrashKind::kTorn;
+            const replay::LogEntry& tornEntry = recording.log.entries[point.torn];
+            const bool tornFua = torn && (tornEntry.flags & replay::kFua) != 0;
             if (tornFua) ++totals.unmountableTornFua;
+            // Where the torn write went tells which of the file system's
+            // blocks it was.
+            const std::string where = torn ? " at sector " + std::to_string(tornEntry.sector) : "";
             report(reports.unmountable,
-                   name + ": " + point.describe() + (tornFua ? " (FUA)" : "") + ": " + observation.problem);
+                   name + ": " + point.describe() + where + (tornFua ? " (FUA)" : "") + ": " + observation.problem);
             continue;
         }
         const Expectation expected = expectationAt(recording, point.reach());

@@ -372,18 +372,12 @@ void logFlashWriteFailure(bool opened, int64_t written) {
 
 }  // namespace
 
-BootVectorTarget::Slot::Slot() {
-    if (locate() != STATUS_OK || sector_ == 0) return;
-    load();
-}
-
-Status BootVectorTarget::Slot::locate() {
+Status locateBootVector(uint64_t& sector) {
     std::string output;
     if (runCommand(kFreeAreaCommand, output) != STATUS_OK) {
         LOGE << "Failed to query flash size";
         return STATUS_FAILED;
     }
-    uint64_t sector = 0;
     switch (parseBootVectorSector(output, sector)) {
         case SectorParse::kNotANumber:
             LOGE << "Failed to parse flash size '" << output << "'";
@@ -395,19 +389,27 @@ Status BootVectorTarget::Slot::locate() {
         case SectorParse::kOk:
             break;
     }
-    sector_ = sector;
     return STATUS_OK;
 }
 
-void BootVectorTarget::Slot::load() {
+Status readBootVectorRecord(uint64_t sector, uint8_t (&record)[kBootVectorRecordSize]) {
     const UniqueFd fd(::open(kFlashDevice, O_RDONLY | O_CLOEXEC | O_SYNC));
     if (!fd) logOpenFailure(kFlashDevice, errno);
-    if (!fd || ::lseek(fd.get(), static_cast<off_t>(sector_ * kSectorSize), SEEK_SET) < 0 ||
-        ::read(fd.get(), record_, sizeof record_) != static_cast<ssize_t>(sizeof record_) ||
-        !isValidBootVectorRecord(record_)) {
-        sector_ = 0;
-        LOGE << "Boot vector query failed!";
+    if (!fd || ::lseek(fd.get(), static_cast<off_t>(sector * kSectorSize), SEEK_SET) < 0 ||
+        ::read(fd.get(), record, sizeof record) != static_cast<ssize_t>(sizeof record)) {
+        return STATUS_FAILED;
     }
+    return STATUS_OK;
+}
+
+BootVectorTarget::Slot::Slot() {
+    uint64_t sector = 0;
+    if (locateBootVector(sector) != STATUS_OK || sector == 0) return;
+    if (readBootVectorRecord(sector, record_) != STATUS_OK || !isValidBootVectorRecord(record_)) {
+        LOGE << "Boot vector query failed!";
+        return;
+    }
+    sector_ = sector;
 }
 
 Status BootVectorTarget::Slot::read(uint8_t* buffer, size_t size, int64_t offset) {

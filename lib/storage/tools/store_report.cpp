@@ -34,14 +34,6 @@ std::filesystem::path slotPath(const TargetReport& target, size_t index) {
     return name.empty() ? target.path : target.path / name;
 }
 
-// The slot is served, so an invalid other copy is an update that a power
-// cut interrupted.
-bool interrupted(const SlotInspection& slot, unsigned copy) {
-    const CopyInspection& inspected = slot.copies[copy];
-    return (slot.state == SlotState::kPresent || slot.state == SlotState::kAbsentBlob) && copy != slot.current &&
-           !inspected.check.valid() && inspected.hasEntries();
-}
-
 // The damage to report for one copy, each line naming its path.
 std::vector<std::string> damageLines(const TargetReport& target, size_t index, unsigned copy,
                                      const CopyInspection& inspected) {
@@ -68,6 +60,16 @@ std::vector<std::string> damageLines(const TargetReport& target, size_t index, u
     return lines;
 }
 
+// The slot is served, so an invalid other copy without damage is an update
+// that a power cut interrupted.
+bool interrupted(const TargetReport& target, const SlotReport& slot, unsigned copy) {
+    const SlotInspection& inspection = slot.inspection;
+    const CopyInspection& inspected = inspection.copies[copy];
+    return (inspection.state == SlotState::kPresent || inspection.state == SlotState::kAbsentBlob) &&
+           copy != inspection.current && !inspected.check.valid() && inspected.hasEntries() &&
+           damageLines(target, slot.index, copy, inspected).empty();
+}
+
 // What a copy holds, for the slot's line: "-" when it has no entries.
 std::string copySummary(const CopyInspection& copy) {
     if (!copy.hasEntries()) return "-";
@@ -91,7 +93,7 @@ std::string padded(const std::string& text, size_t width) {
 
 std::string jsonOrNull(bool known, const std::string& json) { return known ? json : "null"; }
 
-std::string jsonCopy(const SlotReport& slot, unsigned copy) {
+std::string jsonCopy(const TargetReport& target, const SlotReport& slot, unsigned copy) {
     const CopyInspection& inspected = slot.inspection.copies[copy];
     const bool valid = inspected.check.valid();
     std::string json = "{\"copy\":" + std::to_string(copy + 1) + ",\"valid\":" + (valid ? "true" : "false");
@@ -100,7 +102,7 @@ std::string jsonCopy(const SlotReport& slot, unsigned copy) {
     json += ",\"crc32\":" + jsonOrNull(inspected.crcKnown, jsonQuoted(crcText(inspected.crc32)));
     json += ",\"check_time\":" +
             jsonOrNull(inspected.checkFile.kind == EntryKind::kFile, jsonQuoted(isoTime(inspected.checkFile.modified)));
-    json += std::string(",\"interrupted_update\":") + (interrupted(slot.inspection, copy) ? "true" : "false");
+    json += std::string(",\"interrupted_update\":") + (interrupted(target, slot, copy) ? "true" : "false");
     return json + "}";
 }
 
@@ -166,7 +168,7 @@ std::string plainReport(const StoreReport& report) {
             }
             for (unsigned copy = 0; copy < 2; ++copy) {
                 const CopyInspection& inspected = inspection.copies[copy];
-                if (interrupted(inspection, copy)) {
+                if (interrupted(target, slot, copy)) {
                     lines.push_back(copyPath(target, slot.index, copy).string() + ": interrupted update (" +
                                     copyReason(inspected) + "), normal after a power cut");
                 }
@@ -208,7 +210,7 @@ std::string jsonReport(const StoreReport& report) {
                     jsonQuoted(Storage::slotStateName(inspection.state)) + ",\"current\":" +
                     jsonOrNull(inspection.copies[inspection.current].check.valid(),
                                std::to_string(inspection.current + 1)) +
-                    ",\"copies\":[" + jsonCopy(slot, 0) + "," + jsonCopy(slot, 1) + "]";
+                    ",\"copies\":[" + jsonCopy(target, slot, 0) + "," + jsonCopy(target, slot, 1) + "]";
             json += ",\"leftover_tmp\":[";
             bool first = true;
             for (unsigned copy = 0; copy < 2; ++copy) {

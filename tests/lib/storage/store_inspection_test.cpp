@@ -55,16 +55,6 @@ SlotInspection inspected(const fs::path& base, size_t slots, size_t index) {
     return slot;
 }
 
-// Copies a tree with the modification times of its files, which decide the
-// current copy.
-void copyTree(const fs::path& from, const fs::path& to) {
-    fs::copy(from, to, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
-    for (const auto& entry : fs::recursive_directory_iterator(from)) {
-        if (!entry.is_regular_file()) continue;
-        store_test::setMtimeNs(to / entry.path().lexically_relative(from), store_test::mtimeNs(entry.path()));
-    }
-}
-
 // The inspection agrees with a DualFileTarget opened on a copy of the tree:
 // the same validity and existence, and reads serve the data of the copy the
 // inspection calls current.
@@ -72,7 +62,7 @@ void expectAgreement(const fs::path& base, size_t slots, size_t index, const Slo
                      const fs::path& scratch) {
     const fs::path copy = scratch / "agreement";
     fs::remove_all(copy);
-    copyTree(base, copy);
+    store_test::copyTree(base, copy);
     const Bytes currentData = slot.copies[slot.current].data.kind == EntryKind::kFile
                                   ? readBytes(slotDirectory(copy, slots, index) /
                                               (slot.current == 0 ? "1/data" : "2/data"))

@@ -77,7 +77,8 @@ void describeCopy(int base, const std::string& slotName, unsigned index, CopyIns
 
 SlotState stateOf(const SlotInspection& slot) {
     const CopyInspection& current = slot.copies[slot.current];
-    if (current.check.valid()) return current.data.kind == EntryKind::kMissing ? SlotState::kAbsentBlob : SlotState::kPresent;
+    if (current.check.valid())
+        return current.data.kind == EntryKind::kMissing ? SlotState::kAbsentBlob : SlotState::kPresent;
     return slot.copies[0].hasEntries() || slot.copies[1].hasEntries() ? SlotState::kLost : SlotState::kEmpty;
 }
 

@@ -123,7 +123,7 @@ struct StateRow {
     // Writes through the store (base, target, slot) and damages the slot directory by hand.
     std::function<void(const fs::path&, const Target&, size_t, const fs::path&)> make;
     const char* state;
-    int current;  // 1 or 2; 0 for null
+    int current;             // 1 or 2; 0 for null
     const char* reasons[2];  // "" for a valid copy
     bool interrupted[2];
     int exitStatus;
@@ -135,75 +135,134 @@ const StateRow kStateRows[] = {
      [](const fs::path& b, const Target& target, size_t index, const fs::path&) {
          withSlot(b, target, index, [](Storage::TargetSlot&) {});
      },
-     "empty", 0, {"no check file", "no check file"}, {false, false}, 0, ""},
+     "empty",
+     0,
+     {"no check file", "no check file"},
+     {false, false},
+     0,
+     ""},
     {"one_write",
      [](const fs::path& b, const Target& target, size_t index, const fs::path&) {
          withSlot(b, target, index, [](Storage::TargetSlot& s) { ASSERT_EQ(s.write(kFirst.data(), 300), 0u); });
      },
-     "present", 2, {"no check file", ""}, {false, false}, 0, ""},
+     "present",
+     2,
+     {"no check file", ""},
+     {false, false},
+     0,
+     ""},
     {"erased",
      [](const fs::path& b, const Target& target, size_t index, const fs::path&) {
          twoWrites(b, target, index);
          withSlot(b, target, index, [](Storage::TargetSlot& s) { ASSERT_EQ(s.erase(), STATUS_OK); });
      },
-     "absent-blob", 2, {"", ""}, {false, false}, 0, ""},
+     "absent-blob",
+     2,
+     {"", ""},
+     {false, false},
+     0,
+     ""},
     {"crc_differs",
      [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
          twoWrites(b, target, index);
          flipByte(d / "1/data", 99);
      },
-     "present", 2, {"CRC differs", ""}, {true, false}, 0, "/1: interrupted update (CRC differs), normal after a power cut"},
+     "present",
+     2,
+     {"CRC differs", ""},
+     {true, false},
+     0,
+     "/1: interrupted update (CRC differs), normal after a power cut"},
     {"size_differs",
      [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
          twoWrites(b, target, index);
          fs::resize_file(d / "1/data", 10);
      },
-     "present", 2, {"size differs", ""}, {true, false}, 0, "/1: interrupted update (size differs)"},
+     "present",
+     2,
+     {"size differs", ""},
+     {true, false},
+     0,
+     "/1: interrupted update (size differs)"},
     {"check_file_of_9_bytes",
      [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
          twoWrites(b, target, index);
          fs::resize_file(d / "1/data.chk", 9);
      },
-     "present", 2, {"check file of 9 bytes", ""}, {true, false}, 0, "/1: interrupted update (check file of 9 bytes)"},
+     "present",
+     2,
+     {"check file of 9 bytes", ""},
+     {true, false},
+     0,
+     "/1: interrupted update (check file of 9 bytes)"},
     {"no_check_file",
      [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
          twoWrites(b, target, index);
          fs::remove(d / "1/data.chk");
      },
-     "present", 2, {"no check file", ""}, {true, false}, 0, "/1: interrupted update (no check file)"},
+     "present",
+     2,
+     {"no check file", ""},
+     {true, false},
+     0,
+     "/1: interrupted update (no check file)"},
     {"no_data_file",
      [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
          twoWrites(b, target, index);
          fs::remove(d / "2/data");
      },
-     "present", 1, {"", "no data file"}, {false, true}, 0, "/2: interrupted update (no data file)"},
+     "present",
+     1,
+     {"", "no data file"},
+     {false, true},
+     0,
+     "/2: interrupted update (no data file)"},
     {"leftover_tmp",
      [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
          twoWrites(b, target, index);
          writeBytes(d / "2/data.chk.tmp", {1, 2, 3});
      },
-     "present", 1, {"", ""}, {false, false}, 0, "/2/data.chk.tmp: leftover of an interrupted commit"},
+     "present",
+     1,
+     {"", ""},
+     {false, false},
+     0,
+     "/2/data.chk.tmp: leftover of an interrupted commit"},
     {"data_is_a_directory",
      [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
          twoWrites(b, target, index);
          fs::remove(d / "1/data");
          fs::create_directories(d / "1/data/inside");
      },
-     "present", 2, {"data is a directory", ""}, {false, false}, 1, "/1/data: is a directory, not a file"},
+     "present",
+     2,
+     {"data is a directory", ""},
+     {false, false},
+     1,
+     "/1/data: is a directory, not a file"},
     {"check_file_is_a_link",
      [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
          twoWrites(b, target, index);
          fs::rename(d / "1/data.chk", d / "1/kept");
          fs::create_symlink("kept", d / "1/data.chk");
      },
-     "present", 2, {"check file is a link", ""}, {false, false}, 1, "/1/data.chk: is a link, not a file"},
+     "present",
+     2,
+     {"check file is a link", ""},
+     {false, false},
+     1,
+     "/1/data.chk: is a link, not a file"},
     {"lost",
      [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
          twoWrites(b, target, index);
          flipByte(d / "1/data", 0);
          fs::resize_file(d / "2/data.chk", 7);
      },
-     "lost", 0, {"CRC differs", "check file of 7 bytes"}, {false, false}, 1,
+     "lost",
+     0,
+     {"CRC differs", "check file of 7 bytes"},
+     {false, false},
+     1,
      ": lost: copy 1: CRC differs; copy 2: check file of 7 bytes"},
 };
 
@@ -286,9 +345,9 @@ TEST_P(InspectStoreStates, PlainAndJsonReportTheSlot) {
     std::string problems;
     for (const std::string& line : linesOf(plain.out)) {
         if (line.rfind("/", 0) == 0) problems += line + "\n";
-        found = found || (line.rfind(target.name, 0) == 0 &&
-                          line.find(" " + std::to_string(index) + " ") != std::string::npos &&
-                          line.find(std::string(" ") + row.state + " ") != std::string::npos);
+        found = found ||
+                (line.rfind(target.name, 0) == 0 && line.find(" " + std::to_string(index) + " ") != std::string::npos &&
+                 line.find(std::string(" ") + row.state + " ") != std::string::npos);
     }
     EXPECT_TRUE(found) << plain.out;
     if (*row.problem != '\0') {
@@ -310,9 +369,14 @@ TEST_F(InspectStore, EveryTargetOfTheRegistryIsReported) {
     EXPECT_EQ(result.exitStatus, 0) << result.err;
     const JsonValue document = parsed(result);
     if (document.isNull()) return;
-    const std::vector<std::pair<std::string, size_t>> expected = {
-        {"settings", 1}, {"overlay", 8}, {"lut", 26}, {"calib_save", 1}, {"calib_extra", 1},
-        {"util_save", 1}, {"application_internal", 1}, {"reboot_persistent", 1}};
+    const std::vector<std::pair<std::string, size_t>> expected = {{"settings", 1},
+                                                                  {"overlay", 8},
+                                                                  {"lut", 26},
+                                                                  {"calib_save", 1},
+                                                                  {"calib_extra", 1},
+                                                                  {"util_save", 1},
+                                                                  {"application_internal", 1},
+                                                                  {"reboot_persistent", 1}};
     ASSERT_EQ(document["targets"].items.size(), expected.size());
     for (size_t i = 0; i < expected.size(); ++i) {
         EXPECT_EQ(document["targets"][i]["name"].text, expected[i].first);
@@ -419,8 +483,10 @@ TEST_F(InspectStore, ABadCommandLineIs2WithUsageOnStandardError) {
 // report names it, nothing is followed or waited on, nothing changes.
 TEST_F(InspectStore, PlantedEntriesAreNamedAndLeftAlone) {
     const testing_support::Victims victims(scratch / "victims");
-    const std::pair<const char*, const char*> places[] = {
-        {"1/data", "data is a "}, {"1/data.chk", "check file is a "}, {"1/data.chk.tmp", ""}, {"1", "directory 3/1 is a "}};
+    const std::pair<const char*, const char*> places[] = {{"1/data", "data is a "},
+                                                          {"1/data.chk", "check file is a "},
+                                                          {"1/data.chk.tmp", ""},
+                                                          {"1", "directory 3/1 is a "}};
     for (const auto& [place, reason] : places) {
         for (const testing_support::Plant plant : testing_support::allPlants()) {
             SCOPED_TRACE(std::string(place) + " " + testing_support::plantName(plant));
@@ -477,7 +543,8 @@ TEST_F(InspectStore, AgreesWithTheStoreOnRandomlyDamagedTrees) {
                     fs::remove(file);
                     break;
                 default:
-                    store_test::setMtimeNs(file, store_test::kPast + static_cast<int64_t>(random() % 3) * store_test::kSecond);
+                    store_test::setMtimeNs(
+                        file, store_test::kPast + static_cast<int64_t>(random() % 3) * store_test::kSecond);
                     break;
             }
         }

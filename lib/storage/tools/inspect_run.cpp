@@ -68,7 +68,8 @@ int dumpSlot(const InspectOptions& options) {
     }
     const bool toStandardOutput = options.dumpPath == "-";
     // The dump file is the caller's, outside the store: an ordinary open.
-    UniqueFd file(toStandardOutput ? -1 : ::open(options.dumpPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666));
+    UniqueFd file(toStandardOutput ? -1
+                                   : ::open(options.dumpPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666));
     if (!toStandardOutput && !file) {
         printError(options.dumpPath, errno);
         return kInspectDamage;

@@ -49,7 +49,8 @@ std::vector<std::string> damageLines(const TargetReport& target, size_t index, u
         {Storage::kCheckName, &inspected.checkFile},
         {Storage::kTransientName, &inspected.transient}};
     for (const auto& [name, entry] : entries) {
-        if (!isFileOrMissing(entry->kind)) add(copyPath(target, index, copy, name), kindText(entry->kind) + ", not a file");
+        if (!isFileOrMissing(entry->kind))
+            add(copyPath(target, index, copy, name), kindText(entry->kind) + ", not a file");
     }
     if (inspected.data.kind == EntryKind::kFile && !inspected.crcKnown) {
         add(copyPath(target, index, copy, Storage::kDataName), std::strerror(inspected.dataError));
@@ -206,8 +207,8 @@ std::string jsonReport(const StoreReport& report) {
             const SlotReport& slot = target.slots[s];
             const SlotInspection& inspection = slot.inspection;
             if (s > 0) json += ",";
-            json += "{\"index\":" + std::to_string(slot.index) + ",\"state\":" +
-                    jsonQuoted(Storage::slotStateName(inspection.state)) + ",\"current\":" +
+            json += "{\"index\":" + std::to_string(slot.index) +
+                    ",\"state\":" + jsonQuoted(Storage::slotStateName(inspection.state)) + ",\"current\":" +
                     jsonOrNull(inspection.copies[inspection.current].check.valid(),
                                std::to_string(inspection.current + 1)) +
                     ",\"copies\":[" + jsonCopy(target, slot, 0) + "," + jsonCopy(target, slot, 1) + "]";

@@ -18,7 +18,7 @@ struct TargetReport {
     const char* name = "";       // as --target names it
     std::filesystem::path path;  // the target's directory
     size_t slotCount = 0;
-    int error = 0;               // errno when the directory could not be opened; then no slots
+    int error = 0;  // errno when the directory could not be opened; then no slots
     std::vector<SlotReport> slots;
 };
 

@@ -63,10 +63,10 @@ void expectAgreement(const fs::path& base, size_t slots, size_t index, const Slo
     const fs::path copy = scratch / "agreement";
     fs::remove_all(copy);
     store_test::copyTree(base, copy);
-    const Bytes currentData = slot.copies[slot.current].data.kind == EntryKind::kFile
-                                  ? readBytes(slotDirectory(copy, slots, index) /
-                                              (slot.current == 0 ? "1/data" : "2/data"))
-                                  : Bytes();
+    const Bytes currentData =
+        slot.copies[slot.current].data.kind == EntryKind::kFile
+            ? readBytes(slotDirectory(copy, slots, index) / (slot.current == 0 ? "1/data" : "2/data"))
+            : Bytes();
     Storage::DualFileTarget target(copy, slots);
     Storage::SlotHandle handle = target.getSlot(index);
     Storage::TargetSlot& opened = *handle.get();
@@ -87,7 +87,7 @@ struct Row {
 };
 
 void twoWrites(Storage::TargetSlot& slot) {
-    ASSERT_EQ(slot.write(kFirst.data(), kFirst.size()), STATUS_OK);   // copy 1 ("2")
+    ASSERT_EQ(slot.write(kFirst.data(), kFirst.size()), STATUS_OK);      // copy 1 ("2")
     ASSERT_EQ(slot.write(kSecond_.data(), kSecond_.size()), STATUS_OK);  // copy 0 ("1"), later
 }
 
@@ -100,88 +100,121 @@ void flipByte(const fs::path& path, size_t offset) {
 }
 
 const Row kRows[] = {
-    {"never_written", [](Storage::TargetSlot&, const fs::path&) {}, SlotState::kEmpty, 0,
+    {"never_written",
+     [](Storage::TargetSlot&, const fs::path&) {},
+     SlotState::kEmpty,
+     0,
      {CopyFault::kNoCheckFile, CopyFault::kNoCheckFile}},
-    {"one_write", [](Storage::TargetSlot& s, const fs::path&) { ASSERT_EQ(s.write(kFirst.data(), kFirst.size()), 0u); },
-     SlotState::kPresent, 1, {CopyFault::kNoCheckFile, CopyFault::kNone}},
-    {"two_writes", [](Storage::TargetSlot& s, const fs::path&) { twoWrites(s); }, SlotState::kPresent, 0,
+    {"one_write",
+     [](Storage::TargetSlot& s, const fs::path&) { ASSERT_EQ(s.write(kFirst.data(), kFirst.size()), 0u); },
+     SlotState::kPresent,
+     1,
+     {CopyFault::kNoCheckFile, CopyFault::kNone}},
+    {"two_writes",
+     [](Storage::TargetSlot& s, const fs::path&) { twoWrites(s); },
+     SlotState::kPresent,
+     0,
      {CopyFault::kNone, CopyFault::kNone}},
     {"erased",
      [](Storage::TargetSlot& s, const fs::path&) {
          twoWrites(s);
          ASSERT_EQ(s.erase(), STATUS_OK);
      },
-     SlotState::kAbsentBlob, 1, {CopyFault::kNone, CopyFault::kNone}},
+     SlotState::kAbsentBlob,
+     1,
+     {CopyFault::kNone, CopyFault::kNone}},
     {"crc_differs",
      [](Storage::TargetSlot& s, const fs::path& d) {
          twoWrites(s);
          flipByte(d / "1/data", 17);
      },
-     SlotState::kPresent, 1, {CopyFault::kCrcDiffers, CopyFault::kNone}},
+     SlotState::kPresent,
+     1,
+     {CopyFault::kCrcDiffers, CopyFault::kNone}},
     {"size_differs",
      [](Storage::TargetSlot& s, const fs::path& d) {
          twoWrites(s);
          fs::resize_file(d / "1/data", 150);
      },
-     SlotState::kPresent, 1, {CopyFault::kSizeDiffers, CopyFault::kNone}},
+     SlotState::kPresent,
+     1,
+     {CopyFault::kSizeDiffers, CopyFault::kNone}},
     {"check_file_of_7_bytes",
      [](Storage::TargetSlot& s, const fs::path& d) {
          twoWrites(s);
          fs::resize_file(d / "1/data.chk", 7);
      },
-     SlotState::kPresent, 1, {CopyFault::kCheckSize, CopyFault::kNone}},
+     SlotState::kPresent,
+     1,
+     {CopyFault::kCheckSize, CopyFault::kNone}},
     {"no_check_file",
      [](Storage::TargetSlot& s, const fs::path& d) {
          twoWrites(s);
          fs::remove(d / "1/data.chk");
      },
-     SlotState::kPresent, 1, {CopyFault::kNoCheckFile, CopyFault::kNone}},
+     SlotState::kPresent,
+     1,
+     {CopyFault::kNoCheckFile, CopyFault::kNone}},
     {"no_data_file",
      [](Storage::TargetSlot& s, const fs::path& d) {
          twoWrites(s);
          fs::remove(d / "1/data");
      },
-     SlotState::kPresent, 1, {CopyFault::kNoDataFile, CopyFault::kNone}},
+     SlotState::kPresent,
+     1,
+     {CopyFault::kNoDataFile, CopyFault::kNone}},
     {"data_is_a_directory",
      [](Storage::TargetSlot& s, const fs::path& d) {
          twoWrites(s);
          fs::remove(d / "1/data");
          fs::create_directories(d / "1/data/inside");
      },
-     SlotState::kPresent, 1, {CopyFault::kDataUnreadable, CopyFault::kNone}},
+     SlotState::kPresent,
+     1,
+     {CopyFault::kDataUnreadable, CopyFault::kNone}},
     {"check_file_is_a_link",
      [](Storage::TargetSlot& s, const fs::path& d) {
          twoWrites(s);
          fs::rename(d / "1/data.chk", d / "1/elsewhere");
          fs::create_symlink("elsewhere", d / "1/data.chk");
      },
-     SlotState::kPresent, 1, {CopyFault::kCheckUnopenable, CopyFault::kNone}},
+     SlotState::kPresent,
+     1,
+     {CopyFault::kCheckUnopenable, CopyFault::kNone}},
     {"retimed",
      [](Storage::TargetSlot& s, const fs::path& d) {
          twoWrites(s);
          store_test::setMtimeNs(d / "1/data.chk", kPast);
          store_test::setMtimeNs(d / "2/data.chk", kPast + kSecond);
      },
-     SlotState::kPresent, 1, {CopyFault::kNone, CopyFault::kNone}},
+     SlotState::kPresent,
+     1,
+     {CopyFault::kNone, CopyFault::kNone}},
     {"equal_times",
      [](Storage::TargetSlot& s, const fs::path& d) {
          twoWrites(s);
          store_test::setMtimeNs(d / "1/data.chk", kPast);
          store_test::setMtimeNs(d / "2/data.chk", kPast);
      },
-     SlotState::kPresent, 0, {CopyFault::kNone, CopyFault::kNone}},
+     SlotState::kPresent,
+     0,
+     {CopyFault::kNone, CopyFault::kNone}},
     {"lost",
      [](Storage::TargetSlot& s, const fs::path& d) {
          ASSERT_EQ(s.write(kFirst.data(), kFirst.size()), STATUS_OK);
          flipByte(d / "2/data", 0);
      },
-     SlotState::kLost, 0, {CopyFault::kNoCheckFile, CopyFault::kCrcDiffers}},
+     SlotState::kLost,
+     0,
+     {CopyFault::kNoCheckFile, CopyFault::kCrcDiffers}},
     {"first_commit_interrupted",
      [](Storage::TargetSlot&, const fs::path& d) {
          writeBytes(d / "2/data", kFirst);
          writeBytes(d / "2/data.chk.tmp", store_test::expectedCheckFile(kFirst));
      },
-     SlotState::kLost, 0, {CopyFault::kNoCheckFile, CopyFault::kNoCheckFile}},
+     SlotState::kLost,
+     0,
+     {CopyFault::kNoCheckFile, CopyFault::kNoCheckFile}},
 };
 
 class StoreInspection : public testing::TestWithParam<std::tuple<Row, size_t>> {};
@@ -298,10 +331,10 @@ TEST(StoreInspectionDetails, PlantedEntriesAreReportedByKind) {
             const SlotInspection slot = inspected(base, 1, 0);
             const Storage::CopyInspection& copy = slot.copies[0];
             const std::string where = place;
-            const EntryKind seen = where == "1"             ? (copy.blockedAt == "1" ? copy.blockedKind : EntryKind::kDirectory)
-                                   : where == "1/data"      ? copy.data.kind
-                                   : where == "1/data.chk"  ? copy.checkFile.kind
-                                                            : copy.transient.kind;
+            const EntryKind seen = where == "1" ? (copy.blockedAt == "1" ? copy.blockedKind : EntryKind::kDirectory)
+                                   : where == "1/data"     ? copy.data.kind
+                                   : where == "1/data.chk" ? copy.checkFile.kind
+                                                           : copy.transient.kind;
             EXPECT_EQ(Storage::entryKindName(seen), std::string(Storage::entryKindName(kind)));
             // A planted ".tmp" file takes nothing from the copy.
             const bool judged = where != "1/data.chk.tmp";

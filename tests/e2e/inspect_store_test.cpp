@@ -16,6 +16,7 @@
 #include <gtest/gtest.h>
 
 #include "child_process.h"
+#include "fault_injection.h"
 #include "files.h"
 #include "hostile_tree.h"
 #include "json_value.h"
@@ -41,12 +42,13 @@ const store_test::Bytes kLater = store_test::patternBytes(200, 2);
 
 // Runs inspect_store and checks that nothing below `root` changed but the
 // dump files in "out".
-ProcessResult inspect(const fs::path& root, const std::vector<std::string>& args) {
+ProcessResult inspect(const fs::path& root, const std::vector<std::string>& args,
+                      const testing_support::Environment& env = {}) {
     const auto snapshotTree = [](const fs::path& tree) { return testing_support::snapshotTree(tree, {"out"}); };
     const std::string before = snapshotTree(root);
     std::vector<std::string> argv = {kInspect};
     argv.insert(argv.end(), args.begin(), args.end());
-    const ProcessResult result = testing_support::runProgram(argv, {}, kTimeLimitSeconds);
+    const ProcessResult result = testing_support::runProgram(argv, env, kTimeLimitSeconds);
     EXPECT_EQ(result.signal, 0) << "ended by signal " << result.signal << e2e::describe(args);
     EXPECT_EQ(snapshotTree(root), before) << "inspect_store changed the tree:" << e2e::describe(args);
     return result;
@@ -105,8 +107,8 @@ protected:
     testing_support::ScratchDir scratch;
     const fs::path base = scratch / "base";
 
-    ProcessResult run(const std::vector<std::string>& args) {
-        return inspect(scratch.path(), e2e::concat({"--base", base.string()}, args));
+    ProcessResult run(const std::vector<std::string>& args, const testing_support::Environment& env = {}) {
+        return inspect(scratch.path(), e2e::concat({"--base", base.string()}, args), env);
     }
 };
 
@@ -116,6 +118,24 @@ void flipByte(const fs::path& path, size_t offset) {
     const int64_t time = store_test::mtimeNs(path);
     writeBytes(path, bytes);
     store_test::setMtimeNs(path, time);
+}
+
+// A file's modification time as the report writes it.
+std::string checkTimeText(const fs::path& path) {
+    const int64_t ns = store_test::mtimeNs(path);
+    char text[64];
+    const time_t seconds = ns / store_test::kSecond;
+    struct tm utc {};
+    gmtime_r(&seconds, &utc);
+    const size_t length = std::strftime(text, sizeof text, "%Y-%m-%dT%H:%M:%S", &utc);
+    std::snprintf(text + length, sizeof text - length, ".%09lldZ", static_cast<long long>(ns % store_test::kSecond));
+    return text;
+}
+
+std::string crcText(const store_test::Bytes& bytes) {
+    char text[11];
+    std::snprintf(text, sizeof text, "0x%08x", store_test::referenceCrc32(bytes));
+    return text;
 }
 
 struct StateRow {
@@ -307,24 +327,14 @@ TEST_P(InspectStoreStates, PlainAndJsonReportTheSlot) {
         if (fs::is_regular_file(fs::symlink_status(data))) {
             const store_test::Bytes bytes = readBytes(data);
             EXPECT_EQ(reportedCopy["size"].number, bytes.size());
-            char crc[11];
-            std::snprintf(crc, sizeof crc, "0x%08x", store_test::referenceCrc32(bytes));
-            EXPECT_EQ(reportedCopy["crc32"].text, crc);
+            EXPECT_EQ(reportedCopy["crc32"].text, crcText(bytes));
         } else {
             EXPECT_TRUE(reportedCopy["size"].isNull());
             EXPECT_TRUE(reportedCopy["crc32"].isNull());
         }
         const fs::path check = slotDir / (copy == 0 ? "1/data.chk" : "2/data.chk");
         if (fs::is_regular_file(fs::symlink_status(check))) {
-            const int64_t ns = store_test::mtimeNs(check);
-            char text[64];
-            const time_t seconds = ns / store_test::kSecond;
-            struct tm utc {};
-            gmtime_r(&seconds, &utc);
-            const size_t length = std::strftime(text, sizeof text, "%Y-%m-%dT%H:%M:%S", &utc);
-            std::snprintf(text + length, sizeof text - length, ".%09lldZ",
-                          static_cast<long long>(ns % store_test::kSecond));
-            EXPECT_EQ(reportedCopy["check_time"].text, text);
+            EXPECT_EQ(reportedCopy["check_time"].text, checkTimeText(check));
         } else {
             EXPECT_TRUE(reportedCopy["check_time"].isNull());
         }
@@ -445,6 +455,72 @@ TEST_F(InspectStore, ATargetThatCannotBeOpenedIsNamed) {
     EXPECT_EQ(result.exitStatus, 1);
     EXPECT_NE(result.out.find((base / "app/luts").string() + ": Not a directory"), std::string::npos) << result.out;
 }
+
+// An I/O error on opening one of copy 1's files, as a failing card gives
+// it: the copy names the error, the slot falls back to copy 2, the file's
+// path is reported as damage and nothing changes.
+struct UnreadableRow {
+    const char* name;
+    const char* file;     // in copy 1 of the settings store
+    const char* reason;   // copy 1's
+    const char* summary;  // what copy 1's column says after the reason
+};
+
+const UnreadableRow kUnreadableRows[] = {
+    {"data", "data", "data unreadable: Input/output error", ", 200 bytes, checked "},
+};
+
+class InspectStoreUnreadable : public InspectStore, public ::testing::WithParamInterface<UnreadableRow> {};
+
+TEST_P(InspectStoreUnreadable, AnIoErrorIsDamageNamedByItsText) {
+    const UnreadableRow& row = GetParam();
+    twoWrites(base, kSettings, 0);
+    const fs::path dir = base / "settings";
+    const fs::path file = dir / "1" / row.file;
+    // "1/data" also matches "1/data.chk", whose opens come first; how many
+    // there are depends on whether the kernel opens beneath a directory.
+    const fs::path counted = scratch / "out" / "opens";
+    fs::create_directories(counted.parent_path());
+    const ProcessResult counting =
+        run({"--target", "settings"}, testing_support::faultCountEnv("open", counted, (dir / "1/data.chk").string()));
+    ASSERT_EQ(counting.exitStatus, 0) << counting.out << counting.err;
+    const unsigned long checkOpens = testing_support::readFaultCount(counted);
+    ASSERT_GE(checkOpens, 1u);
+    const unsigned long first = std::string(row.file) == "data" ? checkOpens + 1 : 1;
+    // Every later open of the file fails too, as it would on a broken card.
+    const testing_support::Environment failing =
+        testing_support::faultFromEnv("open", first, "errno:EIO", file.string());
+
+    const ProcessResult json = run({"--target", "settings", "--json"}, failing);
+    EXPECT_EQ(json.exitStatus, 1) << json.out << json.err;
+    EXPECT_EQ(json.err, "");
+    const JsonValue document = parsed(json);
+    if (document.isNull()) return;
+    const JsonValue& slot = document["targets"][0]["slots"][0];
+    EXPECT_EQ(slot["state"].text, "present");
+    EXPECT_EQ(slot["current"].number, 2);
+    const JsonValue& copy1 = slot["copies"][0];
+    EXPECT_FALSE(copy1["valid"].boolean);
+    EXPECT_EQ(copy1["reason"].text, row.reason);
+    EXPECT_FALSE(copy1["interrupted_update"].boolean);
+    EXPECT_EQ(copy1["size"].number, kLater.size());
+    EXPECT_TRUE(slot["copies"][1]["valid"].boolean);
+
+    const ProcessResult plain = run({"--target", "settings"}, failing);
+    EXPECT_EQ(plain.exitStatus, 1) << plain.out << plain.err;
+    EXPECT_EQ(plain.err, "");
+    const std::string copy1Text =
+        std::string("copy 1: ") + row.reason + row.summary +
+        (std::string(row.file) == "data" ? checkTimeText(dir / "1/data.chk")
+                                         : crcText(kLater) + ", checked " + checkTimeText(dir / "1/data.chk"));
+    const std::string copy2Text =
+        "copy 2: valid, 300 bytes crc " + crcText(kFirst) + ", checked " + checkTimeText(dir / "2/data.chk");
+    EXPECT_EQ(plain.out, "settings  0  present  current 2  " + copy1Text + "  " + copy2Text + "\n" + file.string() +
+                             ": Input/output error\n");
+}
+
+INSTANTIATE_TEST_SUITE_P(Files, InspectStoreUnreadable, ::testing::ValuesIn(kUnreadableRows),
+                         [](const ::testing::TestParamInfo<UnreadableRow>& info) { return info.param.name; });
 
 struct CommandLineRow {
     std::vector<std::string> args;

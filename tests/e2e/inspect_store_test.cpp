@@ -468,6 +468,7 @@ struct UnreadableRow {
 
 const UnreadableRow kUnreadableRows[] = {
     {"data", "data", "data unreadable: Input/output error", ", 200 bytes, checked "},
+    {"check_file", "data.chk", "check file unreadable: Input/output error", ", 200 bytes crc "},
 };
 
 class InspectStoreUnreadable : public InspectStore, public ::testing::WithParamInterface<UnreadableRow> {};

@@ -55,7 +55,11 @@ std::vector<std::string> damageLines(const TargetReport& target, size_t index, u
     if (inspected.data.kind == EntryKind::kFile && !inspected.crcKnown) {
         add(copyPath(target, index, copy, Storage::kDataName), std::strerror(inspected.dataError));
     }
-    if (inspected.check.fault == CopyFault::kCheckUnreadable) {
+    // An open that fails for a plain file (EIO, EACCES) is damage too; a
+    // wrong kind or a blocked way was named above.
+    const bool unopenable = inspected.check.fault == CopyFault::kCheckUnopenable && inspected.blockedAt.empty() &&
+                            isFileOrMissing(inspected.checkFile.kind);
+    if (inspected.check.fault == CopyFault::kCheckUnreadable || unopenable) {
         add(copyPath(target, index, copy, Storage::kCheckName), std::strerror(inspected.check.error));
     }
     return lines;

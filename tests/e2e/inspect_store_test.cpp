@@ -6,9 +6,12 @@
 #include <sys/stat.h>
 #include <csignal>
 #include <cstdio>
+#include <cstdlib>
+#include <cstring>
 #include <ctime>
 #include <filesystem>
 #include <functional>
+#include <optional>
 #include <random>
 #include <string>
 #include <vector>
@@ -652,16 +655,95 @@ TEST_F(InspectStore, BootVectorWithoutTheDevice) {
         << result.err;
 }
 
+// The record that tests/device/run_on_device.sh wrote, with what its
+// checksums should be, computed here.
+struct WrittenRecord {
+    uint64_t sector = 0;
+    uint32_t value = 0;
+    unsigned headerStored = 0, headerComputed = 0;
+    unsigned recordStored = 0, recordComputed = 0;
+
+    bool headerHolds() const { return headerStored == headerComputed; }
+    bool recordHolds() const { return recordStored == recordComputed; }
+};
+
+std::optional<WrittenRecord> writtenRecord() {
+    const char* sector = std::getenv("SIMULATED_DEVICE_BOOT_VECTOR_SECTOR");
+    const char* hex = std::getenv("SIMULATED_DEVICE_BOOT_VECTOR_RECORD");
+    if (sector == nullptr || hex == nullptr || std::strlen(hex) != 40) return std::nullopt;
+    store_test::Bytes bytes;
+    for (size_t i = 0; i < 40; i += 2)
+        bytes.push_back(static_cast<uint8_t>(std::stoul(std::string(hex + i, 2), 0, 16)));
+    WrittenRecord record;
+    record.sector = std::stoull(sector);
+    record.value = static_cast<uint32_t>(bytes[0]) << 24 | bytes[1] << 16 | bytes[2] << 8 | bytes[3];
+    record.headerStored = bytes[8];
+    for (size_t i = 0; i < 8; ++i) record.headerComputed = (record.headerComputed + bytes[i]) & 0xff;
+    record.recordStored = bytes[18] | bytes[19] << 8;
+    record.recordComputed = e2e::bsdChecksum16(bytes.data(), 18);
+    return record;
+}
+
+bool onBadRecordDevice() {
+    const char* variant = std::getenv("SIMULATED_DEVICE_VARIANT");
+    return variant != nullptr && std::string(variant) == "badrecord";
+}
+
+std::string hexText(unsigned value, int digits) {
+    char text[16];
+    std::snprintf(text, sizeof text, "0x%0*x", digits, value);
+    return text;
+}
+
+// inspect_store --boot-vector, plain and JSON, against the record as
+// written: exact text, and exit status 1 exactly when a checksum fails.
+void expectBootVectorReport(const fs::path& root, const WrittenRecord& record) {
+    const bool valid = record.headerHolds() && record.recordHolds();
+    const auto holds = [](bool yes) { return yes ? " holds\n" : " does not hold\n"; };
+    const ProcessResult plain = inspect(root, {"--boot-vector"});
+    EXPECT_EQ(plain.exitStatus, valid ? 0 : 1) << plain.err;
+    EXPECT_EQ(plain.err, "");
+    EXPECT_EQ(plain.out, "sector " + std::to_string(record.sector) + " (byte " + std::to_string(record.sector * 512) +
+                             " of /dev/mmcblk0)\nvalue " + std::to_string(record.value) + "\nheader_checksum stored " +
+                             hexText(record.headerStored, 2) + " computed " + hexText(record.headerComputed, 2) +
+                             holds(record.headerHolds()) + "record_checksum stored " + hexText(record.recordStored, 4) +
+                             " computed " + hexText(record.recordComputed, 4) + holds(record.recordHolds()) +
+                             (valid ? "record valid\n" : "record invalid\n"));
+
+    const ProcessResult json = inspect(root, {"--boot-vector", "--json"});
+    EXPECT_EQ(json.exitStatus, valid ? 0 : 1) << json.err;
+    EXPECT_EQ(json.err, "");
+    const JsonValue document = parsed(json);
+    if (document.isNull()) return;
+    EXPECT_EQ(document["sector"].number, record.sector);
+    EXPECT_EQ(document["offset"].number, record.sector * 512);
+    EXPECT_EQ(document["value"].number, record.value);
+    EXPECT_EQ(document["header_checksum"]["stored"].text, hexText(record.headerStored, 2));
+    EXPECT_EQ(document["header_checksum"]["computed"].text, hexText(record.headerComputed, 2));
+    EXPECT_EQ(document["header_checksum"]["holds"].boolean, record.headerHolds());
+    EXPECT_EQ(document["record_checksum"]["stored"].text, hexText(record.recordStored, 4));
+    EXPECT_EQ(document["record_checksum"]["computed"].text, hexText(record.recordComputed, 4));
+    EXPECT_EQ(document["record_checksum"]["holds"].boolean, record.recordHolds());
+    EXPECT_EQ(document["valid"].boolean, valid);
+}
+
 TEST_F(InspectStore, BootVectorOnTheDevice) {
     if (e2e::currentHost() != e2e::Host::kSimulatedDevice) GTEST_SKIP() << "needs the simulated device";
-    const ProcessResult result = inspect(scratch.path(), {"--boot-vector", "--json"});
-    EXPECT_EQ(result.exitStatus, 0) << result.err;
-    const JsonValue document = parsed(result);
-    if (document.isNull()) return;
-    EXPECT_TRUE(document["valid"].boolean);
-    EXPECT_TRUE(document["header_checksum"]["holds"].boolean);
-    EXPECT_TRUE(document["record_checksum"]["holds"].boolean);
-    EXPECT_EQ(document["offset"].number, document["sector"].number * 512);
+    if (onBadRecordDevice()) GTEST_SKIP() << "the device's record is invalid on purpose";
+    const std::optional<WrittenRecord> record = writtenRecord();
+    ASSERT_TRUE(record) << "run_on_device.sh named no record";
+    ASSERT_TRUE(record->headerHolds() && record->recordHolds());
+    expectBootVectorReport(scratch.path(), *record);
+}
+
+// Runs on the badrecord devices of tests/e2e/CMakeLists.txt.
+TEST_F(InspectStore, BootVectorWithChecksumsThatDoNotHold) {
+    if (e2e::currentHost() != e2e::Host::kSimulatedDevice) GTEST_SKIP() << "needs the simulated device";
+    if (!onBadRecordDevice()) GTEST_SKIP() << "needs the simulated device's badrecord variant";
+    const std::optional<WrittenRecord> record = writtenRecord();
+    ASSERT_TRUE(record) << "run_on_device.sh named no record";
+    ASSERT_FALSE(record->headerHolds() && record->recordHolds());
+    expectBootVectorReport(scratch.path(), *record);
 }
 
 }  // namespace

@@ -1,6 +1,7 @@
-# cmake --install: the tool with its manual page, and the common and storage
-# libraries with their public headers, a CMake package configuration and a
-# pkg-config file, so that another program links them with
+# cmake --install: the tool and inspect_store with their manual pages, and
+# the common and storage libraries with their public headers, a CMake
+# package configuration and a pkg-config file, so that another program
+# links them with
 #   find_package(migrate_settings) and migrate_settings::storage, or
 #   pkg-config --cflags --libs migrate_settings.
 include(GNUInstallDirs)
@@ -8,8 +9,9 @@ include(CMakePackageConfigHelpers)
 
 set(MIGRATE_SETTINGS_PACKAGE_DIR ${CMAKE_INSTALL_LIBDIR}/cmake/migrate_settings)
 
-install(TARGETS migrate_settings RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR})
-install(FILES ${PROJECT_SOURCE_DIR}/docs/migrate_settings.1 DESTINATION ${CMAKE_INSTALL_MANDIR}/man1)
+install(TARGETS migrate_settings inspect_store RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR})
+install(FILES ${PROJECT_SOURCE_DIR}/docs/migrate_settings.1 ${PROJECT_SOURCE_DIR}/docs/inspect_store.1
+        DESTINATION ${CMAKE_INSTALL_MANDIR}/man1)
 
 install(TARGETS common storage EXPORT migrate_settings-targets
         ARCHIVE DESTINATION ${CMAKE_INSTALL_LIBDIR}

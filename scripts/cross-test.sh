@@ -1,8 +1,9 @@
 #!/usr/bin/env bash
 # Builds everything for the device (ARM64) with Debian's cross compiler and
 # runs the tests under qemu-aarch64, then builds the fully static tool and
-# reports its stripped size. The ARM64 tool's --help is compared with the
-# native build's (made here when missing).
+# reports its stripped size, and checks that inspect_store ships beside it.
+# The ARM64 tool's --help is compared with the native build's (made here
+# when missing).
 #   cross-test.sh [--static-only]
 # --static-only builds and checks the static tool alone: CI runs the ARM64
 # suite on the emulated device instead (arm64-device.sh test).
@@ -53,3 +54,11 @@ file -L "$tool" | grep -q ', statically linked, ' || { echo "not statically link
 # No sysroot: a static program needs none of the target's libraries.
 REQUIRE_NATIVE_TOOL=1 tests/packaging/help_matches_native.sh "$native" qemu-aarch64 "$tool"
 echo "static ARM64 migrate_settings, stripped: $(stat -c %s "$tool") bytes"
+
+inspector=$prefix/bin/inspect_store
+check_arm64 "$inspector"
+file -L "$inspector" | grep -q ', statically linked, ' || { echo "not statically linked: $inspector" >&2; exit 1; }
+# It runs: an empty base holds only empty slots.
+qemu-aarch64 "$inspector" --base "$prefix/no-stores" --target lut --index 25 | grep -q '^lut  *25  *empty ' ||
+  { echo "the static ARM64 inspect_store does not report an empty slot" >&2; exit 1; }
+echo "static ARM64 inspect_store, stripped: $(stat -c %s "$inspector") bytes"

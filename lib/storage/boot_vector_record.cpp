@@ -7,12 +7,21 @@
 
 namespace Storage {
 
-bool isValidBootVectorRecord(const uint8_t* record) {
+uint8_t bootVectorHeaderSum(const uint8_t* record) {
     uint8_t headerSum = 0;
     for (size_t i = 0; i < 8; ++i) headerSum = static_cast<uint8_t>(headerSum + record[i]);
-    if (headerSum != record[8]) return false;
-    const uint16_t stored = static_cast<uint16_t>(record[18] | record[19] << 8);
-    return bsdChecksum16(0, record, 18) == stored;
+    return headerSum;
+}
+
+uint16_t bootVectorRecordChecksum(const uint8_t* record) { return bsdChecksum16(0, record, 18); }
+
+uint16_t storedBootVectorRecordChecksum(const uint8_t* record) {
+    return static_cast<uint16_t>(record[18] | record[19] << 8);
+}
+
+bool isValidBootVectorRecord(const uint8_t* record) {
+    if (bootVectorHeaderSum(record) != record[8]) return false;
+    return bootVectorRecordChecksum(record) == storedBootVectorRecordChecksum(record);
 }
 
 uint32_t bootVectorValue(const uint8_t* record) {

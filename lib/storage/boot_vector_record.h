@@ -19,6 +19,13 @@ constexpr uint64_t kSectorSize = 512;
 constexpr uint64_t kBootVectorFirstSector = 6291456;
 constexpr uint64_t kBootVectorLastSector = 33554432;
 
+// The header checksum that byte 8 must hold: bytes 0..7 summed modulo 256.
+uint8_t bootVectorHeaderSum(const uint8_t* record);
+
+// The record checksum that bytes 18..19 must hold, and the one they hold.
+uint16_t bootVectorRecordChecksum(const uint8_t* record);
+uint16_t storedBootVectorRecordChecksum(const uint8_t* record);
+
 // Both checksums hold; the 16-bit one is only computed when the 8-bit one
 // does.
 bool isValidBootVectorRecord(const uint8_t* record);

@@ -9,6 +9,15 @@
 
 namespace Storage {
 
+// Asks the partitioning tool for the record's sector, the start of the
+// last free area of "/dev/mmcblk0"; logs why when it cannot be found.
+[[nodiscard]] Status locateBootVector(uint64_t& sector);
+
+// Reads the record at `sector` of "/dev/mmcblk0", which is opened
+// read-only. STATUS_FAILED on a failed open (logged), seek or short read;
+// the record is not validated.
+[[nodiscard]] Status readBootVectorRecord(uint64_t sector, uint8_t (&record)[kBootVectorRecordSize]);
+
 class BootVectorTarget : public Target {
 public:
     BootVectorTarget() = default;
@@ -35,9 +44,6 @@ public:
         Status readSome(uint8_t* buffer, size_t size, int64_t offset, size_t& bytesRead) override;
 
     private:
-        Status locate();
-        void load();
-
         uint8_t record_[kBootVectorRecordSize] = {};
         uint64_t sector_ = 0;  // 0: no usable boot vector
     };

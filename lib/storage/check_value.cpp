@@ -49,10 +49,11 @@ Status computeCheckValue(int fd, const struct stat& status, uint64_t& value) {
     return STATUS_OK;
 }
 
-bool matchesCheckValue(int fd, const struct stat& status, uint64_t stored) {
-    if (static_cast<uint32_t>(status.st_size) != static_cast<uint32_t>(stored)) return false;
+CheckMatch compareCheckValue(int fd, const struct stat& status, uint64_t stored) {
+    if (static_cast<uint32_t>(status.st_size) != static_cast<uint32_t>(stored)) return CheckMatch::kSizeDiffers;
     uint64_t actual = 0;
-    return computeCheckValue(fd, status, actual) == STATUS_OK && actual == stored;
+    if (computeCheckValue(fd, status, actual) != STATUS_OK) return CheckMatch::kUnreadable;
+    return actual == stored ? CheckMatch::kMatches : CheckMatch::kCrcDiffers;
 }
 
 CheckTime checkTimeOf(const struct stat& status) { return {status.st_mtim.tv_sec < kFileClockEnd, status.st_mtim}; }

@@ -19,11 +19,12 @@ constexpr size_t kCheckValueSize = 8;
 // blocks of 4096 bytes, shifted left by 32. STATUS_FAILED on a read error.
 [[nodiscard]] Status computeCheckValue(int fd, const struct stat& status, uint64_t& value);
 
-// Whether the open regular data file `fd` has the check value `stored`, as
-// computeCheckValue gives it. The data is read only when its size agrees
-// with the size half of `stored`: a file that cannot match, however large,
-// is never read.
-bool matchesCheckValue(int fd, const struct stat& status, uint64_t stored);
+// How the open regular data file `fd` compares with the check value
+// `stored`, as computeCheckValue gives it. The data is read only when its
+// size agrees with the size half of `stored`: a file that cannot match,
+// however large, is never read. kUnreadable leaves the read's errno.
+enum class CheckMatch { kMatches, kSizeDiffers, kCrcDiffers, kUnreadable };
+CheckMatch compareCheckValue(int fd, const struct stat& status, uint64_t stored);
 
 // A check file's modification time, as opening a slot compares them.
 // Unknown when it could not be read or lies beyond what

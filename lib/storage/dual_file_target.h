@@ -46,6 +46,7 @@
 namespace Storage {
 
 struct CheckTime;
+struct CopyCheck;
 class SlotDirectories;
 
 class DualFileTarget : public Target {
@@ -97,8 +98,9 @@ public:
         unsigned otherIndex() const { return (current_ + 1) % 2; }
         // Each operation reaches the slot's directories afresh.
         SlotDirectories directories() const;
-        // Decides whether the copy is valid; returns its check file's time.
-        CheckTime validate(unsigned index, SlotDirectories& directories);
+        // Decides whether the copy is valid and removes a check file that
+        // does not vouch for its data; returns the judgement.
+        CopyCheck validate(unsigned index, SlotDirectories& directories);
         void invalidate(unsigned index, SlotDirectories& directories);
         Status openCopyData(unsigned index, SlotDirectories& directories, int flags, UniqueFd& fd);
         Status commit(unsigned index, SlotDirectories& directories, const CheckTime& previousTime);

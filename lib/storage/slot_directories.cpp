@@ -43,6 +43,10 @@ CopyDirectory reachBelow(const CopyDirectory& parent, const char* name, bool cre
 
 }  // namespace
 
+std::string slotDirectoryName(size_t slotCount, size_t index) {
+    return slotCount == 1 ? std::string() : std::to_string(index);
+}
+
 Status CopyDirectory::computeCheck(uint64_t& value) const {
     struct stat status {};
     const UniqueFd data = open(kDataName, O_RDONLY, 0, &status);

@@ -28,6 +28,10 @@ constexpr const char* kDataName = "data";
 constexpr const char* kCheckName = "data.chk";
 constexpr const char* kTransientName = "data.chk.tmp";
 
+// The directory of slot `index` below the base directory: none (empty)
+// when the target has one slot, else the index in decimal.
+std::string slotDirectoryName(size_t slotCount, size_t index);
+
 // A copy's directory as far as an operation could reach it.
 struct CopyDirectory {
     int fd = -1;           // borrowed from the SlotDirectories

@@ -11,6 +11,7 @@
 
 #include "lib/storage/boot_vector_target.h"
 #include "lib/storage/check_value.h"
+#include "lib/storage/copy_check.h"
 #include "lib/storage/dual_file_target.h"
 #include "lib/storage/file_read_target.h"
 #include "lib/storage/firmware_update_boot_target.h"
@@ -69,15 +70,6 @@ Status copyFile(const CopyDirectory& from, const CopyDirectory& to) {
     }
 }
 
-// Whether the data file of a copy has the check value `stored` (an absent
-// file matches an absent blob).
-bool dataMatches(SlotDirectories& directories, unsigned copy, uint64_t stored) {
-    struct stat status {};
-    const UniqueFd data = directories.openForReading(copy, kDataName, status);
-    if (!data) return errno == ENOENT && stored == kAbsentBlobCheckValue;
-    return matchesCheckValue(data.get(), status, stored);
-}
-
 Status readCopy(SlotDirectories& directories, unsigned copy, bool valid, uint8_t* buffer, size_t size, int64_t offset,
                 size_t* bytesRead) {
     if (!valid) return directories.open(copy).holds(kDataName) ? STATUS_FAILED : STATUS_NOT_FOUND;
@@ -101,7 +93,7 @@ DualFileTarget::DualFileTarget(fs::path basePath, size_t slotCount) {
     const UniqueFd base(::open(basePath_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     slots_.reserve(slotCount);
     for (size_t i = 0; i < slotCount; ++i) {
-        slots_.emplace_back(basePath_, slotCount == 1 ? std::string() : std::to_string(i), base.get());
+        slots_.emplace_back(basePath_, slotDirectoryName(slotCount, i), base.get());
     }
 }
 
@@ -115,40 +107,31 @@ DualFileTarget::Slot::Slot(fs::path baseDirectory, std::string name, int base)
     const char* const names[] = {"1/data", "2/data"};
     const fs::path directory = name_.empty() ? baseDirectory_ : baseDirectory_ / name_;
     SlotDirectories opening(baseDirectory_, name_, base);
-    CheckTime checkTimes[2];
+    CopyCheck checks[2];
     for (unsigned i = 0; i < copies_.size(); ++i) {
         Copy& copy = copies_[i];
         copy.dataPath = directory / names[i];
         copy.checkPath = withSuffix(copy.dataPath, ".chk");
-        checkTimes[i] = validate(i, opening);
+        checks[i] = validate(i, opening);
     }
-    if (copies_[1].valid && isLater(checkTimes[1], copies_[0].valid ? checkTimes[0] : CheckTime{})) current_ = 1;
+    current_ = currentCopy(checks[0], checks[1]);
 }
 
 SlotDirectories DualFileTarget::Slot::directories() const { return SlotDirectories(baseDirectory_, name_); }
 
-CheckTime DualFileTarget::Slot::validate(unsigned index, SlotDirectories& directories) {
+CopyCheck DualFileTarget::Slot::validate(unsigned index, SlotDirectories& directories) {
     Copy& copy = copies_[index];
-    struct stat status {};
-    uint64_t stored = 0;
-    CheckTime checkTime;
-    // The stored value first: data that no check file vouches for is not read.
-    Status read = STATUS_NOT_FOUND;
-    const UniqueFd check = directories.openForReading(index, kCheckName, status);
-    if (check) {
-        checkTime = checkTimeOf(status);
-        read = readCheckValue(check.get(), status, stored);
-    } else {
-        if (errno != ENOENT) read = STATUS_FAILED;
+    const CopyCheck check = checkCopy(directories, index);
+    copy.valid = check.valid();
+    if (check.fault == CopyFault::kNoCheckFile || check.fault == CopyFault::kCheckUnopenable) {
         // Without a check file the directory may be missing; failing to make it fails the updates.
         (void)directories.ensure(index);
     }
-    copy.valid = read == STATUS_OK && dataMatches(directories, index, stored);
     // A mismatching check file must never become valid again by accident; a missing one needs no removal.
-    if (!copy.valid && read != STATUS_NOT_FOUND && directories.open(index).remove(kCheckName) != 0) {
+    if (!copy.valid && check.fault != CopyFault::kNoCheckFile && directories.open(index).remove(kCheckName) != 0) {
         LOGE_AT(kCleanupCheckfileLine) << "Failure cleaning up checkfile " << std::quoted(copy.checkPath.string());
     }
-    return checkTime;
+    return check;
 }
 
 bool DualFileTarget::Slot::exists() const {
@@ -389,18 +372,12 @@ void logFlashWriteFailure(bool opened, int64_t written) {
 
 }  // namespace
 
-BootVectorTarget::Slot::Slot() {
-    if (locate() != STATUS_OK || sector_ == 0) return;
-    load();
-}
-
-Status BootVectorTarget::Slot::locate() {
+Status locateBootVector(uint64_t& sector) {
     std::string output;
     if (runCommand(kFreeAreaCommand, output) != STATUS_OK) {
         LOGE << "Failed to query flash size";
         return STATUS_FAILED;
     }
-    uint64_t sector = 0;
     switch (parseBootVectorSector(output, sector)) {
         case SectorParse::kNotANumber:
             LOGE << "Failed to parse flash size '" << output << "'";
@@ -412,19 +389,27 @@ Status BootVectorTarget::Slot::locate() {
         case SectorParse::kOk:
             break;
     }
-    sector_ = sector;
     return STATUS_OK;
 }
 
-void BootVectorTarget::Slot::load() {
+Status readBootVectorRecord(uint64_t sector, uint8_t (&record)[kBootVectorRecordSize]) {
     const UniqueFd fd(::open(kFlashDevice, O_RDONLY | O_CLOEXEC | O_SYNC));
     if (!fd) logOpenFailure(kFlashDevice, errno);
-    if (!fd || ::lseek(fd.get(), static_cast<off_t>(sector_ * kSectorSize), SEEK_SET) < 0 ||
-        ::read(fd.get(), record_, sizeof record_) != static_cast<ssize_t>(sizeof record_) ||
-        !isValidBootVectorRecord(record_)) {
-        sector_ = 0;
-        LOGE << "Boot vector query failed!";
+    if (!fd || ::lseek(fd.get(), static_cast<off_t>(sector * kSectorSize), SEEK_SET) < 0 ||
+        ::read(fd.get(), record, sizeof record) != static_cast<ssize_t>(sizeof record)) {
+        return STATUS_FAILED;
     }
+    return STATUS_OK;
+}
+
+BootVectorTarget::Slot::Slot() {
+    uint64_t sector = 0;
+    if (locateBootVector(sector) != STATUS_OK || sector == 0) return;
+    if (readBootVectorRecord(sector, record_) != STATUS_OK || !isValidBootVectorRecord(record_)) {
+        LOGE << "Boot vector query failed!";
+        return;
+    }
+    sector_ = sector;
 }
 
 Status BootVectorTarget::Slot::read(uint8_t* buffer, size_t size, int64_t offset) {

@@ -23,6 +23,7 @@ cmake --install "$build_dir" --prefix "$prefix" >"$scratch/install.log" || {
 package=$libdir/cmake/migrate_settings
 {
   printf '%s\n' "$bindir/migrate_settings" "$mandir/man1/migrate_settings.1" \
+    "$bindir/inspect_store" "$mandir/man1/inspect_store.1" \
     "$libdir/libmigrate_settings_common.a" "$libdir/libmigrate_settings_storage.a" \
     "$package/migrate_settings-config.cmake" "$package/migrate_settings-config-version.cmake" \
     "$package/migrate_settings-targets.cmake" "$package/migrate_settings-targets-$(tr '[:upper:]' '[:lower:]' <<<"${build_type:-noconfig}").cmake" \

@@ -14,14 +14,8 @@ struct PartitionRow {
     const char* path;
 };
 
-struct DualFileRow {
-    StorageTarget id;
-    const char* location;  // below the base directory
-    unsigned slotCount;
-};
-
 // In registration order.
-constexpr DualFileRow kDualFileRows[] = {
+constexpr DualFileRows kDualFileRows = {{
     {kIpiStorageTargetSettings, "settings", 1},
     {kIpiStorageTargetOverlay, "app/overlays", 8},
     {kIpiStorageTargetLUT, "app/luts", 26},
@@ -30,7 +24,7 @@ constexpr DualFileRow kDualFileRows[] = {
     {kIpiStorageTargetUtilSave, "app/utilSave", 1},
     {kIpiStorageTargetApplicationInternal, "app/internal", 1},
     {kIpiStorageTargetRebootPersistent, "app/rebootPersistent", 1},
-};
+}};
 
 // Read-only access to the device's partitions, after the dual-file stores.
 constexpr PartitionRow kPartitionRows[] = {
@@ -40,6 +34,8 @@ constexpr PartitionRow kPartitionRows[] = {
 };
 
 }  // namespace
+
+const DualFileRows& dualFileRows() { return kDualFileRows; }
 
 const char* storageTargetName(StorageTarget id) {
     switch (id) {
@@ -85,7 +81,7 @@ std::unique_ptr<Storage::Target> makeDualFileTarget(std::filesystem::path&& loca
 }
 
 void registerTargets(std::filesystem::path base, TargetRegistry& registry) {
-    for (const DualFileRow& row : kDualFileRows) {
+    for (const DualFileRow& row : dualFileRows()) {
         registerTarget(registry, row.id, makeDualFileTarget(base / row.location, row.slotCount));
     }
     for (const PartitionRow& row : kPartitionRows) {

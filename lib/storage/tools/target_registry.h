@@ -13,6 +13,17 @@
 // reverse order).
 using TargetRegistry = std::array<std::unique_ptr<Storage::Target>, kStorageTargetCount>;
 
+// A dual-file store below the base directory.
+struct DualFileRow {
+    StorageTarget id;
+    const char* location;  // below the base directory
+    unsigned slotCount;
+};
+
+// The dual-file stores, in registration order.
+using DualFileRows = std::array<DualFileRow, 8>;
+const DualFileRows& dualFileRows();
+
 // The enumerator's name as printed in the log; values without a name print
 // as the first one.
 const char* storageTargetName(StorageTarget id);

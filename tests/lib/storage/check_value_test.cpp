@@ -105,27 +105,32 @@ TEST(ComputeCheckValue, UnreadableDataFails) {
 }
 
 // Only a size that agrees with the stored one lets the data be read.
-TEST(MatchesCheckValue, AgreesWithTheComputedValue) {
+TEST(CompareCheckValue, AgreesWithTheComputedValue) {
     ScratchDir dir;
     const Bytes data = patternBytes(5000, 4);
     writeBytes(dir / "data", data);
     const Opened file = opened(dir / "data");
     const uint64_t good = littleEndian(expectedCheckFile(data));
-    EXPECT_TRUE(Storage::matchesCheckValue(file.fd.get(), file.status, good));
-    EXPECT_FALSE(Storage::matchesCheckValue(file.fd.get(), file.status, good ^ (uint64_t{1} << 40)));  // the CRC
-    EXPECT_FALSE(Storage::matchesCheckValue(file.fd.get(), file.status, good + 1));                    // the size
+    using Storage::CheckMatch;
+    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good), CheckMatch::kMatches);
+    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good ^ (uint64_t{1} << 40)),
+              CheckMatch::kCrcDiffers);
+    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good + 1), CheckMatch::kSizeDiffers);
+    // Only the size half counts as size: bits 32 and up are the CRC's.
+    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good + (uint64_t{1} << 32)),
+              CheckMatch::kCrcDiffers);
 }
 
 // A read would move the file position; a size that cannot match leaves it.
-TEST(MatchesCheckValue, ADifferentSizeIsNotRead) {
+TEST(CompareCheckValue, ADifferentSizeIsNotRead) {
     ScratchDir dir;
     const Bytes data = patternBytes(5000, 5);
     writeBytes(dir / "data", data);
     const Opened file = opened(dir / "data");
     const uint64_t good = littleEndian(expectedCheckFile(data));
-    EXPECT_FALSE(Storage::matchesCheckValue(file.fd.get(), file.status, good - 1));
+    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good - 1), Storage::CheckMatch::kSizeDiffers);
     EXPECT_EQ(::lseek(file.fd.get(), 0, SEEK_CUR), 0);
-    EXPECT_TRUE(Storage::matchesCheckValue(file.fd.get(), file.status, good));
+    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good), Storage::CheckMatch::kMatches);
     EXPECT_EQ(::lseek(file.fd.get(), 0, SEEK_CUR), 5000);
 }
 

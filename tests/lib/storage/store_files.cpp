@@ -139,4 +139,13 @@ SlotContent holding(const Bytes& data) { return SlotContent{true, true, STATUS_O
 SlotContent absentBlob() { return SlotContent{false, true, STATUS_NOT_FOUND, {}}; }
 SlotContent nothingStored() { return SlotContent{false, false, STATUS_NOT_FOUND, {}}; }
 
+void copyTree(const fs::path& from, const fs::path& to) {
+    fs::copy(from, to, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
+    for (const auto& entry : fs::recursive_directory_iterator(from)) {
+        if (entry.is_regular_file() && !entry.is_symlink()) {
+            setMtimeNs(to / entry.path().lexically_relative(from), mtimeNs(entry.path()));
+        }
+    }
+}
+
 }  // namespace store_test

@@ -40,6 +40,10 @@ int64_t nowNs();
 // Creates (or truncates) a file so that the kernel stamps the current time.
 int64_t touchNow(const std::filesystem::path& path);
 
+// Copies the tree `from` to `to` (which must not exist), links as links,
+// with the modification times of its files, which decide the current copy.
+void copyTree(const std::filesystem::path& from, const std::filesystem::path& to);
+
 // The describeTree lines of a valid copy ("1" or "2") holding `blob`.
 std::string copyLines(const std::string& copy, const Bytes& blob);
 

@@ -26,10 +26,12 @@
 // replaced, never followed.
 //
 // The store relies on its file system: a torn write of the file system's
-// own super block loses it whole. Devices need an eMMC with reliable write
-// (the kernel sends forced-unit-access writes, as ext4 writes its super
-// block, as reliable writes) and the store's file system mounted with
-// barriers on: never barrier=0 or nobarrier.
+// own super block or group descriptors loses it whole, and ext4 writes
+// them in place, as forced-unit-access writes and as ordinary ones.
+// Devices need an eMMC that does not tear a write when its power fails
+// (reliable write for every write, or power-loss protection) and the
+// store's file system mounted with barriers on: never barrier=0 or
+// nobarrier.
 //
 // Failures are returned as errno values or STATUS_FAILED; nothing is
 // thrown but allocation failures.

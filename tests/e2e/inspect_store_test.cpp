@@ -115,14 +115,6 @@ protected:
     }
 };
 
-void flipByte(const fs::path& path, size_t offset) {
-    store_test::Bytes bytes = readBytes(path);
-    bytes.at(offset) ^= 0x01;
-    const int64_t time = store_test::mtimeNs(path);
-    writeBytes(path, bytes);
-    store_test::setMtimeNs(path, time);
-}
-
 // A file's modification time as the report writes it.
 std::string checkTimeText(const fs::path& path) {
     const int64_t ns = store_test::mtimeNs(path);
@@ -188,7 +180,7 @@ const StateRow kStateRows[] = {
     {"crc_differs",
      [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
          twoWrites(b, target, index);
-         flipByte(d / "1/data", 99);
+         store_test::flipByte(d / "1/data", 99);
      },
      "present",
      2,
@@ -278,7 +270,7 @@ const StateRow kStateRows[] = {
     {"lost",
      [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
          twoWrites(b, target, index);
-         flipByte(d / "1/data", 0);
+         store_test::flipByte(d / "1/data", 0);
          fs::resize_file(d / "2/data.chk", 7);
      },
      "lost",
@@ -418,7 +410,7 @@ TEST_F(InspectStore, OneSlotByIndexInEveryForm) {
 
 TEST_F(InspectStore, DumpWritesExactlyTheBytesTheSlotReads) {
     twoWrites(base, kLut, 4);
-    flipByte(slotDirectory(base, kLut, 4) / "1/data", 3);  // copy 2 serves again
+    store_test::flipByte(slotDirectory(base, kLut, 4) / "1/data", 3);  // copy 2 serves again
     const fs::path copy = scratch / "copy";
     store_test::copyTree(base, copy);
     Storage::DualFileTarget store(copy / kLut.location, kLut.slots);
@@ -600,7 +592,6 @@ TEST_F(InspectStore, PlantedEntriesAreNamedAndLeftAlone) {
 // are what a DualFileTarget opened on a copy of the tree serves.
 TEST_F(InspectStore, AgreesWithTheStoreOnRandomlyDamagedTrees) {
     std::mt19937 random(1125);
-    const char* const files[] = {"1/data", "1/data.chk", "2/data", "2/data.chk"};
     for (int round = 0; round < 40; ++round) {
         SCOPED_TRACE("round " + std::to_string(round));
         fs::remove_all(base);
@@ -609,25 +600,7 @@ TEST_F(InspectStore, AgreesWithTheStoreOnRandomlyDamagedTrees) {
         const size_t index = random() % target.slots;
         twoWrites(base, target, index);
         const fs::path dir = slotDirectory(base, target, index);
-        for (int damage = 1 + static_cast<int>(random() % 3); damage > 0; --damage) {
-            const fs::path file = dir / files[random() % 4];
-            if (!fs::exists(file)) continue;
-            switch (random() % 4) {
-                case 0:
-                    fs::resize_file(file, random() % (fs::file_size(file) + 1));
-                    break;
-                case 1:
-                    if (fs::file_size(file) > 0) flipByte(file, random() % fs::file_size(file));
-                    break;
-                case 2:
-                    fs::remove(file);
-                    break;
-                default:
-                    store_test::setMtimeNs(
-                        file, store_test::kPast + static_cast<int64_t>(random() % 3) * store_test::kSecond);
-                    break;
-            }
-        }
+        store_test::damageAtRandom(dir, random);
         const ProcessResult result = run({"--target", target.name, "--index", std::to_string(index), "--json"});
         const JsonValue document = parsed(result);
         if (document.isNull()) continue;

@@ -148,4 +148,34 @@ void copyTree(const fs::path& from, const fs::path& to) {
     }
 }
 
+void flipByte(const fs::path& path, size_t offset) {
+    Bytes bytes = testing_support::readBytes(path);
+    bytes.at(offset) ^= 0x01;
+    const int64_t time = mtimeNs(path);
+    testing_support::writeBytes(path, bytes);
+    setMtimeNs(path, time);
+}
+
+void damageAtRandom(const fs::path& slotDirectory, std::mt19937& random) {
+    const char* const files[] = {"1/data", "1/data.chk", "2/data", "2/data.chk"};
+    for (int damage = 1 + static_cast<int>(random() % 3); damage > 0; --damage) {
+        const fs::path file = slotDirectory / files[random() % 4];
+        if (!fs::exists(file)) continue;
+        switch (random() % 4) {
+            case 0:
+                fs::resize_file(file, random() % (fs::file_size(file) + 1));
+                break;
+            case 1:
+                if (fs::file_size(file) > 0) flipByte(file, random() % fs::file_size(file));
+                break;
+            case 2:
+                fs::remove(file);
+                break;
+            default:
+                setMtimeNs(file, kPast + static_cast<int64_t>(random() % 3) * kSecond);
+                break;
+        }
+    }
+}
+
 }  // namespace store_test

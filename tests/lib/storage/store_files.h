@@ -6,6 +6,7 @@
 #include <ctime>
 #include <filesystem>
 #include <iosfwd>
+#include <random>
 #include <string>
 #include <vector>
 
@@ -39,6 +40,16 @@ void setMtimeNs(const std::filesystem::path& path, int64_t ns);
 int64_t nowNs();
 // Creates (or truncates) a file so that the kernel stamps the current time.
 int64_t touchNow(const std::filesystem::path& path);
+
+// Flips one bit of the byte at `offset`, keeping the file's time: damage
+// that only the check value can see.
+void flipByte(const std::filesystem::path& path, size_t offset);
+
+// Damages one to three of the store files of the slot directory
+// `slotDirectory` ("1/data", "1/data.chk", "2/data", "2/data.chk") as the
+// field does, each at random: truncated, a byte flipped, deleted, or its
+// time set to kPast plus 0 to 2 s.
+void damageAtRandom(const std::filesystem::path& slotDirectory, std::mt19937& random);
 
 // Copies the tree `from` to `to` (which must not exist), links as links,
 // with the modification times of its files, which decide the current copy.

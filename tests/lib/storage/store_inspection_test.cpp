@@ -91,14 +91,6 @@ void twoWrites(Storage::TargetSlot& slot) {
     ASSERT_EQ(slot.write(kSecond_.data(), kSecond_.size()), STATUS_OK);  // copy 0 ("1"), later
 }
 
-void flipByte(const fs::path& path, size_t offset) {
-    Bytes bytes = readBytes(path);
-    bytes.at(offset) ^= 0x40;
-    const int64_t time = store_test::mtimeNs(path);
-    writeBytes(path, bytes);
-    store_test::setMtimeNs(path, time);
-}
-
 const Row kRows[] = {
     {"never_written",
      [](Storage::TargetSlot&, const fs::path&) {},
@@ -126,7 +118,7 @@ const Row kRows[] = {
     {"crc_differs",
      [](Storage::TargetSlot& s, const fs::path& d) {
          twoWrites(s);
-         flipByte(d / "1/data", 17);
+         store_test::flipByte(d / "1/data", 17);
      },
      SlotState::kPresent,
      1,
@@ -202,7 +194,7 @@ const Row kRows[] = {
     {"lost",
      [](Storage::TargetSlot& s, const fs::path& d) {
          ASSERT_EQ(s.write(kFirst.data(), kFirst.size()), STATUS_OK);
-         flipByte(d / "2/data", 0);
+         store_test::flipByte(d / "2/data", 0);
      },
      SlotState::kLost,
      0,
@@ -350,7 +342,6 @@ TEST(StoreInspectionDetails, PlantedEntriesAreReportedByKind) {
 // store agree.
 TEST(StoreInspectionAgreement, RandomlyDamagedTrees) {
     std::mt19937 random(20261125);
-    const char* const files[] = {"1/data", "1/data.chk", "2/data", "2/data.chk"};
     for (int round = 0; round < 150; ++round) {
         SCOPED_TRACE("round " + std::to_string(round));
         ScratchDir scratch;
@@ -366,25 +357,7 @@ TEST(StoreInspectionAgreement, RandomlyDamagedTrees) {
             }
         }
         const fs::path dir = slotDirectory(base, slots, index);
-        const int damages = 1 + static_cast<int>(random() % 3);
-        for (int i = 0; i < damages; ++i) {
-            const fs::path file = dir / files[random() % 4];
-            if (!fs::exists(file)) continue;
-            switch (random() % 4) {
-                case 0:
-                    fs::resize_file(file, random() % (fs::file_size(file) + 1));
-                    break;
-                case 1:
-                    if (fs::file_size(file) > 0) flipByte(file, random() % fs::file_size(file));
-                    break;
-                case 2:
-                    fs::remove(file);
-                    break;
-                default:
-                    store_test::setMtimeNs(file, kPast + static_cast<int64_t>(random() % 3) * kSecond);
-                    break;
-            }
-        }
+        store_test::damageAtRandom(dir, random);
         const SlotInspection slot = inspected(base, slots, index);
         expectAgreement(base, slots, index, slot, scratch.path());
     }

@@ -47,10 +47,18 @@ std::string slotDirectoryName(size_t slotCount, size_t index) {
     return slotCount == 1 ? std::string() : std::to_string(index);
 }
 
-Status CopyDirectory::computeCheck(uint64_t& value) const {
+Status CopyDirectory::syncAndComputeCheck(uint64_t& value) const {
     struct stat status {};
     const UniqueFd data = open(kDataName, O_RDONLY, 0, &status);
-    if (data) return computeCheckValue(data.get(), status, value);
+    if (data) {
+        // The check file that vouches for the data must never reach the
+        // disk first. Where ext4 allocates blocks as unwritten extents, its
+        // journal can commit a renamed check file whose 8 bytes still read
+        // as zeros, the check value of an empty file, beside a data file
+        // whose new size has not landed: a valid, empty, wrong blob.
+        if (::fsync(data.get()) != 0) return STATUS_FAILED;
+        return computeCheckValue(data.get(), status, value);
+    }
     if (errno != ENOENT) return STATUS_FAILED;
     value = kAbsentBlobCheckValue;
     return STATUS_OK;

@@ -38,10 +38,10 @@ struct CopyDirectory {
     int error = 0;         // why fd is -1: the errno
     bool missing = false;  // fd is -1 because it, or one above it, does not exist
 
-    // The check value of the data file (check_value.h); a missing file, or
-    // a missing directory, holds an absent blob. STATUS_FAILED when it
-    // cannot be computed.
-    [[nodiscard]] Status computeCheck(uint64_t& value) const;
+    // The check value of the data file (check_value.h), once the file is
+    // on the medium (fsync); a missing file, or a missing directory, holds
+    // an absent blob. STATUS_FAILED when it cannot be computed or synced.
+    [[nodiscard]] Status syncAndComputeCheck(uint64_t& value) const;
     // The modification time of the check file; unknown unless it is a
     // regular file.
     CheckTime checkTime() const;

@@ -52,11 +52,17 @@ struct BlockVersion {
     uint64_t end;
 };
 
+// Choice 0: no pending version; 1 to n: versions[choice - 1] landed;
+// n + 1 to 2n, for a fresh block only: versions[choice - n - 1] allocated
+// with its size, its data not landed.
 struct Block {
     uint64_t file;
     uint64_t index;
     std::vector<BlockVersion> versions;
-    size_t forcedChoice = 0;  // choice 0: no pending version; i: versions[i - 1]
+    size_t forcedChoice = 0;
+    // The file did not reach the block before its first pending write: the
+    // write allocates it.
+    bool fresh = false;
 };
 
 class Enumeration {
@@ -100,6 +106,8 @@ private:
         FsImage image = base_;
         for (size_t p = 0; p < pending_.size(); ++p) {
             const FsOp& op = pending_[p];
+            const auto before = image.files.find(op.inode);
+            const uint64_t sizeBefore = before == image.files.end() ? 0 : before->second.data.size();
             applyOp(image, op);
             if (op.kind != FsOpKind::kWrite || op.data.empty()) continue;
             const auto file = image.files.find(op.inode);
@@ -111,6 +119,7 @@ private:
                 const uint64_t begin = index * kBlockSize;
                 const uint64_t end = std::min<uint64_t>(begin + kBlockSize, data.size());
                 Block& block = blockOf(op.inode, index);
+                if (block.versions.empty()) block.fresh = sizeBefore <= begin;
                 const auto from = data.begin() + static_cast<std::ptrdiff_t>(begin);
                 const auto to = data.begin() + static_cast<std::ptrdiff_t>(end);
                 block.versions.push_back(BlockVersion{p, Bytes(from, to), end});
@@ -120,7 +129,7 @@ private:
 
     Block& blockOf(uint64_t file, uint64_t index) {
         const auto [entry, added] = blockIndex_.try_emplace({file, index}, blocks_.size());
-        if (added) blocks_.push_back(Block{file, index, {}, 0});
+        if (added) blocks_.push_back(Block{file, index, {}, 0, false});
         return blocks_[entry->second];
     }
 
@@ -206,6 +215,15 @@ private:
                     options[b].push_back(choice);
                 }
             }
+            // Once a file's data is forced, its blocks are written: only
+            // a block no fsync reached can still be an unwritten extent.
+            if (block.fresh && block.forcedChoice == 0) {
+                for (size_t version = 0; version < block.versions.size(); ++version) {
+                    if (landable(block.versions[version], block.file, persisted)) {
+                        options[b].push_back(block.versions.size() + 1 + version);
+                    }
+                }
+            }
             if (options[b].empty()) return;
         }
         std::vector<size_t> choices(blocks_.size(), 0);
@@ -246,14 +264,21 @@ private:
     void landBlocks(FsImage& image, size_t position, const std::vector<size_t>& choices) const {
         for (size_t b = 0; b < blocks_.size(); ++b) {
             const Block& block = blocks_[b];
-            if (choices[b] == 0 || block.versions[choices[b] - 1].position != position) continue;
+            if (choices[b] == 0) continue;
+            const size_t count = block.versions.size();
+            const bool unwritten = choices[b] > count;
+            const BlockVersion& version = block.versions[unwritten ? choices[b] - count - 1 : choices[b] - 1];
+            if (version.position != position) continue;
             const auto file = image.files.find(block.file);
             if (file == image.files.end()) continue;
-            const BlockVersion& version = block.versions[choices[b] - 1];
             Bytes& data = file->second.data;
-            const uint64_t begin = block.index * kBlockSize;
             if (data.size() < version.end) data.resize(version.end);
-            std::copy(version.bytes.begin(), version.bytes.end(), data.begin() + static_cast<std::ptrdiff_t>(begin));
+            const auto begin = data.begin() + static_cast<std::ptrdiff_t>(block.index * kBlockSize);
+            if (unwritten) {
+                std::fill_n(begin, version.bytes.size(), uint8_t{0});
+            } else {
+                std::copy(version.bytes.begin(), version.bytes.end(), begin);
+            }
         }
     }
 

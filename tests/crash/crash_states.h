@@ -10,8 +10,11 @@
 // earlier metadata (its creation, a truncation) has. fsync forces one
 // file's metadata and data, syncfs everything. A file created and renamed
 // into place whose data never reached the disk is therefore empty: a legal
-// state. The pessimistic order lets the metadata of different files
-// persist in any interleaving, each file's own still in order.
+// state. A block that a write allocates (the file did not reach it) may
+// also read as zeros with the size that covers it: where a block is a page,
+// ext4 allocates delayed blocks as unwritten extents, and the journal
+// commits the allocation and the size without waiting for the data. The pessimistic order lets the metadata of
+// different files persist in any interleaving, each file's own still in order.
 #pragma once
 
 #include <cstddef>

@@ -146,9 +146,9 @@ TEST(ModelStates, RespectsTheWindow) {
     EXPECT_FALSE(model.allows(written, 0, 1));
     EXPECT_TRUE(model.allows(written, 2, 2));
     EXPECT_TRUE(model.allows(written, 0, 3));
-    // Nothing, c.tmp empty or whole, c empty or whole: the times of c.tmp
-    // that the model tells apart are one state to the store.
-    EXPECT_EQ(model.stateCount(0, 3), 5u);
+    // Nothing, c.tmp empty, zeros or whole, c empty, zeros or whole: the
+    // times of c.tmp that the model tells apart are one state to the store.
+    EXPECT_EQ(model.stateCount(0, 3), 7u);
 }
 
 TEST(ModelStates, ComparesTheOrderOfCheckTimes) {

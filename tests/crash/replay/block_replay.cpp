@@ -90,7 +90,11 @@ struct FileSystem {
     bool modelled;                    // the crash model describes it
 };
 
-const std::vector<std::string> kMakeExt4 = {"/sbin/mke2fs", "-q", "-F", "-t", "ext4", "-E", "nodiscard"};
+// The device's data partition is large enough for mke2fs to give it 4 KiB
+// blocks and 256-byte inodes; on the replay's small device it would choose
+// 1 KiB blocks and 128-byte inodes, a file system the device never has.
+const std::vector<std::string> kMakeExt4 = {"/sbin/mke2fs", "-q", "-F",  "-t", "ext4",     "-b",
+                                            "4096",         "-I", "256", "-E", "nodiscard"};
 const std::vector<std::string> kRepairExt4 = {"/sbin/e2fsck", "-p"};
 const std::vector<FileSystem> kFileSystems = {
     {"ext4", "ext4", "", kMakeExt4, kRepairExt4, true},

@@ -8,8 +8,9 @@
 // is under way.
 //
 // Reads see the current copy; every change goes to the other one and
-// becomes current only when its check file has been written under the
-// temporary name, renamed into place and the file system synced. At
+// becomes current only when its data has been synced and its check file
+// written under the temporary name, renamed into place and the file system
+// synced. At
 // opening, a copy is valid when its check file matches its data, invalid
 // check files are deleted, and the valid copy whose check file is strictly
 // newer wins (equal times: copy 0). A power cut at any instant therefore

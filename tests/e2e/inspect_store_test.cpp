@@ -700,7 +700,11 @@ void expectBootVectorReport(const fs::path& root, const WrittenRecord& record) {
     EXPECT_EQ(document["valid"].boolean, valid);
 }
 
-TEST_F(InspectStore, BootVectorOnTheDevice) {
+// Runs only inside the simulated device (its normal and badrecord
+// variants), never in the host's own run.
+class InspectStoreOnDevice : public InspectStore {};
+
+TEST_F(InspectStoreOnDevice, BootVector) {
     if (e2e::currentHost() != e2e::Host::kSimulatedDevice) GTEST_SKIP() << "needs the simulated device";
     if (onBadRecordDevice()) GTEST_SKIP() << "the device's record is invalid on purpose";
     const std::optional<WrittenRecord> record = writtenRecord();
@@ -710,7 +714,7 @@ TEST_F(InspectStore, BootVectorOnTheDevice) {
 }
 
 // Runs on the badrecord devices of tests/e2e/CMakeLists.txt.
-TEST_F(InspectStore, BootVectorWithChecksumsThatDoNotHold) {
+TEST_F(InspectStoreOnDevice, BootVectorWithChecksumsThatDoNotHold) {
     if (e2e::currentHost() != e2e::Host::kSimulatedDevice) GTEST_SKIP() << "needs the simulated device";
     if (!onBadRecordDevice()) GTEST_SKIP() << "needs the simulated device's badrecord variant";
     const std::optional<WrittenRecord> record = writtenRecord();

@@ -63,10 +63,10 @@ void loadTable(const std::string& name, uint64_t sectors, const std::string& tar
     if (sizeof(dm_target_spec) + arguments.size() + 1 > request.payloadRoom() || type.size() >= DM_MAX_TYPE_NAME) {
         throw std::invalid_argument("table too long: " + targetLine);
     }
-    auto* spec = reinterpret_cast<dm_target_spec*>(request.payload());
-    spec->sector_start = 0;
-    spec->length = sectors;
-    std::memcpy(spec->target_type, type.data(), type.size());
+    auto* target = reinterpret_cast<dm_target_spec*>(request.payload());
+    target->sector_start = 0;
+    target->length = sectors;
+    std::memcpy(target->target_type, type.data(), type.size());
     std::memcpy(request.payload() + sizeof(dm_target_spec), arguments.c_str(), arguments.size() + 1);
     request.header().target_count = 1;
     request.sendOrThrow(DM_TABLE_LOAD, "loading the table of");

@@ -443,6 +443,33 @@ TEST_F(InspectStore, DumpOfASlotThatIsNotPresentIs10) {
     }
 }
 
+// A dump that cannot be made names the path at fault on standard error,
+// writes nothing to standard output and is damage.
+TEST_F(InspectStore, ADumpThatFailsNamesWhatFailed) {
+    twoWrites(base, kSettings, 0);
+    fs::create_directories(base / "app");
+    writeBytes(base / "app/luts", {1});
+    const fs::path missing = scratch / "out" / "missing" / "dump.bin";
+    const struct {
+        std::vector<std::string> args;
+        std::string message;
+    } rows[] = {
+        {{"--target", "lut", "--index", "0", "--dump", "-"},
+         '"' + (base / "app/luts").string() + "\": Not a directory"},
+        {{"--target", "settings", "--dump", missing.string()},
+         '"' + missing.string() + "\": No such file or directory"},
+        // A device that takes no data: the copy's bytes cannot be written.
+        {{"--target", "settings", "--dump", "/dev/full"}, "\"/dev/full\": No space left on device"},
+    };
+    for (const auto& row : rows) {
+        const ProcessResult result = run(row.args);
+        EXPECT_EQ(result.exitStatus, 1) << e2e::describe(row.args);
+        EXPECT_EQ(result.out, "") << e2e::describe(row.args);
+        EXPECT_EQ(result.err, row.message + "\n") << e2e::describe(row.args);
+    }
+    EXPECT_FALSE(fs::exists(missing.parent_path()));
+}
+
 TEST_F(InspectStore, ATargetThatCannotBeOpenedIsNamed) {
     fs::create_directories(base / "app");
     writeBytes(base / "app/luts", {1});

@@ -47,7 +47,7 @@ std::string slotDirectoryName(size_t slotCount, size_t index) {
     return slotCount == 1 ? std::string() : std::to_string(index);
 }
 
-Status CopyDirectory::syncAndComputeCheck(uint64_t& value) const {
+Status CopyDirectory::computeCheckAndSync(uint64_t& value) const {
     struct stat status {};
     const UniqueFd data = open(kDataName, O_RDONLY, 0, &status);
     if (data) {
@@ -55,9 +55,13 @@ Status CopyDirectory::syncAndComputeCheck(uint64_t& value) const {
         // disk first. Where ext4 allocates blocks as unwritten extents, its
         // journal can commit a renamed check file whose 8 bytes still read
         // as zeros, the check value of an empty file, beside a data file
-        // whose new size has not landed: a valid, empty, wrong blob.
-        if (::fsync(data.get()) != 0) return STATUS_FAILED;
-        return computeCheckValue(data.get(), status, value);
+        // whose new size has not landed: a valid, empty, wrong blob. The
+        // checksum comes first, while the write-back that closing the data
+        // file began is still under way.
+        if (const Status computed = computeCheckValue(data.get(), status, value); computed != STATUS_OK) {
+            return computed;
+        }
+        return ::fsync(data.get()) == 0 ? STATUS_OK : STATUS_FAILED;
     }
     if (errno != ENOENT) return STATUS_FAILED;
     value = kAbsentBlobCheckValue;

@@ -41,7 +41,7 @@ struct CopyDirectory {
     // The check value of the data file (check_value.h), once the file is
     // on the medium (fsync); a missing file, or a missing directory, holds
     // an absent blob. STATUS_FAILED when it cannot be computed or synced.
-    [[nodiscard]] Status syncAndComputeCheck(uint64_t& value) const;
+    [[nodiscard]] Status computeCheckAndSync(uint64_t& value) const;
     // The modification time of the check file; unknown unless it is a
     // regular file.
     CheckTime checkTime() const;

@@ -178,7 +178,7 @@ Status DualFileTarget::Slot::commit(unsigned index, SlotDirectories& directories
     Copy& copy = copies_[index];
     const CopyDirectory directory = directories.open(index);
     uint64_t value = 0;
-    if (directory.syncAndComputeCheck(value) != STATUS_OK) return STATUS_FAILED;
+    if (directory.computeCheckAndSync(value) != STATUS_OK) return STATUS_FAILED;
 
     {
         const UniqueFd tmp = directory.open(kTransientName, O_WRONLY | O_CREAT | O_TRUNC, kFileMode);

@@ -45,6 +45,9 @@ int floorCommit(const FloorCopy& copy, const uint8_t* data, size_t size) {
         const Fd file(::open(copy.data.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, kFileMode));
         if (file.get() < 0) return errno;
         if (const int error = writeAll(file.get(), data, size)) return error;
+        // On disk before its check file can be: a check file that lands
+        // as zeros would otherwise validate an empty data file.
+        if (::fsync(file.get()) != 0) return errno;
     }
     const Fd tmp(::open(copy.tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, kFileMode));
     if (tmp.get() < 0) return errno;

@@ -1,5 +1,5 @@
 // The floor of a one-shot write: the system calls of the dual-file store's
-// commit and nothing else. The data file is truncated and written, an
+// commit and nothing else. The data file is truncated, written and synced, an
 // 8-byte check file is written under a temporary name and renamed over the
 // check file, and the file system is synced. No checksum is computed (the
 // check file holds the size only), nothing is read back, validated or
@@ -24,8 +24,8 @@ struct FloorCopy {
     std::string tmp;
 };
 
-// Writes `size` bytes at `data` as `copy` with eight system calls: open,
-// write, close (the data file), open, write, rename, syncfs, close (the
+// Writes `size` bytes at `data` as `copy` with nine system calls: open,
+// write, fsync, close (the data file), open, write, rename, syncfs, close (the
 // check file). Returns 0, or the errno of the first call that failed (EIO
 // for a short write).
 int floorCommit(const FloorCopy& copy, const uint8_t* data, size_t size);

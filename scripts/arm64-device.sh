@@ -6,11 +6,12 @@
 #   arm64-device.sh shell            boot it with a shell on this terminal
 #   arm64-device.sh power-cuts N [SEED]
 #                                    cut its power N times at random moments (see power_cuts.py)
-#   arm64-device.sh replay [--quick|--sample|--clock=CLOCK] [FS...]
+#   arm64-device.sh replay [--quick|--sample|--clock=CLOCK [--slots=N]] [FS...]
 #                                    record every block write of the crash scenarios and check
 #                                    every crash point of the log (tests/device/arm64/replay.sh);
-#                                    --clock: the whole matrix under one clock only; FS: only
-#                                    these file systems (ext4, ext4-journal, ext4-writeback, f2fs)
+#                                    --clock: the whole matrix under one clock only; --slots: of
+#                                    that, the stores of N (1 or 3) slots only; FS: only these
+#                                    file systems (ext4, ext4-journal, ext4-writeback, f2fs)
 # test, shell, power-cuts and replay build first (again only what changed). Exit
 # status: 0 when everything passed; 1 otherwise (a failed test, a boot that
 # did not reach its end in time, a violation).
@@ -25,7 +26,7 @@ card=$out/card.img
 assembled=$out/guest-assembled
 
 usage() {
-  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED] | replay [--quick|--sample|--clock=CLOCK] [FS...]" >&2
+  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED] | replay [--quick|--sample|--clock=CLOCK [--slots=N]] [FS...]" >&2
   exit 2
 }
 
@@ -124,7 +125,7 @@ run_tests() {
 }
 
 # The replay's set: quick (a few minutes), sample (a quarter of an hour),
-# full (some five hours) or a third of it, full-CLOCK.
+# full (many hours), a third of it, full-CLOCK, or a sixth, full-CLOCK-Nslot.
 run_replay() {
   local set=$1 limit=$2 file_systems
   shift 2
@@ -169,18 +170,21 @@ case ${1:-} in
     ;;
   replay)
     mkdir -p "$out"
-    set_option=${2:-}
-    case $set_option in --*) shift 2 ;; *) shift 1 ;; esac
+    shift
+    set_name=full limit=43200
+    case ${1:-} in
+      --quick) set_name=quick limit=900 && shift ;;
+      --sample) set_name=sample limit=7200 && shift ;;
+      --clock=forward | --clock=equal | --clock=backward)
+        set_name=full-${1#--clock=} limit=14400 && shift
+        case ${1:-} in --slots=1 | --slots=3) set_name+=-${1#--slots=}slot limit=7200 && shift ;; esac
+        ;;
+      --*) usage ;;
+    esac
     for file_system in "$@"; do
       case $file_system in ext4 | ext4-journal | ext4-writeback | f2fs) ;; *) usage ;; esac
     done
-    case $set_option in
-      --quick) run_replay quick 900 "$@" ;;
-      --sample) run_replay sample 7200 "$@" ;;
-      --clock=forward | --clock=equal | --clock=backward) run_replay "full-${set_option#--clock=}" 14400 "$@" ;;
-      --*) usage ;;
-      *) run_replay full 43200 "$@" ;;
-    esac
+    run_replay "$set_name" "$limit" "$@"
     ;;
   *) usage ;;
 esac

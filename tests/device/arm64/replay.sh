@@ -11,6 +11,8 @@
 #   replay.sh full-CLOCK
 #                     the same, under one clock (forward, equal or backward):
 #                     a third of it
+#   replay.sh full-CLOCK-Nslot
+#                     of that, the stores of N (1 or 3) slots: a sixth
 #   replay.sh SET:FS,FS...
 #                     a set on these file systems only
 #
@@ -44,11 +46,19 @@ case $set_name in
         choice=(--slots=1,3 --clocks=forward --subsets=20 --torn=4)
         scenarios=(WBA BAE AEW EWB)
         ;;
-    full | full-forward | full-equal | full-backward)
+    full | full-forward | full-equal | full-backward | full-*-[13]slot)
         file_systems="ext4 ext4-journal ext4-writeback f2fs"
         broken_file_systems=$file_systems
         choice=(--subsets=20 --torn=4)
-        [ "$set_name" = full ] || choice+=("--clocks=${set_name#full-}")
+        part=${set_name#full}
+        case $part in
+            *slot)
+                slots=${part##*-}
+                choice+=("--slots=${slots%slot}")
+                part=${part%-*}
+                ;;
+        esac
+        [ -z "$part" ] || choice+=("--clocks=${part#-}")
         scenarios=()
         ;;
     *)

@@ -171,12 +171,12 @@ case ${1:-} in
   replay)
     mkdir -p "$out"
     shift
-    set_name=full limit=43200
+    set_name=full limit=86400
     case ${1:-} in
       --quick) set_name=quick limit=900 && shift ;;
       --sample) set_name=sample limit=7200 && shift ;;
       --clock=forward | --clock=equal | --clock=backward)
-        set_name=full-${1#--clock=} limit=14400 && shift
+        set_name=full-${1#--clock=} limit=28800 && shift
         case ${1:-} in --slots=1 | --slots=3) set_name+=-${1#--slots=}slot limit=7200 && shift ;; esac
         ;;
       --*) usage ;;

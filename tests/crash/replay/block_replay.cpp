@@ -5,7 +5,8 @@
 // device as the cut left it, mounted (the file system's own recovery, and
 // the boot's repair when the mount refuses), and a fresh store opened on it
 // twice. The tree each point shows is also checked against the crash model
-// of tests/crash for the runs' recorded operations.
+// of tests/crash for the runs' recorded operations; a tree with a file that
+// the file system refuses to read is outside it.
 //
 //   block_replay FS DATA LOG ORIGIN COWS WORK [options] [UPDATES...]
 //     FS      ext4 | ext4-journal | ext4-writeback | f2fs
@@ -298,6 +299,9 @@ struct Observation {
     std::string problem;  // the mount or the store failed
     bool unmountable = false;
     bool repaired = false;
+    // Why the tree could not be read (a file the file system itself
+    // refuses, such as a torn inode); the store is still opened on it.
+    std::string unreadableTree;
     crash::FsImage tree;
     std::vector<SlotContent> first;
     std::vector<SlotContent> second;
@@ -322,9 +326,13 @@ Observation observeDevice(const Options& options, const fs::path& device, const 
         }
         observation.repaired = true;
     }
+    const fs::path root = mountPoint / "store";
     try {
-        const fs::path root = mountPoint / "store";
         observation.tree = crash::snapshotTree(root);
+    } catch (const std::exception& error) {
+        observation.unreadableTree = error.what();
+    }
+    try {
         observation.first = openStore(root / storeDirectory, slotCount);
         observation.second = openStore(root / storeDirectory, slotCount);
     } catch (const std::exception& error) {
@@ -397,7 +405,7 @@ void explore(const Options& options, const std::string& updates, size_t slotCoun
         if (known == seen.end()) {
             known = seen.emplace(key, observe(options, devices, recording, overlay, slotCount)).first;
             if (known->second.repaired) ++totals.repaired;
-            if (known->second.problem.empty()) {
+            if (known->second.problem.empty() && known->second.unreadableTree.empty()) {
                 totals.states.insert(std::to_string(slotCount) + "\n" + replay::visibleState(known->second.tree));
             }
         }
@@ -425,7 +433,12 @@ void explore(const Options& options, const std::string& updates, size_t slotCoun
             ++violations;
             report(reports.violations, name + ": " + point.describe() + ": " + problem);
         }
-        if (observation.problem.empty() && !model.allows(observation.tree, expected.firstCut, expected.lastCut)) {
+        if (!observation.problem.empty()) continue;
+        // The model has no file that cannot be read.
+        if (!observation.unreadableTree.empty()) {
+            ++outside;
+            report(reports.outsideModel, name + ": " + point.describe() + ": " + observation.unreadableTree);
+        } else if (!model.allows(observation.tree, expected.firstCut, expected.lastCut)) {
             ++outside;
             report(reports.outsideModel,
                    name + ": " + point.describe() + ": operations " + std::to_string(expected.firstCut) + ".." +

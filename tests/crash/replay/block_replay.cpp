@@ -5,8 +5,9 @@
 // device as the cut left it, mounted (the file system's own recovery, and
 // the boot's repair when the mount refuses), and a fresh store opened on it
 // twice. The tree each point shows is also checked against the crash model
-// of tests/crash for the runs' recorded operations; a tree with a file that
-// the file system refuses to read is outside it.
+// of tests/crash for the runs' recorded operations, but for the sectors of
+// a torn write; a tree with a file that the file system refuses to read is
+// outside it.
 //
 //   block_replay FS DATA LOG ORIGIN COWS WORK [options] [UPDATES...]
 //     FS      ext4 | ext4-journal | ext4-writeback | f2fs
@@ -438,7 +439,10 @@ void explore(const Options& options, const std::string& updates, size_t slotCoun
         if (!observation.unreadableTree.empty()) {
             ++outside;
             report(reports.outsideModel, name + ": " + point.describe() + ": " + observation.unreadableTree);
-        } else if (!model.allows(observation.tree, expected.firstCut, expected.lastCut)) {
+        } else if (!model.allows(observation.tree, expected.firstCut, expected.lastCut) &&
+                   !(point.kind == replay::CrashKind::kTorn &&
+                     model.allowsTornWrite(observation.tree, expected.firstCut, expected.lastCut,
+                                           recording.log.entries[point.torn].sectorCount * recording.log.sectorSize))) {
             ++outside;
             report(reports.outsideModel,
                    name + ": " + point.describe() + ": operations " + std::to_string(expected.firstCut) + ".." +

@@ -16,9 +16,11 @@ bool endsWith(const std::string& text, std::string_view suffix) {
 
 bool sameTime(const timespec& a, const timespec& b) { return a.tv_sec == b.tv_sec && a.tv_nsec == b.tv_nsec; }
 
-}  // namespace
+constexpr size_t kSectorBytes = 512;
 
-std::string visibleState(const crash::FsImage& image) {
+// The directories, names, sizes and check-file order of `image`, with a
+// hash of every file's bytes or without.
+std::string stateKey(const crash::FsImage& image, bool withBytes) {
     std::string key;
     for (const std::string& directory : image.directories) key += "d " + directory + '\n';
     struct Check {
@@ -29,8 +31,9 @@ std::string visibleState(const crash::FsImage& image) {
     for (const auto& [name, inode] : image.names) {
         const crash::FileNode& file = image.files.at(inode);
         const std::string_view data(reinterpret_cast<const char*>(file.data.data()), file.data.size());
-        key += "f " + name + ' ' + std::to_string(file.data.size()) + ' ' +
-               std::to_string(std::hash<std::string_view>{}(data)) + '\n';
+        key += "f " + name + ' ' + std::to_string(file.data.size());
+        if (withBytes) key += ' ' + std::to_string(std::hash<std::string_view>{}(data));
+        key += '\n';
         if (endsWith(name, ".chk")) checks.push_back(Check{file.mtime, &name});
     }
     // The store picks among copies by which check file is newer, so the
@@ -46,11 +49,50 @@ std::string visibleState(const crash::FsImage& image) {
     return key + '\n';
 }
 
+// The bytes from the first sector in which two equally long files differ
+// to the end of the last; 0 when they do not differ.
+size_t differingSpan(const crash::Bytes& a, const crash::Bytes& b) {
+    const size_t first = static_cast<size_t>(std::mismatch(a.begin(), a.end(), b.begin()).first - a.begin());
+    if (first == a.size()) return 0;
+    size_t last = a.size();
+    while (a[last - 1] == b[last - 1]) --last;
+    const size_t begin = first / kSectorBytes * kSectorBytes;
+    const size_t end = (last + kSectorBytes - 1) / kSectorBytes * kSectorBytes;
+    return end - begin;
+}
+
+// Whether `real` is `state` but for one file's bytes within `tornBytes`.
+bool tornFrom(const crash::FsImage& real, const crash::FsImage& state, size_t tornBytes) {
+    if (stateKey(real, false) != stateKey(state, false)) return false;
+    size_t tornFiles = 0;
+    for (const auto& [name, inode] : real.names) {
+        const size_t span = differingSpan(real.files.at(inode).data, state.files.at(state.names.at(name)).data);
+        if (span == 0) continue;
+        if (++tornFiles > 1 || span > tornBytes) return false;
+    }
+    return true;
+}
+
+}  // namespace
+
+std::string visibleState(const crash::FsImage& image) { return stateKey(image, true); }
+
 ModelStates::ModelStates(crash::FsImage durable, std::vector<crash::FsOp> ops)
     : durable_(std::move(durable)), ops_(std::move(ops)) {}
 
 bool ModelStates::allows(const crash::FsImage& real, size_t firstCut, size_t lastCut) {
     return keysOf(firstCut, lastCut).count(visibleState(real)) != 0;
+}
+
+bool ModelStates::allowsTornWrite(const crash::FsImage& real, size_t firstCut, size_t lastCut, size_t tornBytes) {
+    keysOf(firstCut, lastCut);  // the window's bounds are checked there
+    bool allowed = false;
+    for (size_t cut = firstCut; cut <= lastCut && !allowed; ++cut) {
+        crash::forEachCrashState(durable_, ops_, cut, crash::MetadataOrder::kInOrder, [&](const crash::FsImage& state) {
+            allowed = allowed || tornFrom(real, state, tornBytes);
+        });
+    }
+    return allowed;
 }
 
 size_t ModelStates::stateCount(size_t firstCut, size_t lastCut) { return keysOf(firstCut, lastCut).size(); }

@@ -38,6 +38,13 @@ public:
     // `firstCut` is after `lastCut` or `lastCut` past the record.
     bool allows(const crash::FsImage& real, size_t firstCut, size_t lastCut);
 
+    // Whether `real` is a state the model allows in that window but for the
+    // bytes of one file within one span of `tornBytes`, counted in whole
+    // 512-byte sectors: what one device write that the cut tore leaves in
+    // a file's data. The model writes whole blocks; the torn sectors may
+    // hold anything (old, new, zeros, 0xFF or earlier contents).
+    bool allowsTornWrite(const crash::FsImage& real, size_t firstCut, size_t lastCut, size_t tornBytes);
+
     // The number of states of the window that the store can tell apart.
     size_t stateCount(size_t firstCut, size_t lastCut);
 

@@ -2,6 +2,7 @@
 // records made by hand.
 #include "model_states.h"
 
+#include <algorithm>
 #include <stdexcept>
 #include <string>
 #include <vector>
@@ -168,6 +169,36 @@ TEST(ModelStates, RefusesAWindowOutsideTheRecord) {
     ModelStates model(FsImage{}, kCommit);
     EXPECT_THROW(model.allows(FsImage{}, 0, kCommit.size() + 1), std::out_of_range);
     EXPECT_THROW(model.stateCount(2, 1), std::out_of_range);
+    EXPECT_THROW(model.allowsTornWrite(FsImage{}, 0, kCommit.size() + 1, 4096), std::out_of_range);
+}
+
+// As the device showed it: a write over a data file's blocks torn at the
+// cut, its sectors zeros, 0xFF, new or old, beside the check file.
+TEST(ModelStates, AllowsOneTornWriteWithinItsSpanOnly) {
+    FsImage durable;
+    putFile(durable, "2/data", 3, std::string(5307, 'o'), {1, 0});
+    putFile(durable, "2/data.chk", 4, "check", {1, 0});
+    ModelStates model(durable, {});
+    FsImage torn = durable;
+    crash::Bytes& data = torn.files.at(3).data;
+    std::fill(data.begin() + 512, data.begin() + 1024, 0);
+    std::fill(data.begin() + 2048, data.begin() + 2560, 0xFF);
+    data[4100] = 'n';  // sectors 1 to 8: 4096 bytes
+    EXPECT_FALSE(model.allows(torn, 0, 0));
+    EXPECT_TRUE(model.allowsTornWrite(torn, 0, 0, 8192));
+    EXPECT_TRUE(model.allowsTornWrite(torn, 0, 0, 4096));
+    EXPECT_FALSE(model.allowsTornWrite(torn, 0, 0, 3584));
+
+    FsImage twoFiles = torn;
+    twoFiles.files.at(4).data[0] = 'C';
+    EXPECT_FALSE(model.allowsTornWrite(twoFiles, 0, 0, 8192)) << "one write, two files";
+    FsImage longer = torn;
+    longer.files.at(3).data.push_back('o');
+    EXPECT_FALSE(model.allowsTornWrite(longer, 0, 0, 8192)) << "a size the model has not";
+    FsImage renamed = torn;
+    renamed.dropName("2/data.chk");
+    putFile(renamed, "2/data.chk.tmp", 4, "check", {1, 0});
+    EXPECT_FALSE(model.allowsTornWrite(renamed, 0, 0, 8192)) << "a name the model has not";
 }
 
 }  // namespace

@@ -6,11 +6,12 @@
 #   arm64-device.sh shell            boot it with a shell on this terminal
 #   arm64-device.sh power-cuts N [SEED]
 #                                    cut its power N times at random moments (see power_cuts.py)
-#   arm64-device.sh replay [--quick|--sample|--clock=CLOCK [--slots=N]] [FS...]
+#   arm64-device.sh replay [--quick|--sample|--clock=CLOCK [--slots=N] [--scenarios=S,S...]] [FS...]
 #                                    record every block write of the crash scenarios and check
 #                                    every crash point of the log (tests/device/arm64/replay.sh);
 #                                    --clock: the whole matrix under one clock only; --slots: of
-#                                    that, the stores of N (1 or 3) slots only; FS: only these
+#                                    that, the stores of N (1 or 3) slots only; --scenarios: of
+#                                    that, these scenarios only (e.g. WEA,TTT); FS: only these
 #                                    file systems (ext4, ext4-journal, ext4-writeback, f2fs)
 # test, shell, power-cuts and replay build first (again only what changed). Exit
 # status: 0 when everything passed; 1 otherwise (a failed test, a boot that
@@ -26,7 +27,7 @@ card=$out/card.img
 assembled=$out/guest-assembled
 
 usage() {
-  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED] | replay [--quick|--sample|--clock=CLOCK [--slots=N]] [FS...]" >&2
+  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED] | replay [--quick|--sample|--clock=CLOCK [--slots=N] [--scenarios=S,...]] [FS...]" >&2
   exit 2
 }
 
@@ -125,7 +126,8 @@ run_tests() {
 }
 
 # The replay's set: quick (a few minutes), sample (a quarter of an hour),
-# full (many hours), a third of it, full-CLOCK, or a sixth, full-CLOCK-Nslot.
+# full (many hours), a third of it, full-CLOCK, or a sixth, full-CLOCK-Nslot;
+# with $scenarios, of a part, only those.
 run_replay() {
   local set=$1 limit=$2 file_systems
   shift 2
@@ -134,9 +136,10 @@ run_replay() {
     echo "$*"
   )
   build
-  local log=$out/replay-$set${file_systems:+-${file_systems//,/-}}-console.log work=$out/replay-card.img start=$SECONDS
+  local log=$out/replay-$set${file_systems:+-${file_systems//,/-}}${scenarios:+-${scenarios//,/-}}-console.log
+  local work=$out/replay-card.img start=$SECONDS
   fresh_card "$work"
-  boot "replay arm64_replay=$set${file_systems:+:$file_systems}" "$limit" "$work" </dev/null | sed -u 's/\r$//' | tee "$log" |
+  boot "replay arm64_replay=$set:$file_systems${scenarios:+:$scenarios}" "$limit" "$work" </dev/null | sed -u 's/\r$//' | tee "$log" |
     grep --line-buffered -E '^(@@ (replay |broken writer |violation|outside the model|[a-z0-9-]+: [0-9]+ (after|devices))|arm64-device:)' || true
   rm -f "$work"
   echo "=== arm64-device replay $set: $((SECONDS - start)) s"
@@ -171,13 +174,14 @@ case ${1:-} in
   replay)
     mkdir -p "$out"
     shift
-    set_name=full limit=86400
+    set_name=full limit=86400 scenarios=
     case ${1:-} in
       --quick) set_name=quick limit=900 && shift ;;
       --sample) set_name=sample limit=7200 && shift ;;
       --clock=forward | --clock=equal | --clock=backward)
         set_name=full-${1#--clock=} limit=28800 && shift
         case ${1:-} in --slots=1 | --slots=3) set_name+=-${1#--slots=}slot limit=7200 && shift ;; esac
+        case ${1:-} in --scenarios=*) scenarios=${1#--scenarios=} && shift ;; esac
         ;;
       --*) usage ;;
     esac

@@ -13,8 +13,9 @@
 #                     a third of it
 #   replay.sh full-CLOCK-Nslot
 #                     of that, the stores of N (1 or 3) slots: a sixth
-#   replay.sh SET:FS,FS...
-#                     a set on these file systems only
+#   replay.sh SET:FS,FS...[:SCENARIO,SCENARIO...]
+#                     a set on these file systems only (none named: all of
+#                     the set's), and of its scenarios only these
 #
 # The card has no volatile cache: the kernel drops every flush before it
 # reaches a device stacked on it. The file system therefore lives on a
@@ -25,9 +26,15 @@ set -u
 replay=$build_dir/tests/crash/replay/block_replay
 set_name=${1:-quick}
 chosen_file_systems=
+chosen_scenarios=
 case $set_name in *:*)
     chosen_file_systems=${set_name#*:}
     set_name=${set_name%%:*}
+    ;;
+esac
+case $chosen_file_systems in *:*)
+    chosen_scenarios=${chosen_file_systems#*:}
+    chosen_file_systems=${chosen_file_systems%%:*}
     ;;
 esac
 work=/tmp/replay
@@ -70,6 +77,7 @@ if [ -n "$chosen_file_systems" ]; then
     file_systems=${chosen_file_systems//,/ }
     broken_file_systems=$file_systems
 fi
+[ -z "$chosen_scenarios" ] || read -ra scenarios <<<"${chosen_scenarios//,/ }"
 
 # Five loop devices for one file system, made one after the other (two
 # searches for a free device at once may find the same): its data, the

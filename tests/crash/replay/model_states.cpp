@@ -61,9 +61,9 @@ size_t differingSpan(const crash::Bytes& a, const crash::Bytes& b) {
     return end - begin;
 }
 
-// Whether `real` is `state` but for one file's bytes within `tornBytes`.
+// Whether `real`, of the same names and sizes as `state`, is `state` but
+// for one file's bytes within `tornBytes`.
 bool tornFrom(const crash::FsImage& real, const crash::FsImage& state, size_t tornBytes) {
-    if (stateKey(real, false) != stateKey(state, false)) return false;
     size_t tornFiles = 0;
     for (const auto& [name, inode] : real.names) {
         const size_t span = differingSpan(real.files.at(inode).data, state.files.at(state.names.at(name)).data);
@@ -81,23 +81,17 @@ ModelStates::ModelStates(crash::FsImage durable, std::vector<crash::FsOp> ops)
     : durable_(std::move(durable)), ops_(std::move(ops)) {}
 
 bool ModelStates::allows(const crash::FsImage& real, size_t firstCut, size_t lastCut) {
-    return keysOf(firstCut, lastCut).count(visibleState(real)) != 0;
+    return windowOf(firstCut, lastCut).keys.count(visibleState(real)) != 0;
 }
 
 bool ModelStates::allowsTornWrite(const crash::FsImage& real, size_t firstCut, size_t lastCut, size_t tornBytes) {
-    keysOf(firstCut, lastCut);  // the window's bounds are checked there
-    bool allowed = false;
-    for (size_t cut = firstCut; cut <= lastCut && !allowed; ++cut) {
-        crash::forEachCrashState(durable_, ops_, cut, crash::MetadataOrder::kInOrder, [&](const crash::FsImage& state) {
-            allowed = allowed || tornFrom(real, state, tornBytes);
-        });
-    }
-    return allowed;
+    const auto [first, end] = windowOf(firstCut, lastCut).byShape.equal_range(stateKey(real, false));
+    return std::any_of(first, end, [&](const auto& entry) { return tornFrom(real, entry.second, tornBytes); });
 }
 
-size_t ModelStates::stateCount(size_t firstCut, size_t lastCut) { return keysOf(firstCut, lastCut).size(); }
+size_t ModelStates::stateCount(size_t firstCut, size_t lastCut) { return windowOf(firstCut, lastCut).keys.size(); }
 
-const std::set<std::string>& ModelStates::keysOf(size_t firstCut, size_t lastCut) {
+const ModelStates::Window& ModelStates::windowOf(size_t firstCut, size_t lastCut) {
     if (firstCut > lastCut || lastCut > ops_.size()) {
         throw std::out_of_range("no cuts from " + std::to_string(firstCut) + " to " + std::to_string(lastCut) +
                                 " in a record of " + std::to_string(ops_.size()));
@@ -105,12 +99,16 @@ const std::set<std::string>& ModelStates::keysOf(size_t firstCut, size_t lastCut
     const auto window = std::make_pair(firstCut, lastCut);
     const auto known = windows_.find(window);
     if (known != windows_.end()) return known->second;
-    std::set<std::string> keys;
+    Window states;
     for (size_t cut = firstCut; cut <= lastCut; ++cut) {
         crash::forEachCrashState(durable_, ops_, cut, crash::MetadataOrder::kInOrder,
-                                 [&keys](const crash::FsImage& state) { keys.insert(visibleState(state)); });
+                                 [&states](const crash::FsImage& state) {
+                                     if (states.keys.insert(visibleState(state)).second) {
+                                         states.byShape.emplace(stateKey(state, false), state);
+                                     }
+                                 });
     }
-    return windows_.emplace(window, std::move(keys)).first->second;
+    return windows_.emplace(window, std::move(states)).first->second;
 }
 
 }  // namespace replay

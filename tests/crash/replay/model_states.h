@@ -49,12 +49,17 @@ public:
     size_t stateCount(size_t firstCut, size_t lastCut);
 
 private:
-    const std::set<std::string>& keysOf(size_t firstCut, size_t lastCut);
+    struct Window {
+        std::set<std::string> keys;
+        // A state for each key, by its key without the files' bytes.
+        std::multimap<std::string, crash::FsImage> byShape;
+    };
+    const Window& windowOf(size_t firstCut, size_t lastCut);
 
     crash::FsImage durable_;
     std::vector<crash::FsOp> ops_;
     // A replay asks the same windows for every one of its crash points.
-    std::map<std::pair<size_t, size_t>, std::set<std::string>> windows_;
+    std::map<std::pair<size_t, size_t>, Window> windows_;
 };
 
 }  // namespace replay

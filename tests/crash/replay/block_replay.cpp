@@ -391,7 +391,7 @@ void explore(const Options& options, const std::string& updates, size_t slotCoun
              Reports& reports) {
     const Recording recording = record(options, updates, slotCount, clock);
     testing_support::writeBytes(options.origin, recording.base);
-    replay::PointDevices devices(options.pointTarget, options.origin, options.cows, recording.base.size() / 512);
+    replay::PointDevices devices(options.pointTarget, options.origin, recording.base, options.cows);
     const std::vector<replay::CrashPoint> points = replay::crashPoints(recording.log, options.choice);
     replay::ModelStates model(recording.durable, recording.ops);
     const std::string name = options.fileSystem->name + " " + scenarioName(updates, slotCount, clock);

@@ -3,8 +3,11 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
+#include <new>
 #include <stdexcept>
 #include <system_error>
 
@@ -14,29 +17,37 @@ namespace fs = std::filesystem;
 
 namespace {
 
-void writeOverlay(const fs::path& node, const SectorOverlay& overlay, uint32_t sectorSize) {
-    const int fd = ::open(node.c_str(), O_WRONLY | O_CLOEXEC);
+// The snapshots' chunk.
+constexpr size_t kChunkBytes = 4096;
+
+// Whole chunks, straight to the device: a cached partial page would be read
+// before it is written, a round trip to the origin for every page.
+void writeRuns(const fs::path& node, const std::vector<PageRun>& runs) {
+    size_t largest = 0;
+    for (const PageRun& run : runs) largest = std::max(largest, run.bytes.size());
+    if (largest == 0) return;
+    void* memory = nullptr;
+    if (::posix_memalign(&memory, kChunkBytes, largest) != 0) throw std::bad_alloc();
+    const std::unique_ptr<void, decltype(&std::free)> buffer(memory, &std::free);
+    const int fd = ::open(node.c_str(), O_WRONLY | O_DIRECT | O_CLOEXEC);
     if (fd < 0) throw std::system_error(errno, std::generic_category(), "open " + node.string());
-    for (const auto& [sector, bytes] : overlay) {
-        if (::pwrite(fd, bytes.data(), bytes.size(), static_cast<off_t>(sector * sectorSize)) !=
-            static_cast<ssize_t>(bytes.size())) {
+    for (const PageRun& run : runs) {
+        std::memcpy(memory, run.bytes.data(), run.bytes.size());
+        if (::pwrite(fd, memory, run.bytes.size(), static_cast<off_t>(run.offset)) !=
+            static_cast<ssize_t>(run.bytes.size())) {
             const int error = errno;
             ::close(fd);
             throw std::system_error(error, std::generic_category(), "write " + node.string());
         }
     }
-    // Closing the last descriptor writes the device's cache back and drops it.
-    const bool synced = ::fsync(fd) == 0;
-    const int error = errno;
     ::close(fd);
-    if (!synced) throw std::system_error(error, std::generic_category(), "fsync " + node.string());
 }
 
 }  // namespace
 
-PointDevices::PointDevices(const std::string& prefix, const fs::path& origin, const std::vector<fs::path>& cows,
-                           uint64_t sectors)
-    : prefix_(prefix), origin_(origin), cows_(cows), sectors_(sectors), remover_([this] { removeReleased(); }) {
+PointDevices::PointDevices(const std::string& prefix, const fs::path& origin, const std::vector<uint8_t>& base,
+                           const std::vector<fs::path>& cows)
+    : prefix_(prefix), origin_(origin), base_(base), cows_(cows), remover_([this] { removeReleased(); }) {
     if (cows_.empty()) throw std::invalid_argument("point devices need a cow device");
 }
 
@@ -60,9 +71,10 @@ std::unique_ptr<MappedDevice> PointDevices::make(const SectorOverlay& overlay, u
     }
     // Non-persistent: the exceptions live in memory, so a cow device is
     // reused as it is.
-    auto device = std::make_unique<MappedDevice>(prefix_ + "-" + std::to_string(made_++), sectors_,
-                                                 "snapshot " + origin_.string() + " " + cow.string() + " N 8");
-    writeOverlay(device->node(), overlay, sectorSize);
+    auto device = std::make_unique<MappedDevice>(
+        prefix_ + "-" + std::to_string(made_++), base_.size() / 512,
+        "snapshot " + origin_.string() + " " + cow.string() + " N " + std::to_string(kChunkBytes / 512));
+    writeRuns(device->node(), pageRuns(overlay, sectorSize, base_, kChunkBytes));
     return device;
 }
 

@@ -17,15 +17,17 @@
 
 #include "crash_points.h"
 #include "mapped_device.h"
+#include "page_runs.h"
 
 namespace replay {
 
 class PointDevices {
 public:
-    // Snapshots of `origin` (`sectors` 512-byte sectors) named `prefix`-N,
-    // whose changes go to each of `cows` in turn (each at least as large).
-    PointDevices(const std::string& prefix, const std::filesystem::path& origin,
-                 const std::vector<std::filesystem::path>& cows, uint64_t sectors);
+    // Snapshots of `origin`, which holds `base` (kept by reference), named
+    // `prefix`-N, whose changes go to each of `cows` in turn (each at least
+    // as large).
+    PointDevices(const std::string& prefix, const std::filesystem::path& origin, const std::vector<uint8_t>& base,
+                 const std::vector<std::filesystem::path>& cows);
     // Waits until every device is removed.
     ~PointDevices();
     PointDevices(const PointDevices&) = delete;
@@ -43,8 +45,8 @@ private:
 
     std::string prefix_;
     std::filesystem::path origin_;
+    const std::vector<uint8_t>& base_;
     std::vector<std::filesystem::path> cows_;
-    uint64_t sectors_;
     size_t made_ = 0;
 
     std::mutex mutex_;

@@ -37,6 +37,8 @@ RUNTIME_PACKAGES = ["libc6", "libstdc++6", "libgcc-s1"]
 
 # The kernel's modules the guest loads, with what they need (modules.dep).
 MODULES = ["sdhci-pci", "ext4", "crc32c_generic", "crc32_generic", "loop", "dm-mod", "dm-log-writes", "dm-snapshot", "f2fs", "vfat"]
+# Modules a mode loads itself, with parameters of its own: the replay's RAM disks.
+MODULES_ON_DEMAND = ["brd"]
 
 
 def run(*args, **kwargs):
@@ -155,7 +157,7 @@ def add_modules(unpacked, root, version):
         dependencies[module] = needs.split()
     by_name = {Path(m).name.split(".ko")[0].replace("_", "-"): m for m in dependencies}
     wanted = []
-    for name in MODULES:
+    for name in MODULES + MODULES_ON_DEMAND:
         module = by_name.get(name.replace("_", "-"))
         if module is None:
             sys.exit(f"assemble_guest: no module {name} in {version}")

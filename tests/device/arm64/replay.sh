@@ -20,7 +20,7 @@
 # The card has no volatile cache: the kernel drops every flush before it
 # reaches a device stacked on it. The file system therefore lives on a
 # loop device, which has a write-back cache as the device's eMMC does;
-# its file, the log's and the replay's own are in memory.
+# its file and the log's are in memory, the replay's own devices RAM disks.
 set -u
 . /etc/arm64-device.conf
 replay=$build_dir/tests/crash/replay/block_replay
@@ -79,19 +79,22 @@ if [ -n "$chosen_file_systems" ]; then
 fi
 [ -z "$chosen_scenarios" ] || read -ra scenarios <<<"${chosen_scenarios//,/ }"
 
-# Five loop devices for one file system, made one after the other (two
-# searches for a free device at once may find the same): its data, the
-# log, the device as the log started and two for the changes of the crash
-# points' devices, in turn. Their names go to $work/NAME.devices.
+# The devices of one file system, the NUMBER-th of a pair (0 or 1): its
+# data and the log on loop devices (made one after the other: two searches
+# for a free device at once may find the same), the device as the log
+# started and two for the changes of the crash points' devices, in turn,
+# on RAM disks, which answer at once where a loop device hands every
+# request to a thread. Their names go to $work/NAME.devices.
 make_devices() {
-    local name=$1 role size
+    local name=$1 number=$2 role size disk
     : >"$work/$name.devices"
-    for role in data:64M log:512M origin:64M cow:64M cow2:64M; do
+    for role in data:64M log:512M; do
         size=${role#*:}
         role=${role%%:*}
         truncate -s "$size" "$work/$name.$role"
         losetup -f --show "$work/$name.$role" >>"$work/$name.devices"
     done
+    for disk in 0 1 2; do echo "/dev/ram$((number * 3 + disk))" >>"$work/$name.devices"; done
 }
 
 run_one() {
@@ -106,22 +109,30 @@ run_one() {
 
 free_devices() {
     local name=$1 device
-    while read -r device; do losetup -d "$device"; done <"$work/$name.devices"
+    while read -r device; do
+        case $device in /dev/loop*) losetup -d "$device" ;; esac
+    done <"$work/$name.devices"
     rm -rf "$work/$name" "$work/$name".*
 }
 
+# Six RAM disks as large as the data device: three for each of a pair.
+modprobe brd rd_nr=6 rd_size=65536 || echo "@@ replay: cannot load brd"
 start=$SECONDS
 set -- $file_systems
 while [ $# -gt 0 ]; do
     pair="$1 ${2:-}"
-    for name in $pair; do make_devices "$name"; done
+    number=0
+    for name in $pair; do
+        make_devices "$name" $number
+        number=$((number + 1))
+    done
     for name in $pair; do run_one "$name" "${choice[@]}" "${scenarios[@]}" & done
     wait
     for name in $pair; do free_devices "$name"; done
     shift $(($# > 1 ? 2 : 1))
 done
 for name in $broken_file_systems; do
-    make_devices "$name"
+    make_devices "$name" 0
     run_one "$name" --broken "${choice[@]}"
     free_devices "$name"
 done

@@ -14,9 +14,8 @@
 //     DATA    the block device the file system lives on (all of it is used)
 //     LOG     the block device the log is written to
 //     ORIGIN  a block device as large as DATA, for the device as the log started
-//     COWS    block devices as large as DATA, comma-separated, for the
-//             points' changes in turn: with two, a point's device is removed
-//             while the next one is checked
+//     COWS    two block devices as large as DATA, comma-separated, for the
+//             points' changes in turn
 //     WORK    a directory for mount points and the runs' inputs
 //   options:
 //     --slots=1,3                    store sizes
@@ -41,6 +40,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <array>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -117,7 +118,7 @@ struct Options {
     fs::path data;
     fs::path log;
     fs::path origin;
-    std::vector<fs::path> cows;  // for the points' devices in turn
+    std::array<fs::path, 2> cows;  // for the points' snapshots in turn
     fs::path work;
     std::vector<size_t> slotCounts = {1, 3};
     std::vector<Clock> clocks = {Clock::kForward, Clock::kEqual, Clock::kBackward};
@@ -347,12 +348,10 @@ Observation observeDevice(const Options& options, const fs::path& device, const 
     return observation;
 }
 
-Observation observe(const Options& options, replay::PointDevices& devices, const Recording& recording,
+Observation observe(const Options& options, replay::PointDevice& device, const Recording& recording,
                     const replay::SectorOverlay& overlay, size_t slotCount) {
-    std::unique_ptr<replay::MappedDevice> device = devices.make(overlay, recording.log.sectorSize);
-    Observation observation = observeDevice(options, device->node(), recording.storeDirectory, slotCount);
-    devices.release(std::move(device));
-    return observation;
+    device.lay(overlay, recording.log.sectorSize);
+    return observeDevice(options, device.node(), recording.storeDirectory, slotCount);
 }
 
 // The store's rules: every slot holds what was acknowledged or the run in
@@ -395,7 +394,7 @@ void explore(const Options& options, const std::string& updates, size_t slotCoun
              Reports& reports) {
     const Recording recording = record(options, updates, slotCount, clock);
     testing_support::writeBytes(options.origin, recording.base);
-    replay::PointDevices devices(options.pointTarget, options.origin, recording.base, options.cows);
+    replay::PointDevice device(options.pointTarget, options.origin, recording.base, options.cows);
     const std::vector<replay::CrashPoint> points = replay::crashPoints(recording.log, options.choice);
     replay::ModelStates model(recording.durable, recording.ops);
     const std::string name = options.fileSystem->name + " " + scenarioName(updates, slotCount, clock);
@@ -408,7 +407,7 @@ void explore(const Options& options, const std::string& updates, size_t slotCoun
         const size_t key = hashOf(overlay);
         auto known = seen.find(key);
         if (known == seen.end()) {
-            known = seen.emplace(key, observe(options, devices, recording, overlay, slotCount)).first;
+            known = seen.emplace(key, observe(options, device, recording, overlay, slotCount)).first;
             if (known->second.repaired) ++totals.repaired;
             if (known->second.problem.empty() && known->second.unreadableTree.empty()) {
                 totals.states.insert(std::to_string(slotCount) + "\n" + replay::visibleState(known->second.tree));
@@ -524,7 +523,9 @@ Options parse(int argc, char** argv) {
     options.data = positional[1];
     options.log = positional[2];
     options.origin = positional[3];
-    for (const std::string& cow : split(positional[4])) options.cows.emplace_back(cow);
+    const std::vector<std::string> cows = split(positional[4]);
+    if (cows.size() != options.cows.size()) usage("COWS must name two devices");
+    std::copy(cows.begin(), cows.end(), options.cows.begin());
     options.work = positional[5];
     options.scenarios.assign(positional.begin() + 6, positional.end());
     if (options.broken) {

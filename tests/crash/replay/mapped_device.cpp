@@ -79,15 +79,13 @@ int removeDevice(const std::string& name) {
 
 }  // namespace
 
-MappedDevice::MappedDevice(const std::string& name, uint64_t sectors, const std::string& targetLine) : name_(name) {
+MappedDevice::MappedDevice(const std::string& name, uint64_t sectors, const std::string& targetLine)
+    : name_(name), sectors_(sectors) {
     Request create(name);
     create.sendOrThrow(DM_DEV_CREATE, "creating");
     const dev_t device = static_cast<dev_t>(create.header().dev);
     try {
-        loadTable(name, sectors, targetLine);
-        // Resuming makes the loaded table live.
-        Request resume(name);
-        resume.sendOrThrow(DM_DEV_SUSPEND, "resuming");
+        reload(targetLine);
     } catch (...) {
         (void)removeDevice(name);
         throw;
@@ -100,6 +98,14 @@ MappedDevice::~MappedDevice() {
     for (int attempt = 0; attempt < 100 && removeDevice(name_) == EBUSY; ++attempt) {
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
+}
+
+void MappedDevice::reload(const std::string& targetLine) {
+    loadTable(name_, sectors_, targetLine);
+    // Resuming makes the loaded table live, suspending the device for the
+    // swap when it is live already.
+    Request resume(name_);
+    resume.sendOrThrow(DM_DEV_SUSPEND, "resuming");
 }
 
 void MappedDevice::message(const std::string& text) const {

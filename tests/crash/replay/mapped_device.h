@@ -20,6 +20,11 @@ public:
     MappedDevice(const MappedDevice&) = delete;
     MappedDevice& operator=(const MappedDevice&) = delete;
 
+    // Replaces the device's table with `targetLine` over the same sectors;
+    // the old target is destroyed once the new one is live. The device
+    // must not be open. Throws std::system_error when the kernel refuses.
+    void reload(const std::string& targetLine);
+
     // Sends `text` to the target (as "dmsetup message NAME 0 TEXT").
     // Throws std::system_error when the target refuses it.
     void message(const std::string& text) const;
@@ -29,6 +34,7 @@ public:
 
 private:
     std::string name_;
+    uint64_t sectors_;
     std::filesystem::path node_;
 };
 

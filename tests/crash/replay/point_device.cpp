@@ -7,9 +7,11 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
 #include <new>
-#include <stdexcept>
 #include <system_error>
+
+#include "page_runs.h"
 
 namespace replay {
 
@@ -45,61 +47,23 @@ void writeRuns(const fs::path& node, const std::vector<PageRun>& runs) {
 
 }  // namespace
 
-PointDevices::PointDevices(const std::string& prefix, const fs::path& origin, const std::vector<uint8_t>& base,
-                           const std::vector<fs::path>& cows)
-    : prefix_(prefix), origin_(origin), base_(base), cows_(cows), remover_([this] { removeReleased(); }) {
-    if (cows_.empty()) throw std::invalid_argument("point devices need a cow device");
-}
+PointDevice::PointDevice(const std::string& name, const fs::path& origin, const std::vector<uint8_t>& base,
+                         const std::array<fs::path, 2>& cows)
+    : origin_(origin), base_(base), cows_(cows), device_(name, base.size() / 512, snapshotOn(0)) {}
 
-PointDevices::~PointDevices() {
-    {
-        std::lock_guard<std::mutex> lock(mutex_);
-        closing_ = true;
-    }
-    changed_.notify_all();
-    remover_.join();
-}
-
-std::unique_ptr<MappedDevice> PointDevices::make(const SectorOverlay& overlay, uint32_t sectorSize) {
-    const fs::path& cow = cows_[made_ % cows_.size()];
-    {
-        // Two snapshots on one cow device at once would hand the older
-        // one's changes over to the newer: the device that last used this
-        // cow must be gone.
-        std::unique_lock<std::mutex> lock(mutex_);
-        changed_.wait(lock, [this] { return removing_ < cows_.size(); });
-    }
+std::string PointDevice::snapshotOn(size_t cow) const {
     // Non-persistent: the exceptions live in memory, so a cow device is
     // reused as it is.
-    auto device = std::make_unique<MappedDevice>(
-        prefix_ + "-" + std::to_string(made_++), base_.size() / 512,
-        "snapshot " + origin_.string() + " " + cow.string() + " N " + std::to_string(kChunkBytes / 512));
-    writeRuns(device->node(), pageRuns(overlay, sectorSize, base_, kChunkBytes));
-    return device;
+    return "snapshot " + origin_.string() + " " + cows_[cow].string() + " N " + std::to_string(kChunkBytes / 512);
 }
 
-void PointDevices::release(std::unique_ptr<MappedDevice> device) {
-    {
-        std::lock_guard<std::mutex> lock(mutex_);
-        released_.push_back(std::move(device));
-        ++removing_;
-    }
-    changed_.notify_all();
-}
-
-void PointDevices::removeReleased() {
-    std::unique_lock<std::mutex> lock(mutex_);
-    for (;;) {
-        changed_.wait(lock, [this] { return closing_ || !released_.empty(); });
-        if (released_.empty()) return;
-        std::unique_ptr<MappedDevice> device = std::move(released_.front());
-        released_.pop_front();
-        lock.unlock();
-        device.reset();
-        lock.lock();
-        --removing_;
-        changed_.notify_all();
-    }
+void PointDevice::lay(const SectorOverlay& overlay, uint32_t sectorSize) {
+    // A new snapshot on the cow the live one does not use: one on the same
+    // cow would take over the live one's changes. The live one, and what
+    // the last point wrote, goes when the new one replaces it.
+    if (laid_ > 0) device_.reload(snapshotOn(laid_ % cows_.size()));
+    ++laid_;
+    writeRuns(device_.node(), pageRuns(overlay, sectorSize, base_, kChunkBytes));
 }
 
 }  // namespace replay

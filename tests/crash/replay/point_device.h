@@ -1,60 +1,46 @@
-// The devices of a scenario's crash points on a real kernel: each a
-// copy-on-write snapshot of the device as the log started, with the
-// point's sectors laid on top. The file system's recovery and the store
-// may write to it as they like; the origin stays as it was for the next
-// point.
+// The device of a scenario's crash points on a real kernel: a copy-on-write
+// snapshot of the device as the log started, with a point's sectors laid
+// on top. The file system's recovery and the store may write to it as they
+// like; the origin stays as it was, and the next point gets a new snapshot
+// under the same mapped device.
 #pragma once
 
-#include <condition_variable>
+#include <array>
 #include <cstdint>
-#include <deque>
 #include <filesystem>
-#include <memory>
-#include <mutex>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "crash_points.h"
 #include "mapped_device.h"
-#include "page_runs.h"
 
 namespace replay {
 
-class PointDevices {
+class PointDevice {
 public:
-    // Snapshots of `origin`, which holds `base` (kept by reference), named
-    // `prefix`-N, whose changes go to each of `cows` in turn (each at least
-    // as large).
-    PointDevices(const std::string& prefix, const std::filesystem::path& origin, const std::vector<uint8_t>& base,
-                 const std::vector<std::filesystem::path>& cows);
-    // Waits until every device is removed.
-    ~PointDevices();
-    PointDevices(const PointDevices&) = delete;
-    PointDevices& operator=(const PointDevices&) = delete;
+    // The mapped device `name` over `origin`, which holds `base` (kept by
+    // reference). Its snapshots keep their changes on the two `cows` in
+    // turn, each at least as large as `base`. Throws std::system_error when
+    // the kernel refuses.
+    PointDevice(const std::string& name, const std::filesystem::path& origin, const std::vector<uint8_t>& base,
+                const std::array<std::filesystem::path, 2>& cows);
 
-    // A new device with `overlay` written onto it in sectors of
-    // `sectorSize` bytes. Throws std::system_error when the kernel refuses.
-    std::unique_ptr<MappedDevice> make(const SectorOverlay& overlay, uint32_t sectorSize);
-    // Removes `device` on a thread of its own: a removal waits on the
-    // kernel for longer than the checks of a point take.
-    void release(std::unique_ptr<MappedDevice> device);
+    // Makes the device the origin with `overlay` written onto it in sectors
+    // of `sectorSize` bytes, whatever the last point left on it gone. The
+    // device must not be open. Throws std::system_error when the kernel
+    // refuses.
+    void lay(const SectorOverlay& overlay, uint32_t sectorSize);
+
+    const std::filesystem::path& node() const { return device_.node(); }
 
 private:
-    void removeReleased();
+    std::string snapshotOn(size_t cow) const;
 
-    std::string prefix_;
     std::filesystem::path origin_;
     const std::vector<uint8_t>& base_;
-    std::vector<std::filesystem::path> cows_;
-    size_t made_ = 0;
-
-    std::mutex mutex_;
-    std::condition_variable changed_;
-    std::deque<std::unique_ptr<MappedDevice>> released_;
-    size_t removing_ = 0;  // released and not yet removed
-    bool closing_ = false;
-    std::thread remover_;
+    std::array<std::filesystem::path, 2> cows_;
+    MappedDevice device_;
+    size_t laid_ = 0;
 };
 
 }  // namespace replay

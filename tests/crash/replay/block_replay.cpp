@@ -393,7 +393,6 @@ void report(std::vector<std::string>& list, const std::string& text) {
 void explore(const Options& options, const std::string& updates, size_t slotCount, Clock clock, Totals& totals,
              Reports& reports) {
     const Recording recording = record(options, updates, slotCount, clock);
-    testing_support::writeBytes(options.origin, recording.base);
     replay::PointDevice device(options.pointTarget, options.origin, recording.base, options.cows);
     const std::vector<replay::CrashPoint> points = replay::crashPoints(recording.log, options.choice);
     replay::ModelStates model(recording.durable, recording.ops);

@@ -11,6 +11,7 @@
 #include <new>
 #include <system_error>
 
+#include "files.h"
 #include "page_runs.h"
 
 namespace replay {
@@ -45,11 +46,17 @@ void writeRuns(const fs::path& node, const std::vector<PageRun>& runs) {
     ::close(fd);
 }
 
+// The origin as the log started, before any snapshot is made over it.
+const fs::path& filledWith(const fs::path& origin, const std::vector<uint8_t>& base) {
+    testing_support::writeBytes(origin, base);
+    return origin;
+}
+
 }  // namespace
 
 PointDevice::PointDevice(const std::string& name, const fs::path& origin, const std::vector<uint8_t>& base,
                          const std::array<fs::path, 2>& cows)
-    : origin_(origin), base_(base), cows_(cows), device_(name, base.size() / 512, snapshotOn(0)) {}
+    : origin_(filledWith(origin, base)), base_(base), cows_(cows), device_(name, base.size() / 512, snapshotOn(0)) {}
 
 std::string PointDevice::snapshotOn(size_t cow) const {
     // Non-persistent: the exceptions live in memory, so a cow device is

@@ -18,10 +18,11 @@ namespace replay {
 
 class PointDevice {
 public:
-    // The mapped device `name` over `origin`, which holds `base` (kept by
-    // reference). Its snapshots keep their changes on the two `cows` in
-    // turn, each at least as large as `base`. Throws std::system_error when
-    // the kernel refuses.
+    // Writes `base` (kept by reference) onto the block device `origin`, and
+    // makes the mapped device `name` over it. Its snapshots keep their
+    // changes on the two `cows` in turn, each at least as large as `base`.
+    // Throws std::system_error when the kernel refuses, std::runtime_error
+    // when the origin cannot be written.
     PointDevice(const std::string& name, const std::filesystem::path& origin, const std::vector<uint8_t>& base,
                 const std::array<std::filesystem::path, 2>& cows);
 

@@ -47,6 +47,7 @@ constexpr size_t kMaxBlobSize = 32 * 1024;
 // median, and the commit comes at the very end of a run; a range that
 // stopped at the median could miss every commit (on the emulated ARM64
 // device, 302 kills left the old blob and none the new one).
+constexpr size_t kFullRuns = 1000;
 constexpr size_t kTimedRuns = 15;
 constexpr uint64_t kKillRangePercent = 125;
 constexpr unsigned kKillPercent = 30;
@@ -163,7 +164,7 @@ std::string describeBlob(const std::optional<Bytes>& blob) {
 
 TEST(MigrateSettingsSoak, KilledRunsLeaveTheOldOrTheNewBlob) {
     const uint64_t seed = envNumber("SOAK_SEED", 20261121);
-    const size_t runs = envNumber("SOAK_RUNS", 1000);
+    const size_t runs = envNumber("SOAK_RUNS", kFullRuns);
     std::cout << "soak: seed " << seed << " (SOAK_SEED=" << seed << " replays it), " << runs << " runs" << std::endl;
     std::mt19937_64 random(seed);
 
@@ -249,10 +250,17 @@ TEST(MigrateSettingsSoak, KilledRunsLeaveTheOldOrTheNewBlob) {
     std::cout << "soak: " << late << " kills came after the run had ended; typical run at the end " << typicalNs / 1000
               << " us" << std::endl;
     EXPECT_EQ(violations, 0u);
-    // A soak whose kills all came too late proved nothing about them.
+    // A soak whose kills all came too late proved nothing about them. The
+    // new blob is left only by a kill between the commit and the exit, a
+    // window a few runs in a hundred hit: a shorter soak shows instead that
+    // its kills reached past the end of the run, over the commit.
     if (runs >= 100) {
         EXPECT_GT(killedOld, 0u);
+    }
+    if (runs >= kFullRuns) {
         EXPECT_GT(killedNew, 0u);
+    } else if (runs >= 100) {
+        EXPECT_GT(killedNew + late, 0u);
     }
 }
 

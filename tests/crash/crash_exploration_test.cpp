@@ -37,10 +37,10 @@ size_t sequencesToExplore() {
 }
 
 // Sequences of three updates: each copy is rewritten at least once more
-// after holding a blob, and shorter sequences are their prefixes. Of all
-// 64, those whose kinds' positions in "WBAE" add up to a multiple of
-// 64 / count: each kind at each position in a quarter of them, for any
-// count that divides 64 by 1, 2 or 4.
+// after holding a blob, and shorter sequences are their prefixes. `count`
+// of the 64 (64, 32 or 16): those whose kinds' positions in "WBAE" add up
+// to a multiple of 64 / count, so that each kind comes at each position in
+// a quarter of them.
 std::vector<std::string> threeUpdateSequences(size_t count) {
     const std::string kinds = "WBAE";
     const size_t share = kAllSequences / count;

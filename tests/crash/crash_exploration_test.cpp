@@ -8,7 +8,6 @@
 // sequences in each case, chosen so that every kind of update still comes
 // at every position equally often.
 #include <cstdio>
-#include <cstdlib>
 #include <string>
 #include <vector>
 
@@ -16,6 +15,7 @@
 
 #include "child_process.h"
 #include "crash_exploration.h"
+#include "env_number.h"
 
 namespace crash {
 namespace {
@@ -30,11 +30,6 @@ public:
 const ::testing::Environment* const kPrintGrandTotals = ::testing::AddGlobalTestEnvironment(new PrintGrandTotals);
 
 constexpr size_t kAllSequences = 64;
-
-size_t sequencesToExplore() {
-    const char* value = std::getenv("CRASH_SEQUENCES");
-    return value == nullptr ? kAllSequences : std::strtoul(value, nullptr, 10);
-}
 
 // Sequences of three updates: each copy is rewritten at least once more
 // after holding a blob, and shorter sequences are their prefixes. `count`
@@ -82,7 +77,7 @@ class CrashExploration : public NativeRuns, public ::testing::WithParamInterface
 
 // Each scenario is recorded once and explored in both metadata orders.
 TEST_P(CrashExploration, EveryPowerCutLeavesTheAcknowledgedOrTheInFlightBlob) {
-    const size_t count = sequencesToExplore();
+    const size_t count = testing_support::envNumber("CRASH_SEQUENCES", kAllSequences);
     ASSERT_TRUE(count == kAllSequences || count == kAllSequences / 2 || count == kAllSequences / 4)
         << "CRASH_SEQUENCES must be 16, 32 or 64";
     const std::vector<std::string> sequences = threeUpdateSequences(count);

@@ -16,7 +16,6 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdint>
-#include <cstdlib>
 #include <cstring>
 #include <deque>
 #include <iostream>
@@ -29,6 +28,7 @@
 #include <gtest/gtest.h>
 
 #include "child_process.h"
+#include "env_number.h"
 #include "files.h"
 #include "lib/storage/dual_file_target.h"
 #include "scratch_dir.h"
@@ -52,11 +52,6 @@ constexpr size_t kTimedRuns = 15;
 constexpr uint64_t kKillRangePercent = 125;
 constexpr unsigned kKillPercent = 30;
 constexpr size_t kReportedViolations = 10;
-
-uint64_t envNumber(const char* name, uint64_t fallback) {
-    const char* text = std::getenv(name);
-    return text != nullptr && *text != '\0' ? std::strtoull(text, nullptr, 0) : fallback;
-}
 
 int64_t nowNs() {
     timespec now{};
@@ -163,8 +158,8 @@ std::string describeBlob(const std::optional<Bytes>& blob) {
 }
 
 TEST(MigrateSettingsSoak, KilledRunsLeaveTheOldOrTheNewBlob) {
-    const uint64_t seed = envNumber("SOAK_SEED", 20261121);
-    const size_t runs = envNumber("SOAK_RUNS", kFullRuns);
+    const uint64_t seed = testing_support::envNumber("SOAK_SEED", 20261121);
+    const size_t runs = testing_support::envNumber("SOAK_RUNS", kFullRuns);
     std::cout << "soak: seed " << seed << " (SOAK_SEED=" << seed << " replays it), " << runs << " runs" << std::endl;
     std::mt19937_64 random(seed);
 

@@ -22,7 +22,7 @@ root=$(pwd)
 out=$root/build/arm64-device
 guest=$root/tests/device/arm64
 kernel=$out/vmlinuz
-initramfs=$out/initramfs.cpio.gz
+initramfs=$out/initramfs.cpio
 card=$out/card.img
 assembled=$out/guest-assembled
 

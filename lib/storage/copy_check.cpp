@@ -44,6 +44,24 @@ CopyCheck judgeData(SlotDirectories& directories, unsigned copy, uint64_t stored
 
 }  // namespace
 
+bool operator==(const CheckIdentity& a, const CheckIdentity& b) {
+    return a.kind == b.kind && a.device == b.device && a.inode == b.inode &&
+           a.modified.tv_sec == b.modified.tv_sec && a.modified.tv_nsec == b.modified.tv_nsec;
+}
+
+CheckIdentity checkIdentityOf(const struct stat& status) {
+    CheckIdentity identity;
+    if (!S_ISREG(status.st_mode)) {
+        identity.kind = CheckIdentity::Kind::kOther;
+        return identity;
+    }
+    identity.kind = CheckIdentity::Kind::kRegular;
+    identity.device = status.st_dev;
+    identity.inode = status.st_ino;
+    identity.modified = status.st_mtim;
+    return identity;
+}
+
 CopyCheck checkCopy(SlotDirectories& directories, unsigned copy) {
     CopyCheck result;
     struct stat status {};
@@ -53,10 +71,12 @@ CopyCheck checkCopy(SlotDirectories& directories, unsigned copy) {
         if (error != ENOENT) {
             result.fault = CopyFault::kCheckUnopenable;
             result.error = error;
+            result.identity.kind = CheckIdentity::Kind::kOther;
         }
         return result;
     }
     result.checkTime = checkTimeOf(status);
+    result.identity = checkIdentityOf(status);
     uint64_t stored = 0;
     if (readCheckValue(check.get(), status, stored) != STATUS_OK) {
         const int error = errno;

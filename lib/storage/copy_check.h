@@ -3,6 +3,7 @@
 // inspection. Nothing here changes a file.
 #pragma once
 
+#include <sys/stat.h>
 #include <cstdint>
 
 #include "lib/storage/check_value.h"
@@ -10,6 +11,26 @@
 namespace Storage {
 
 class SlotDirectories;
+
+// What a copy's check file was when it was last judged, as lstat sees it.
+// Every commit renames a new file there whose time is later than any
+// before it, and every change first removes the old one, so a check file
+// whose identity is unchanged vouches for the same data as when it was
+// judged.
+struct CheckIdentity {
+    enum class Kind { kMissing, kRegular, kOther };
+    Kind kind = Kind::kMissing;
+    dev_t device = 0;  // these three for a regular file only
+    ino_t inode = 0;
+    struct timespec modified {};
+};
+
+bool operator==(const CheckIdentity& a, const CheckIdentity& b);
+inline bool operator!=(const CheckIdentity& a, const CheckIdentity& b) { return !(a == b); }
+
+// The identity of the entry whose lstat (or, for a regular file, fstat) is
+// `status`.
+CheckIdentity checkIdentityOf(const struct stat& status);
 
 // Why a copy is not valid, in the order the check meets them.
 enum class CopyFault {
@@ -30,6 +51,7 @@ struct CopyCheck {
     int error = 0;          // the errno, for the faults that name one
     int64_t checkSize = 0;  // kCheckSize
     CheckTime checkTime;    // the check file's, whenever it opened
+    CheckIdentity identity;  // the check file's, as judged
 
     bool valid() const { return fault == CopyFault::kNone; }
 };

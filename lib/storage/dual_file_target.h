@@ -34,6 +34,24 @@
 // store's file system mounted with barriers on: never barrier=0 or
 // nobarrier.
 //
+// Any number of processes, and target objects in one process, may use one
+// store at once. Two kinds of lock keep them apart (slot_lock.h): the
+// slot's own directory is held exclusive by every change, for all of it
+// (an incremental write from beginWrite to finalise), so changes come one
+// at a time; a copy's directory ("1" or "2") is held shared by whoever
+// reads that copy, and exclusive by the change that rewrites it. Reads
+// and queries therefore go on beside a change, which never touches the
+// copy they see. Every operation first checks that the check files are
+// those it judged, and judges again when another has committed or
+// invalidated a copy since: a change never overwrites what another
+// committed, and a read serves the newest commit. Opening removes a check
+// file that does not vouch for its data only after judging the copy again
+// under its lock; when that lock is not granted within kOpeningLockWait
+// (for all the target's slots together) it removes nothing. Other
+// operations wait at most kSlotLockWait and then fail with STATUS_TIMEOUT,
+// logged with the slot's directory; exists() then answers from the copies
+// as they look without the lock.
+//
 // Failures are returned as errno values or STATUS_FAILED; nothing is
 // thrown but allocation failures.
 #pragma once
@@ -43,13 +61,13 @@
 #include <string>
 #include <vector>
 
+#include "lib/storage/copy_check.h"
+#include "lib/storage/slot_lock.h"
 #include "lib/storage/storage_target.h"
 #include "lib/util/fd.h"
 
 namespace Storage {
 
-struct CheckTime;
-struct CopyCheck;
 class SlotDirectories;
 
 class DualFileTarget : public Target {
@@ -67,13 +85,14 @@ public:
         // Opens the slot that lives in `baseDirectory` itself (empty
         // `name`) or in its subdirectory `name`. `base`, when not negative,
         // is an open descriptor of the base directory, borrowed for the
-        // construction only.
-        Slot(std::filesystem::path baseDirectory, std::string name, int base = -1);
+        // construction only. Waits for a copy's lock until `deadline`.
+        Slot(std::filesystem::path baseDirectory, std::string name, int base = -1,
+             LockDeadline deadline = std::chrono::steady_clock::now() + kOpeningLockWait);
 
         // The current copy is valid and its data file exists.
         bool exists() const override;
         // The current copy is valid.
-        bool isValid() const override { return copies_[current_].valid; }
+        bool isValid() const override;
 
         // Removes the other copy's data; STATUS_OK also when already begun.
         Status beginWrite() override;
@@ -96,23 +115,47 @@ public:
             std::filesystem::path dataPath;
             std::filesystem::path checkPath;
             bool valid = false;
+            CheckIdentity identity;  // of the check file, as this slot last knew it
         };
 
         unsigned otherIndex() const { return (current_ + 1) % 2; }
         // Each operation reaches the slot's directories afresh.
         SlotDirectories directories() const;
-        // Decides whether the copy is valid and removes a check file that
-        // does not vouch for its data; returns the judgement.
-        CopyCheck validate(unsigned index, SlotDirectories& directories);
+        // Judges both copies and picks the current one. With a `cleanUp`
+        // deadline, removes check files that do not vouch for their data.
+        void judge(SlotDirectories& directories, const LockDeadline* cleanUp = nullptr) const;
+        // Decides whether the copy is valid and, with a `cleanUp` deadline,
+        // removes a check file that does not vouch for its data once it
+        // has judged the copy again under the copy's lock.
+        CopyCheck validate(unsigned index, SlotDirectories& directories, const LockDeadline* cleanUp) const;
+        // Judges again when a check file is no longer the one last judged.
+        void refresh(SlotDirectories& directories) const;
+        // For a read: holds the current copy's lock shared in `lock`, the
+        // judgement refreshed under it.
+        Status lockCurrent(SlotDirectories& directories, SlotLock& lock) const;
+        // For a change: holds the slot's lock and then the other copy's
+        // exclusive in `locks`, the judgement refreshed between the two.
+        struct ChangeLocks {
+            SlotLock slot;
+            SlotLock copy;
+        };
+        Status lockForChange(SlotDirectories& directories, ChangeLocks& locks);
+        // Logs that the slot's lock was not granted in time.
+        Status busy() const;
         void invalidate(unsigned index, SlotDirectories& directories);
         Status openCopyData(unsigned index, SlotDirectories& directories, int flags, UniqueFd& fd);
         Status commit(unsigned index, SlotDirectories& directories, const CheckTime& previousTime);
         Status commitOther(SlotDirectories& directories, const CheckTime& previousTime);
         CheckTime currentCheckTime(SlotDirectories& directories);
+        std::filesystem::path directoryPath() const;
 
-        std::array<Copy, 2> copies_;
-        unsigned current_ = 0;
+        // Judged again by the queries too, which are const: another process
+        // may have committed since.
+        mutable std::array<Copy, 2> copies_;
+        mutable unsigned current_ = 0;
         bool writing_ = false;
+        // Held from beginWrite to finalise.
+        ChangeLocks writeLocks_;
         std::filesystem::path baseDirectory_;
         std::string name_;
     };

@@ -76,6 +76,20 @@ CheckTime CopyDirectory::checkTime() const {
     return checkTimeOf(status);
 }
 
+CheckIdentity CopyDirectory::checkIdentity() const {
+    CheckIdentity identity;
+    if (fd < 0) {
+        if (!missing) identity.kind = CheckIdentity::Kind::kOther;
+        return identity;
+    }
+    struct stat status {};
+    if (::fstatat(fd, kCheckName, &status, AT_SYMLINK_NOFOLLOW) != 0) {
+        if (errno != ENOENT) identity.kind = CheckIdentity::Kind::kOther;
+        return identity;
+    }
+    return checkIdentityOf(status);
+}
+
 int CopyDirectory::remove(const char* name) const {
     if (fd < 0) return missing ? 0 : error;
     // An empty directory goes too, as std::filesystem::remove would take it.
@@ -94,6 +108,8 @@ bool CopyDirectory::holds(const char* name) const { return fd >= 0 && entryExist
 
 SlotDirectories::SlotDirectories(fs::path basePath, std::string slotName, int base)
     : basePath_(std::move(basePath)), slotName_(std::move(slotName)), borrowedBase_(base) {}
+
+CopyDirectory SlotDirectories::slot(bool create) { return reachSlot(create); }
 
 CopyDirectory SlotDirectories::open(unsigned copy) { return reach(copy, false); }
 

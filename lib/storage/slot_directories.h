@@ -18,6 +18,7 @@
 #include <string>
 
 #include "lib/storage/check_value.h"
+#include "lib/storage/copy_check.h"
 #include "lib/util/fd.h"
 #include "lib/util/status.h"
 
@@ -45,6 +46,9 @@ struct CopyDirectory {
     // The modification time of the check file; unknown unless it is a
     // regular file.
     CheckTime checkTime() const;
+    // What the check file is now (copy_check.h); a directory that could not
+    // be reached holds a missing one when it is missing, else another kind.
+    CheckIdentity checkIdentity() const;
     // Removes the entry `name`: a file, a link (itself, never followed) or
     // an empty directory. 0 when done or when there is nothing to remove,
     // else the errno.
@@ -65,6 +69,9 @@ public:
     SlotDirectories(SlotDirectories&&) = default;
     SlotDirectories& operator=(SlotDirectories&&) = delete;
 
+    // The slot's own directory (the base directory for a one-slot target)
+    // if it exists; with `create`, made first when missing.
+    CopyDirectory slot(bool create);
     // The directory of copy 0 ("1") or copy 1 ("2") if it exists.
     CopyDirectory open(unsigned copy);
     // The same, first making whatever is missing (the base with its

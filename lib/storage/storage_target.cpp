@@ -4,6 +4,7 @@
 #include <sys/types.h>
 #include <unistd.h>
 #include <algorithm>
+#include <chrono>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -41,6 +42,10 @@ constexpr int kSyncFailedLine = 510;
 constexpr int kSyncOpenLine = 516;
 
 constexpr mode_t kFileMode = 0666;
+
+// How long a read waits on the copy it judged current before judging again:
+// a copy held exclusive is being rewritten, so another one is current now.
+constexpr std::chrono::milliseconds kLockSlice{50};
 
 // A superseding check file is made at least this much newer than the one it
 // replaces, so that opening picks it even when the clock stood still or went
@@ -91,9 +96,12 @@ DualFileTarget::DualFileTarget(fs::path basePath, size_t slotCount) {
     fs::create_directories(basePath_, ignored);
     // Opened once for all slots; followed if it is a link (the integrator's choice).
     const UniqueFd base(::open(basePath_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    // One wait for all slots: a run opens every store, and a held lock of
+    // each slot must not add up to more than a moment.
+    const LockDeadline deadline = std::chrono::steady_clock::now() + kOpeningLockWait;
     slots_.reserve(slotCount);
     for (size_t i = 0; i < slotCount; ++i) {
-        slots_.emplace_back(basePath_, slotDirectoryName(slotCount, i), base.get());
+        slots_.emplace_back(basePath_, slotDirectoryName(slotCount, i), base.get(), deadline);
     }
 }
 
@@ -102,51 +110,139 @@ SlotHandle DualFileTarget::getSlot(size_t index) {
     return SlotHandle::borrow(&slots_[index]);
 }
 
-DualFileTarget::Slot::Slot(fs::path baseDirectory, std::string name, int base)
+DualFileTarget::Slot::Slot(fs::path baseDirectory, std::string name, int base, LockDeadline deadline)
     : baseDirectory_(std::move(baseDirectory)), name_(std::move(name)) {
     const char* const names[] = {"1/data", "2/data"};
-    const fs::path directory = name_.empty() ? baseDirectory_ : baseDirectory_ / name_;
-    SlotDirectories opening(baseDirectory_, name_, base);
-    CopyCheck checks[2];
+    const fs::path directory = directoryPath();
     for (unsigned i = 0; i < copies_.size(); ++i) {
         Copy& copy = copies_[i];
         copy.dataPath = directory / names[i];
         copy.checkPath = withSuffix(copy.dataPath, ".chk");
-        checks[i] = validate(i, opening);
     }
-    current_ = currentCopy(checks[0], checks[1]);
+    SlotDirectories opening(baseDirectory_, name_, base);
+    judge(opening, &deadline);
 }
 
 SlotDirectories DualFileTarget::Slot::directories() const { return SlotDirectories(baseDirectory_, name_); }
 
-CopyCheck DualFileTarget::Slot::validate(unsigned index, SlotDirectories& directories) {
+fs::path DualFileTarget::Slot::directoryPath() const { return name_.empty() ? baseDirectory_ : baseDirectory_ / name_; }
+
+void DualFileTarget::Slot::judge(SlotDirectories& directories, const LockDeadline* cleanUp) const {
+    CopyCheck checks[2];
+    for (unsigned i = 0; i < copies_.size(); ++i) checks[i] = validate(i, directories, cleanUp);
+    current_ = currentCopy(checks[0], checks[1]);
+}
+
+CopyCheck DualFileTarget::Slot::validate(unsigned index, SlotDirectories& directories,
+                                         const LockDeadline* cleanUp) const {
     Copy& copy = copies_[index];
-    const CopyCheck check = checkCopy(directories, index);
+    CopyCheck check = checkCopy(directories, index);
     copy.valid = check.valid();
+    copy.identity = check.identity;
     if (check.fault == CopyFault::kNoCheckFile || check.fault == CopyFault::kCheckUnopenable) {
         // Without a check file the directory may be missing; failing to make it fails the updates.
         (void)directories.ensure(index);
     }
     // A mismatching check file must never become valid again by accident; a missing one needs no removal.
-    if (!copy.valid && check.fault != CopyFault::kNoCheckFile && directories.open(index).remove(kCheckName) != 0) {
+    if (copy.valid || cleanUp == nullptr || check.fault == CopyFault::kNoCheckFile) return check;
+    // What looks damaged may be a change's half-made copy, and its check
+    // file may be in place by now: judged again while no change can hold it.
+    SlotLock::Outcome outcome = SlotLock::Outcome::kUnreachable;
+    const SlotLock lock = SlotLock::take(directories.open(index).fd, LockMode::kShared, *cleanUp, outcome);
+    if (outcome == SlotLock::Outcome::kBusy) return check;
+    if (outcome == SlotLock::Outcome::kHeld) {
+        check = checkCopy(directories, index);
+        copy.valid = check.valid();
+        copy.identity = check.identity;
+        if (copy.valid || check.fault == CopyFault::kNoCheckFile) return check;
+    }
+    if (directories.open(index).remove(kCheckName) != 0) {
         LOGE_AT(kCleanupCheckfileLine) << "Failure cleaning up checkfile " << std::quoted(copy.checkPath.string());
+    } else {
+        copy.identity = CheckIdentity{};
     }
     return check;
 }
 
+void DualFileTarget::Slot::refresh(SlotDirectories& directories) const {
+    for (unsigned i = 0; i < copies_.size(); ++i) {
+        const CopyDirectory directory = directories.open(i);
+        // A change never removes or replaces a copy's directory: one that
+        // cannot be reached says nothing about commits.
+        if (directory.fd >= 0 && directory.checkIdentity() != copies_[i].identity) {
+            judge(directories);
+            return;
+        }
+    }
+}
+
+Status DualFileTarget::Slot::busy() const {
+    LOGE << "Store " << std::quoted(directoryPath().string()) << " is busy: not locked within "
+         << kSlotLockWait.count() << " ms";
+    return STATUS_TIMEOUT;
+}
+
+Status DualFileTarget::Slot::lockCurrent(SlotDirectories& directories, SlotLock& lock) const {
+    // A begun write of this slot holds the slot's lock: nobody else commits.
+    if (writing_) return STATUS_OK;
+    const LockDeadline deadline = std::chrono::steady_clock::now() + kSlotLockWait;
+    for (;;) {
+        refresh(directories);
+        const LockDeadline slice = std::min(deadline, std::chrono::steady_clock::now() + kLockSlice);
+        SlotLock::Outcome outcome = SlotLock::Outcome::kUnreachable;
+        lock = SlotLock::take(directories.open(current_).fd, LockMode::kShared, slice, outcome);
+        if (outcome == SlotLock::Outcome::kUnreachable) return STATUS_OK;  // the read fails on its own
+        if (outcome == SlotLock::Outcome::kHeld &&
+            directories.open(current_).checkIdentity() == copies_[current_].identity) {
+            return STATUS_OK;
+        }
+        lock.release();
+        if (std::chrono::steady_clock::now() >= deadline) return busy();
+    }
+}
+
+Status DualFileTarget::Slot::lockForChange(SlotDirectories& directories, ChangeLocks& locks) {
+    if (writing_) return STATUS_OK;
+    const LockDeadline deadline = std::chrono::steady_clock::now() + kSlotLockWait;
+    SlotLock::Outcome outcome = SlotLock::Outcome::kUnreachable;
+    locks.slot = SlotLock::take(directories.slot(true).fd, LockMode::kExclusive, deadline, outcome);
+    if (outcome == SlotLock::Outcome::kBusy) return busy();
+    refresh(directories);
+    // Readers that judged before the last commit may still be reading the
+    // copy that is about to be rewritten.
+    locks.copy = SlotLock::take(directories.open(otherIndex()).fd, LockMode::kExclusive, deadline, outcome);
+    if (outcome == SlotLock::Outcome::kBusy) return busy();
+    return STATUS_OK;
+}
+
 bool DualFileTarget::Slot::exists() const {
-    if (!copies_[current_].valid) return false;
     SlotDirectories reached = directories();
+    SlotLock lock;
+    // Busy: the copies as they look now.
+    if (lockCurrent(reached, lock) != STATUS_OK) refresh(reached);
+    if (!copies_[current_].valid) return false;
     return reached.open(current_).holds(kDataName);
+}
+
+bool DualFileTarget::Slot::isValid() const {
+    SlotDirectories reached = directories();
+    // Needs no lock: a check file that did not change since it was judged
+    // still vouches for the same data.
+    refresh(reached);
+    return copies_[current_].valid;
 }
 
 Status DualFileTarget::Slot::read(uint8_t* buffer, size_t size, int64_t offset) {
     SlotDirectories reached = directories();
+    SlotLock lock;
+    if (const Status status = lockCurrent(reached, lock)) return status;
     return readCopy(reached, current_, copies_[current_].valid, buffer, size, offset, nullptr);
 }
 
 Status DualFileTarget::Slot::readSome(uint8_t* buffer, size_t size, int64_t offset, size_t& bytesRead) {
     SlotDirectories reached = directories();
+    SlotLock lock;
+    if (const Status status = lockCurrent(reached, lock)) return status;
     return readCopy(reached, current_, copies_[current_].valid, buffer, size, offset, &bytesRead);
 }
 
@@ -155,8 +251,11 @@ CheckTime DualFileTarget::Slot::currentCheckTime(SlotDirectories& directories) {
 }
 
 void DualFileTarget::Slot::invalidate(unsigned index, SlotDirectories& directories) {
-    if (const int error = directories.open(index).remove(kCheckName))
+    if (const int error = directories.open(index).remove(kCheckName)) {
         LOGE_AT(kInvalidateLine) << "" << errorCode(error);
+    } else {
+        copies_[index].identity = CheckIdentity{};
+    }
     copies_[index].valid = false;
 }
 
@@ -169,6 +268,7 @@ Status DualFileTarget::Slot::openCopyData(unsigned index, SlotDirectories& direc
         LOGE_AT(kOpenCopyDataLine) << "" << (directory.fd < 0 ? static_cast<Status>(directory.error) : STATUS_OK);
     }
     if (const int error = directory.remove(kCheckName)) return static_cast<Status>(error);
+    copies_[index].identity = CheckIdentity{};
     fd = directory.open(kDataName, flags, kFileMode);
     if (!fd) logOpenFailure(copies_[index].dataPath.c_str(), errno);
     return fd ? STATUS_OK : STATUS_FAILED;
@@ -180,6 +280,7 @@ Status DualFileTarget::Slot::commit(unsigned index, SlotDirectories& directories
     uint64_t value = 0;
     if (directory.computeCheckAndSync(value) != STATUS_OK) return STATUS_FAILED;
 
+    CheckIdentity installed;  // what the check file will be once renamed into place
     {
         const UniqueFd tmp = directory.open(kTransientName, O_WRONLY | O_CREAT | O_TRUNC, kFileMode);
         // A failed open is logged here; the write below then fails.
@@ -201,14 +302,21 @@ Status DualFileTarget::Slot::commit(unsigned index, SlotDirectories& directories
         // The time the write gave it.
         struct stat status {};
         const bool stated = ::fstat(tmp.get(), &status) == 0;
+        if (stated) installed = checkIdentityOf(status);
         if (previousTime.known && !(stated && isLater(checkTimeOf(status), previousTime))) {
             struct timespec times[2] = {{0, UTIME_OMIT}, previousTime.time};
             times[1].tv_sec += kCheckTimeStepSeconds;
-            if (::futimens(tmp.get(), times) != 0) LOGE_AT(kCheckTimeLine) << "" << errorCode(errno);
+            if (::futimens(tmp.get(), times) != 0) {
+                LOGE_AT(kCheckTimeLine) << "" << errorCode(errno);
+            } else {
+                installed.modified = times[1];
+            }
         }
     }
 
     if (::renameat(directory.fd, kTransientName, directory.fd, kCheckName) != 0) return errno;
+    // Whatever follows, this file is the copy's check file now.
+    copy.identity = installed;
 
     const UniqueFd check = directory.open(kCheckName, O_RDONLY);
     if (!check) {
@@ -235,6 +343,8 @@ Status DualFileTarget::Slot::commitOther(SlotDirectories& directories, const Che
 
 Status DualFileTarget::Slot::write(const uint8_t* data, size_t size) {
     SlotDirectories reached = directories();
+    ChangeLocks locks;
+    if (const Status status = lockForChange(reached, locks)) return status;
     const CheckTime previousTime = currentCheckTime(reached);
     invalidate(otherIndex(), reached);
     UniqueFd fd;
@@ -253,17 +363,22 @@ Status DualFileTarget::Slot::write(const uint8_t* data, size_t size) {
 Status DualFileTarget::Slot::beginWrite() {
     if (writing_) return STATUS_OK;
     SlotDirectories reached = directories();
+    ChangeLocks locks;
+    if (const Status status = lockForChange(reached, locks)) return status;
     const CopyDirectory directory = reached.open(otherIndex());
     // The second removal finds nothing; it is kept deliberately.
     for (int attempt = 0; attempt < 2; ++attempt) {
         if (const int error = directory.remove(kDataName)) return static_cast<Status>(error);
     }
     writing_ = true;
+    writeLocks_ = std::move(locks);
     return STATUS_OK;
 }
 
 Status DualFileTarget::Slot::writeAt(int64_t offset, const uint8_t* data, size_t size) {
     SlotDirectories reached = directories();
+    ChangeLocks locks;
+    if (const Status status = lockForChange(reached, locks)) return status;
     CheckTime previousTime;
     const unsigned target = otherIndex();
     if (!writing_) {
@@ -293,11 +408,15 @@ Status DualFileTarget::Slot::finalise() {
     if (!writing_) return STATUS_INVALID_OPERATION;
     writing_ = false;
     SlotDirectories reached = directories();
-    return commitOther(reached, currentCheckTime(reached));
+    const Status status = commitOther(reached, currentCheckTime(reached));
+    writeLocks_ = ChangeLocks();
+    return status;
 }
 
 Status DualFileTarget::Slot::erase() {
     SlotDirectories reached = directories();
+    ChangeLocks locks;
+    if (const Status status = lockForChange(reached, locks)) return status;
     const CheckTime previousTime = currentCheckTime(reached);
     const unsigned target = otherIndex();
     invalidate(target, reached);

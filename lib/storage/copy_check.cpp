@@ -45,8 +45,8 @@ CopyCheck judgeData(SlotDirectories& directories, unsigned copy, uint64_t stored
 }  // namespace
 
 bool operator==(const CheckIdentity& a, const CheckIdentity& b) {
-    return a.kind == b.kind && a.device == b.device && a.inode == b.inode &&
-           a.modified.tv_sec == b.modified.tv_sec && a.modified.tv_nsec == b.modified.tv_nsec;
+    return a.kind == b.kind && a.device == b.device && a.inode == b.inode && a.modified.tv_sec == b.modified.tv_sec &&
+           a.modified.tv_nsec == b.modified.tv_nsec;
 }
 
 CheckIdentity checkIdentityOf(const struct stat& status) {

@@ -48,9 +48,9 @@ enum class CopyFault {
 
 struct CopyCheck {
     CopyFault fault = CopyFault::kNoCheckFile;
-    int error = 0;          // the errno, for the faults that name one
-    int64_t checkSize = 0;  // kCheckSize
-    CheckTime checkTime;    // the check file's, whenever it opened
+    int error = 0;           // the errno, for the faults that name one
+    int64_t checkSize = 0;   // kCheckSize
+    CheckTime checkTime;     // the check file's, whenever it opened
     CheckIdentity identity;  // the check file's, as judged
 
     bool valid() const { return fault == CopyFault::kNone; }

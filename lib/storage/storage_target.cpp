@@ -4,8 +4,8 @@
 #include <sys/types.h>
 #include <unistd.h>
 #include <algorithm>
-#include <chrono>
 #include <cerrno>
+#include <chrono>
 #include <cstdlib>
 #include <cstring>
 #include <iomanip>
@@ -177,8 +177,8 @@ void DualFileTarget::Slot::refresh(SlotDirectories& directories) const {
 }
 
 Status DualFileTarget::Slot::busy() const {
-    LOGE << "Store " << std::quoted(directoryPath().string()) << " is busy: not locked within "
-         << kSlotLockWait.count() << " ms";
+    LOGE << "Store " << std::quoted(directoryPath().string()) << " is busy: not locked within " << kSlotLockWait.count()
+         << " ms";
     return STATUS_TIMEOUT;
 }
 

@@ -6,6 +6,7 @@
 
 #include <filesystem>
 
+#include "lib/storage/slot_lock.h"
 #include "lib/storage/storage_target.h"
 #include "lib/util/fd.h"
 
@@ -40,6 +41,9 @@ public:
         std::filesystem::path mountPath_;
         std::filesystem::path devicePath_;
         UniqueFd device_;
+        // Held from beginWrite to finalise: one update of the partition at a
+        // time.
+        SlotLock updateLock_;
         uint32_t bytesWritten_ = 0;  // wraps
     };
 

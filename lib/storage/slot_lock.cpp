@@ -16,12 +16,13 @@ constexpr std::chrono::milliseconds kLongestPause{25};
 
 }  // namespace
 
-SlotLock SlotLock::take(int directory, LockMode mode, LockDeadline deadline, Outcome& outcome) {
+SlotLock SlotLock::take(int directory, const char* name, LockMode mode, LockDeadline deadline, Outcome& outcome) {
     const int savedErrno = errno;
     SlotLock lock;
     // A description of its own: the lock must not be shared with, or
     // dropped by, the descriptors the operation opens and closes.
-    lock.fd_.reset(::openat(directory, ".", O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    // O_NONBLOCK: nothing but the lock is ever waited on.
+    lock.fd_.reset(::openat(directory, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
     outcome = Outcome::kUnreachable;
     const int operation = (mode == LockMode::kShared ? LOCK_SH : LOCK_EX) | LOCK_NB;
     auto pause = kFirstPause;

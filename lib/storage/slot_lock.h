@@ -1,6 +1,7 @@
 // The lock that serialises everyone who uses one dual-file slot: processes
 // of the tool, the application through the library, and target objects in
-// one process.
+// one process. The device targets take the same kind of lock on what they
+// rewrite.
 //
 // It is a flock on the slot's own directory (the target's directory for a
 // one-slot target, else its numbered subdirectory), taken through a
@@ -48,10 +49,12 @@ public:
     SlotLock(SlotLock&&) = default;
     SlotLock& operator=(SlotLock&&) = default;
 
-    // Locks the directory open as `directory` (a descriptor that stays the
-    // caller's) in `mode`, trying until `deadline`; a deadline already past
-    // means one try. errno is kept as it was.
-    static SlotLock take(int directory, LockMode mode, LockDeadline deadline, Outcome& outcome);
+    // Locks `name` in the directory open as `directory` (a descriptor that
+    // stays the caller's; AT_FDCWD for an absolute name), "." for the
+    // directory itself, in `mode`, trying until `deadline`; a deadline
+    // already past means one try. A link is not followed. errno is kept as
+    // it was.
+    static SlotLock take(int directory, const char* name, LockMode mode, LockDeadline deadline, Outcome& outcome);
 
     bool held() const { return static_cast<bool>(fd_); }
     // Gives the lock up; nothing when none is held.

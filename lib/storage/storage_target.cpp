@@ -148,7 +148,7 @@ CopyCheck DualFileTarget::Slot::validate(unsigned index, SlotDirectories& direct
     // What looks damaged may be a change's half-made copy, and its check
     // file may be in place by now: judged again while no change can hold it.
     SlotLock::Outcome outcome = SlotLock::Outcome::kUnreachable;
-    const SlotLock lock = SlotLock::take(directories.open(index).fd, LockMode::kShared, *cleanUp, outcome);
+    const SlotLock lock = SlotLock::take(directories.open(index).fd, ".", LockMode::kShared, *cleanUp, outcome);
     if (outcome == SlotLock::Outcome::kBusy) return check;
     if (outcome == SlotLock::Outcome::kHeld) {
         check = checkCopy(directories, index);
@@ -190,7 +190,7 @@ Status DualFileTarget::Slot::lockCurrent(SlotDirectories& directories, SlotLock&
         refresh(directories);
         const LockDeadline slice = std::min(deadline, std::chrono::steady_clock::now() + kLockSlice);
         SlotLock::Outcome outcome = SlotLock::Outcome::kUnreachable;
-        lock = SlotLock::take(directories.open(current_).fd, LockMode::kShared, slice, outcome);
+        lock = SlotLock::take(directories.open(current_).fd, ".", LockMode::kShared, slice, outcome);
         if (outcome == SlotLock::Outcome::kUnreachable) return STATUS_OK;  // the read fails on its own
         if (outcome == SlotLock::Outcome::kHeld &&
             directories.open(current_).checkIdentity() == copies_[current_].identity) {
@@ -205,12 +205,12 @@ Status DualFileTarget::Slot::lockForChange(SlotDirectories& directories, ChangeL
     if (writing_) return STATUS_OK;
     const LockDeadline deadline = std::chrono::steady_clock::now() + kSlotLockWait;
     SlotLock::Outcome outcome = SlotLock::Outcome::kUnreachable;
-    locks.slot = SlotLock::take(directories.slot(true).fd, LockMode::kExclusive, deadline, outcome);
+    locks.slot = SlotLock::take(directories.slot(true).fd, ".", LockMode::kExclusive, deadline, outcome);
     if (outcome == SlotLock::Outcome::kBusy) return busy();
     refresh(directories);
     // Readers that judged before the last commit may still be reading the
     // copy that is about to be rewritten.
-    locks.copy = SlotLock::take(directories.open(otherIndex()).fd, LockMode::kExclusive, deadline, outcome);
+    locks.copy = SlotLock::take(directories.open(otherIndex()).fd, ".", LockMode::kExclusive, deadline, outcome);
     if (outcome == SlotLock::Outcome::kBusy) return busy();
     return STATUS_OK;
 }
@@ -637,6 +637,17 @@ constexpr size_t kCompareBlock = 4096;
 
 void logAlreadyUpToDate() { LOGW << "Did not update file as it was already up to date"; }
 
+// Takes the lock on `path` that one device update holds at a time; logs and
+// returns STATUS_TIMEOUT when another holds it past the bound.
+Status lockDeviceUpdate(const char* what, const char* path, SlotLock& lock) {
+    SlotLock::Outcome outcome = SlotLock::Outcome::kUnreachable;
+    lock =
+        SlotLock::take(AT_FDCWD, path, LockMode::kExclusive, std::chrono::steady_clock::now() + kSlotLockWait, outcome);
+    if (outcome != SlotLock::Outcome::kBusy) return STATUS_OK;
+    LOGE << what << " " << std::quoted(path) << " is busy: not locked within " << kSlotLockWait.count() << " ms";
+    return STATUS_TIMEOUT;
+}
+
 }  // namespace
 
 FirmwareUpdateBootTarget::FirmwareUpdateBootTarget() : slots_{Slot("BOOT.BIN"), Slot("BOOT0010.BIN")} {}
@@ -794,6 +805,13 @@ Status FirmwareUpdateBootTarget::Slot::finalise() {
     }
     LOGW << std::quoted(destination_.string()) << " needs updating";
 
+    // Another update of the boot files must not remount or write between
+    // this one's remount, writes and read-back.
+    SlotLock lock;
+    if (const Status status = lockDeviceUpdate("Boot partition", kBootMountPoint, lock)) {
+        (void)close();
+        return status;
+    }
     if (const Status status = remountBootPartition(true)) {
         (void)close();
         if (status != STATUS_NOTHING_TO_DO) return status;
@@ -827,15 +845,25 @@ Status FirmwareUpdatePartitionTarget::Slot::beginWrite() {
         return STATUS_NOT_FOUND;
     }
     bytesWritten_ = 0;
+    // A restart holds it already. On the directory of the mount point: a
+    // descriptor of the device would keep the writer's close from being its
+    // last, which is what writes the device's cache back, and one of the
+    // mounted file system would keep it from being unmounted.
+    if (!updateLock_.held()) {
+        const std::string mountPoints = mountPath_.parent_path().string();
+        if (const Status status = lockDeviceUpdate("Mount points", mountPoints.c_str(), updateLock_)) return status;
+    }
     // On a restart the first begin has unmounted it already.
     const Status unmounted = unmountPartition(mountPath_.string());
     if (unmounted != STATUS_OK && !restart) {
         LOGE << "Failed to unmount " << std::quoted(mountPath_.string());
+        updateLock_.release();
         return unmounted;
     }
     device_ = openFd(devicePath_.c_str(), O_WRONLY | O_CLOEXEC);
     if (!device_) {
         LOGE << "Failed to open " << std::quoted(devicePath_.string()) << " for writing";
+        updateLock_.release();
         return STATUS_FAILED;
     }
     LOGW << "Beginning partition update " << std::quoted(devicePath_.string()) << " at "
@@ -857,7 +885,9 @@ Status FirmwareUpdatePartitionTarget::Slot::finalise() {
     LOGI << "Wrote " << bytesWritten_ << " bytes to " << std::quoted(devicePath_.string());
     // No separate sync: the last close of a block device writes back its cache.
     device_.reset();
-    return mountPartition(mountPath_.string());
+    const Status mounted = mountPartition(mountPath_.string());
+    updateLock_.release();
+    return mounted;
 }
 
 }  // namespace Storage

@@ -6,6 +6,7 @@
 #include <unistd.h>
 #include <algorithm>
 #include <cerrno>
+#include <chrono>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
@@ -13,6 +14,7 @@
 #include <functional>
 #include <map>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -23,6 +25,7 @@
 #include "files.h"
 #include "lib/storage/firmware_update_boot_target.h"
 #include "lib/util/log.h"
+#include "lock_holder.h"
 #include "scratch_dir.h"
 #include "simulated_device.h"
 #include "storage_log.h"
@@ -198,6 +201,49 @@ TEST_F(FirmwareUpdateBootOnDevice, DifferentDataIsWrittenAndReadBack) {
     device_test::mustRun("umount /media/boot && mount /media/boot");
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")) == data, true);
+}
+
+// ---- beside other updates ----
+
+// An application that holds the boot files' lock delays an update by the
+// bound, after which the update fails and leaves the file and the mount
+// alone.
+TEST_F(FirmwareUpdateBootOnDevice, HeldBootPartitionFailsWithinTheBound) {
+    const Bytes data = pattern(5000, 4);
+    ProcessResult result;
+    {
+        const testing_support::LockHolder holder({{sd::kBootMount, true}});
+        const auto start = std::chrono::steady_clock::now();
+        result = update(0, data);
+        EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(5));
+    }
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_NE(result.out.find("Boot partition \"/media/boot\" is busy: not locked within 2000 ms\n"), std::string::npos)
+        << result.out;
+    EXPECT_NE(result.out.find("finalise 110 valid 0\n"), std::string::npos) << result.out;
+    EXPECT_EQ(recorder.calls(), "");
+    EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
+    EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")), fileBytes(sd::originalBootFile("BOOT.BIN")));
+}
+
+// Two processes updating one boot file at once: one's remount, writes and
+// read-back never come between the other's, so both succeed and the file
+// holds one of the two whole.
+TEST_F(FirmwareUpdateBootOnDevice, TwoUpdatesAtOnceNeverInterleave) {
+    const Bytes first = pattern(400000, 5);
+    const Bytes second = pattern(300000, 6);
+    for (int round = 0; round < 5; ++round) {
+        ProcessResult resultFirst;
+        std::thread other([&] { resultFirst = update(0, first, 4096); });
+        ProcessResult resultSecond = update(0, second, 4096);
+        other.join();
+        for (const ProcessResult* result : {&resultFirst, &resultSecond}) {
+            EXPECT_NE(result->out.find("finalise 0 valid 0\n"), std::string::npos) << result->out;
+        }
+        EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
+        const Bytes now = fileBytes(bootFile("BOOT.BIN"));
+        EXPECT_TRUE(now == first || now == second) << "round " << round << ": " << now.size() << " bytes";
+    }
 }
 
 // The size alone does not decide: one byte differing in the last block of

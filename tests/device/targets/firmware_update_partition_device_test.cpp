@@ -6,6 +6,7 @@
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <unistd.h>
+#include <chrono>
 #include <cstdint>
 #include <cstdio>
 #include <filesystem>
@@ -20,8 +21,10 @@
 #include "lib/storage/firmware_update_partition_target.h"
 #include "lib/storage/mount_commands.h"
 #include "lib/util/log.h"
+#include "lock_holder.h"
 #include "scratch_dir.h"
 #include "simulated_device.h"
+#include "source_lines.h"
 #include "storage_log.h"
 
 namespace {
@@ -211,6 +214,27 @@ TEST_F(FirmwareUpdatePartitionOnDevice, FinaliseOrWriteWithoutBegin) {
     EXPECT_EQ(result.out, "finalise 2\nwriteAt 95\n");
     EXPECT_EQ(recorder.calls(), "");
     EXPECT_EQ(sd::mountState(sd::kResourcesMount), sd::MountState::kReadWrite);
+}
+
+// Another update holds the mount points' lock: the begin fails within the
+// bound, before anything is unmounted or opened.
+TEST_F(FirmwareUpdatePartitionOnDevice, HeldMountPointsFailTheBeginWithinTheBound) {
+    ProcessResult result;
+    {
+        const testing_support::LockHolder holder({{"/media", true}});
+        const auto start = std::chrono::steady_clock::now();
+        result = run(LOG_PRIORITY_INFO, [](TargetSlot& slot) {
+            std::printf("begin %u\n", slot.beginWrite());
+            std::printf("writeAt %u\n", writeAt(slot, 0, pattern(10, 1)));
+            return 0;
+        });
+        EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(5));
+    }
+    EXPECT_EQ(result.out, testing_support::errorPrefixOf("lib/storage/storage_target.cpp", "LOGE << what <<") +
+                              "Mount points \"/media\" is busy: not locked within 2000 ms\nbegin 110\nwriteAt 95\n");
+    EXPECT_EQ(recorder.calls(), "");
+    EXPECT_EQ(sd::mountState(sd::kResourcesMount), sd::MountState::kReadWrite);
+    EXPECT_TRUE(fs::exists(sd::kResourcesMarker));
 }
 
 // A regular file or a directory at the device path: nothing is unmounted.

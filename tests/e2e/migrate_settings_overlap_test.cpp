@@ -30,6 +30,10 @@ constexpr unsigned kTimeLimitSeconds = 30;
 // The tool's wait for a slot's lock, and what a run may take beyond it.
 constexpr auto kLockWait = std::chrono::seconds(2);
 constexpr auto kMargin = std::chrono::seconds(3);
+#ifndef OVERLAP_ROUNDS_DIVISOR
+#define OVERLAP_ROUNDS_DIVISOR 1
+#endif
+constexpr int kRoundsDivisor = OVERLAP_ROUNDS_DIVISOR;
 
 class OverlappingRuns : public ::testing::Test {
 protected:
@@ -74,7 +78,7 @@ protected:
 // the middle of its commit and remove the check file the commit had just
 // put in place: an acknowledged write gone.
 TEST_F(OverlappingRuns, QueriesOfOtherStoresNeverUndoACommit) {
-    constexpr int kWrites = 300;
+    constexpr int kWrites = 300 / kRoundsDivisor;
     ASSERT_EQ(migrate("util_save", dataFile("first", e2e::pattern(1000, 0))).exitStatus, 0);
     std::atomic<bool> writing{true};
     const auto queryLoop = [&](const char* target) {
@@ -102,7 +106,7 @@ TEST_F(OverlappingRuns, QueriesOfOtherStoresNeverUndoACommit) {
 // Two runs started together into one slot: the slot serves one of the blobs
 // whose run succeeded, and never loses the earlier ones.
 TEST_F(OverlappingRuns, TwoWritersOfOneSlotKeepAnAcknowledgedBlob) {
-    constexpr int kRounds = 200;
+    constexpr int kRounds = 200 / kRoundsDivisor;
     std::string previous = testing_support::hex(e2e::pattern(3000, 0));
     ASSERT_EQ(migrate("util_save", dataFile("start", e2e::pattern(3000, 0))).exitStatus, 0);
     int wrong = 0;

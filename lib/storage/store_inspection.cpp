@@ -6,6 +6,7 @@
 #include <cerrno>
 
 #include "lib/storage/slot_directories.h"
+#include "lib/storage/slot_lock.h"
 #include "lib/storage/untrusted_tree.h"
 
 namespace Storage {
@@ -79,7 +80,17 @@ SlotState stateOf(const SlotInspection& slot) {
     const CopyInspection& current = slot.copies[slot.current];
     if (current.check.valid())
         return current.data.kind == EntryKind::kMissing ? SlotState::kAbsentBlob : SlotState::kPresent;
-    return slot.copies[0].hasEntries() || slot.copies[1].hasEntries() ? SlotState::kLost : SlotState::kEmpty;
+    // The entries of a copy being rewritten are not yet anything.
+    const auto holds = [](const CopyInspection& copy) { return copy.hasEntries() && !copy.beingRewritten; };
+    return holds(slot.copies[0]) || holds(slot.copies[1]) ? SlotState::kLost : SlotState::kEmpty;
+}
+
+// Whether someone holds the directory's lock exclusive: one try, released
+// at once.
+bool heldByAChange(int directory) {
+    SlotLock::Outcome outcome = SlotLock::Outcome::kUnreachable;
+    (void)SlotLock::take(directory, ".", LockMode::kShared, LockDeadline(), outcome);
+    return outcome == SlotLock::Outcome::kBusy;
 }
 
 // Writes all of `size` bytes, resuming after short writes and signals.
@@ -148,7 +159,9 @@ int inspectSlot(const std::filesystem::path& targetPath, size_t slotCount, size_
     }
     const std::string slotName = slotDirectoryName(slotCount, index);
     SlotDirectories directories(targetPath, slotName, base.get());
+    result.changeInProgress = heldByAChange(directories.slot(false).fd);
     for (unsigned i = 0; i < result.copies.size(); ++i) {
+        result.copies[i].beingRewritten = heldByAChange(directories.open(i).fd);
         result.copies[i].check = checkCopy(directories, i);
         describeCopy(base.get(), slotName, i, result.copies[i]);
     }

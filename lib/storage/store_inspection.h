@@ -3,7 +3,8 @@
 // below the target's directory (which, like the store's, may itself be a
 // link), no FIFO waited on. Validity and the current copy come from the
 // store's own rules (copy_check.h), so a report agrees with what a
-// DualFileTarget opened on the same tree would serve.
+// DualFileTarget opened on the same tree would serve. The locks of a
+// change in progress are only tried, never waited on (slot_lock.h).
 #pragma once
 
 #include <array>
@@ -43,6 +44,9 @@ struct CopyInspection {
     bool crcKnown = false;
     uint32_t crc32 = 0;
     int dataError = 0;
+    // A change holds the copy's lock: it is being rewritten, and what looks
+    // damaged is the change's half-made copy.
+    bool beingRewritten = false;
 
     // Any store entry (data, check or ".tmp" file, or something planted on
     // the way) is there.
@@ -63,6 +67,7 @@ struct SlotInspection {
     std::array<CopyInspection, 2> copies;
     unsigned current = 0;  // the copy that reads see, 0 or 1
     SlotState state = SlotState::kEmpty;
+    bool changeInProgress = false;  // a change holds the slot's lock
 };
 
 // Inspects slot `index` of the dual-file target at `targetPath` with

@@ -4,6 +4,7 @@
 // the command line, and agreement with a freshly opened store. Every run
 // must leave the whole scratch tree exactly as it was.
 #include <sys/stat.h>
+#include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
@@ -430,6 +431,45 @@ TEST_F(InspectStore, DumpWritesExactlyTheBytesTheSlotReads) {
     EXPECT_EQ(toFile.exitStatus, 0) << toFile.err;
     EXPECT_EQ(toFile.out, "");
     EXPECT_EQ(readBytes(file), served.data);
+}
+
+// A change in progress holds the slot's lock and the lock of the copy it
+// rewrites: that copy is shown as such, not as damage, and nothing waits.
+TEST_F(InspectStore, ChangeInProgressIsShownAsSuch) {
+    twoWrites(base, kSettings, 0);  // copy 1 current; a change rewrites copy 2
+    Storage::DualFileTarget store(base / kSettings.location, kSettings.slots);
+    Storage::TargetSlot& slot = *store.getSlot(0).get();
+    ASSERT_EQ(slot.beginWrite(), STATUS_OK);
+    ASSERT_EQ(slot.writeAt(0, kFirst.data(), 100), STATUS_OK);
+
+    const auto start = std::chrono::steady_clock::now();
+    const ProcessResult plain = run({"--target", "settings"});
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2));
+    EXPECT_EQ(plain.exitStatus, 0) << plain.out;
+    const std::string slotDir = (base / kSettings.location).string();
+    EXPECT_NE(plain.out.find("\n" + slotDir + ": change in progress\n"), std::string::npos) << plain.out;
+    EXPECT_NE(plain.out.find("\n" + slotDir + "/2: being rewritten by a change in progress\n"), std::string::npos)
+        << plain.out;
+    EXPECT_EQ(plain.out.find("interrupted"), std::string::npos) << plain.out;
+
+    const ProcessResult json = run({"--target", "settings", "--json"});
+    EXPECT_EQ(json.exitStatus, 0) << json.out;
+    const JsonValue document = parsed(json);
+    if (document.isNull()) return;
+    const JsonValue& reported = document["targets"][0]["slots"][0];
+    EXPECT_EQ(reported["state"].text, "present");
+    EXPECT_TRUE(reported["change_in_progress"].boolean);
+    EXPECT_FALSE(reported["copies"][0]["being_rewritten"].boolean);
+    EXPECT_TRUE(reported["copies"][1]["being_rewritten"].boolean);
+    EXPECT_FALSE(reported["copies"][1]["interrupted_update"].boolean);
+
+    ASSERT_EQ(slot.finalise(), STATUS_OK);
+    const ProcessResult after = run({"--target", "settings", "--json"});
+    const JsonValue done = parsed(after);
+    if (done.isNull()) return;
+    EXPECT_FALSE(done["targets"][0]["slots"][0]["change_in_progress"].boolean);
+    EXPECT_FALSE(done["targets"][0]["slots"][0]["copies"][1]["being_rewritten"].boolean);
+    EXPECT_EQ(done["targets"][0]["slots"][0]["current"].number, 2);
 }
 
 TEST_F(InspectStore, DumpOfASlotThatIsNotPresentIs10) {

@@ -72,7 +72,7 @@ bool interrupted(const TargetReport& target, const SlotReport& slot, unsigned co
     const CopyInspection& inspected = inspection.copies[copy];
     return (inspection.state == SlotState::kPresent || inspection.state == SlotState::kAbsentBlob) &&
            copy != inspection.current && !inspected.check.valid() && inspected.hasEntries() &&
-           damageLines(target, slot.index, copy, inspected).empty();
+           !inspected.beingRewritten && damageLines(target, slot.index, copy, inspected).empty();
 }
 
 // What a copy holds, for the slot's line: "-" when it has no entries.
@@ -108,6 +108,7 @@ std::string jsonCopy(const TargetReport& target, const SlotReport& slot, unsigne
     json += ",\"check_time\":" +
             jsonOrNull(inspected.checkFile.kind == EntryKind::kFile, jsonQuoted(isoTime(inspected.checkFile.modified)));
     json += std::string(",\"interrupted_update\":") + (interrupted(target, slot, copy) ? "true" : "false");
+    json += std::string(",\"being_rewritten\":") + (inspected.beingRewritten ? "true" : "false");
     return json + "}";
 }
 
@@ -171,8 +172,15 @@ std::string plainReport(const StoreReport& report) {
                 lines.push_back(slotPath(target, slot.index).string() + ": lost: copy 1: " +
                                 copyReason(inspection.copies[0]) + "; copy 2: " + copyReason(inspection.copies[1]));
             }
+            if (inspection.changeInProgress)
+                lines.push_back(slotPath(target, slot.index).string() + ": change in progress");
             for (unsigned copy = 0; copy < 2; ++copy) {
                 const CopyInspection& inspected = inspection.copies[copy];
+                if (inspected.beingRewritten) {
+                    lines.push_back(copyPath(target, slot.index, copy).string() +
+                                    ": being rewritten by a change in progress");
+                    continue;
+                }
                 if (interrupted(target, slot, copy)) {
                     lines.push_back(copyPath(target, slot.index, copy).string() + ": interrupted update (" +
                                     copyReason(inspected) + "), normal after a power cut");
@@ -215,7 +223,8 @@ std::string jsonReport(const StoreReport& report) {
                     ",\"state\":" + jsonQuoted(Storage::slotStateName(inspection.state)) + ",\"current\":" +
                     jsonOrNull(inspection.copies[inspection.current].check.valid(),
                                std::to_string(inspection.current + 1)) +
-                    ",\"copies\":[" + jsonCopy(target, slot, 0) + "," + jsonCopy(target, slot, 1) + "]";
+                    ",\"change_in_progress\":" + (inspection.changeInProgress ? "true" : "false") + ",\"copies\":[" +
+                    jsonCopy(target, slot, 0) + "," + jsonCopy(target, slot, 1) + "]";
             json += ",\"leftover_tmp\":[";
             bool first = true;
             for (unsigned copy = 0; copy < 2; ++copy) {
@@ -237,7 +246,8 @@ bool showsDamage(const StoreReport& report) {
         for (const SlotReport& slot : target.slots) {
             if (slot.inspection.state == SlotState::kLost) return true;
             for (unsigned copy = 0; copy < 2; ++copy) {
-                if (!damageLines(target, slot.index, copy, slot.inspection.copies[copy]).empty()) return true;
+                const CopyInspection& inspected = slot.inspection.copies[copy];
+                if (!inspected.beingRewritten && !damageLines(target, slot.index, copy, inspected).empty()) return true;
             }
         }
     }

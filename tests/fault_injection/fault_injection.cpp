@@ -17,6 +17,12 @@ Environment preloadEnv() {
     return {{"LD_PRELOAD", faultInjectionLibrary()}, {"ASAN_OPTIONS", asanOptions}};
 }
 
+Environment locksOffEnv() {
+    Environment env = preloadEnv();
+    env["FAULT_LOCKS"] = "off";
+    return env;
+}
+
 Environment faultEnv(const std::string& call, unsigned long nth, const std::string& action,
                      const std::string& pathSubstr, const std::string& countFile) {
     Environment env = faultCountEnv(call, countFile, pathSubstr);

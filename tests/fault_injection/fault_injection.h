@@ -21,6 +21,10 @@ const char* faultInjectionLibrary();
 // library preloaded ahead of its runtime.
 Environment preloadEnv();
 
+// preloadEnv() under which flock takes no lock and always succeeds
+// (FAULT_LOCKS=off): the program runs as if it had no locks.
+Environment locksOffEnv();
+
 // Fails or ends the program at the `nth` call matching `call` ("rename",
 // "open", "mutating", ...). `action` is "errno:EIO" (any errno name or
 // number), "crash" or "short:BYTES". An empty `pathSubstr` counts calls on

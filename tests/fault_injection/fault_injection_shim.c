@@ -90,6 +90,10 @@
  *                      is recorded). The program's own utimensat and
  *                      futimens are left as they are. Works without
  *                      FAULT_CALL.
+ *   FAULT_LOCKS        "off": flock takes and drops no lock and returns 0,
+ *                      so every lock is granted at once and nobody is kept
+ *                      out; how a test shows what the locks prevent. Works
+ *                      without FAULT_CALL.
  *
  * Files whose names end in ".gcda" are gcov's counts, which a coverage
  * build opens as it exits (and writes through stdio): calls that name such
@@ -228,6 +232,7 @@ static struct {
     char record[PATH_MAX];
     int hasClock;
     time_t clock;
+    int locksOff;
     pid_t pid;
 } config;
 
@@ -391,12 +396,13 @@ static void loadConfig(void) {
     const char* countFile = setting("FAULT_COUNT_FILE");
     const char* record = setting("FAULT_RECORD");
     const char* clock = setting("FAULT_MTIME");
+    const char* locks = setting("FAULT_LOCKS");
 
     if (call == NULL && (nth != NULL || action != NULL || countFile != NULL ||
                          (pathSubstr != NULL && record == NULL && clock == NULL))) {
         configError("FAULT_CALL", NULL, "missing, but other FAULT_ variables are set");
     }
-    if (call == NULL && record == NULL && clock == NULL) return;
+    if (call == NULL && record == NULL && clock == NULL && locks == NULL) return;
     if (call != NULL) {
         config.counting = 1;
         config.family = -1;
@@ -417,6 +423,10 @@ static void loadConfig(void) {
     if (action != NULL) parseAction(action);
     if (record != NULL) parseRecord(record);
     if (clock != NULL) parseClock(clock);
+    if (locks != NULL) {
+        if (strcmp(locks, "off") != 0) configError("FAULT_LOCKS", locks, "expected off");
+        config.locksOff = 1;
+    }
     if (pathSubstr != NULL) {
         if (!copyValue(config.pathSubstr, sizeof config.pathSubstr, pathSubstr)) {
             configError("FAULT_PATH_SUBSTR", NULL, "too long");
@@ -441,6 +451,7 @@ static void loadConfig(void) {
     unsetenv("FAULT_COUNT_FILE");
     unsetenv("FAULT_RECORD");
     unsetenv("FAULT_MTIME");
+    unsetenv("FAULT_LOCKS");
 }
 
 /* True when calls are to be inspected. Loads the configuration on first
@@ -1395,4 +1406,17 @@ EXPORT int fchmodat(int dirfd, const char* path, mode_t mode, int flags) {
     const int result = real(dirfd, path, mode, flags);
     if (result == 0 && watched) recordNamed("chmod", &target, flags & AT_SYMLINK_NOFOLLOW, 0);
     return result;
+}
+
+/* ---- locks ---- */
+
+typedef int (*FlockFn)(int, int);
+
+EXPORT int flock(int fd, int operation) {
+    static void* slot;
+    const FlockFn real = (FlockFn)next(&slot, "flock");
+    const int saved = errno;
+    const int off = enabled() && config.locksOff;
+    errno = saved;
+    return off ? 0 : real(fd, operation);
 }

@@ -1,18 +1,26 @@
 #include "fault_injection.h"
 
+#include <cerrno>
 #include <csignal>
 #include <cstddef>
+#include <cstdio>
+#include <cstdlib>
 #include <map>
 #include <set>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
+#include <fcntl.h>
+#include <sys/file.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <gtest/gtest.h>
 
 #include "child_process.h"
 #include "files.h"
+#include "lib/util/fd.h"
 #include "scratch_dir.h"
 
 namespace {
@@ -409,5 +417,73 @@ INSTANTIATE_TEST_SUITE_P(Probes, FaultInjection, ::testing::Values(FAULT_PROBE, 
                          [](const ::testing::TestParamInfo<const char*>& info) {
                              return info.index == 0 ? std::string("Plain") : std::string("Instrumented");
                          });
+
+}  // namespace
+
+// FAULT_LOCKS, tried on this test program itself started again under the
+// shim: in that copy the test only takes locks and prints how it fared.
+namespace {
+
+constexpr char kLockProbeFile[] = "FAULT_LOCKS_PROBE_FILE";
+
+std::string ownProgram() {
+    std::string path(4096, '\0');
+    const ssize_t length = readlink("/proc/self/exe", path.data(), path.size());
+    if (length <= 0) throw std::runtime_error("readlink /proc/self/exe failed");
+    path.resize(static_cast<size_t>(length));
+    return path;
+}
+
+// Two exclusive locks without waiting, each through a description of its
+// own: the process that started this one holds a lock on the file, and the
+// first lock, when held, would keep the second out. The descriptors stay
+// open so that nothing is dropped before the process ends.
+void probeLocks(const char* path) {
+    for (const char* name : {"flock", "second flock"}) {
+        const int fd = open(path, O_RDONLY | O_CLOEXEC);
+        if (fd < 0 || flock(fd, LOCK_EX | LOCK_NB) != 0) {
+            std::printf("%s failed %d\n", name, errno);
+        } else {
+            std::printf("%s 0\n", name);
+        }
+    }
+    std::fflush(stdout);
+}
+
+TEST(FaultLocks, OffGrantsEveryFlockWithoutHoldingIt) {
+    if (const char* probed = std::getenv(kLockProbeFile)) {
+        probeLocks(probed);
+        return;
+    }
+
+    const ScratchDir dir;
+    const fs::path file = dir / "locked";
+    writeText(file, "");
+    const UniqueFd held(open(file.c_str(), O_RDONLY | O_CLOEXEC));
+    ASSERT_TRUE(held);
+    ASSERT_EQ(flock(held.get(), LOCK_EX | LOCK_NB), 0);
+    const auto probe = [&](Environment env) {
+        env[kLockProbeFile] = file.string();
+        return runProgram({ownProgram(), "--gtest_filter=FaultLocks.OffGrantsEveryFlockWithoutHoldingIt"}, env, 60);
+    };
+
+    const ProcessResult forwarded = probe(preloadEnv());
+    EXPECT_EQ(forwarded.exitStatus, 0) << forwarded.out << forwarded.err;
+    EXPECT_NE(forwarded.out.find("flock failed " + std::to_string(EWOULDBLOCK) + "\nsecond flock failed " +
+                                 std::to_string(EWOULDBLOCK) + "\n"),
+              std::string::npos)
+        << forwarded.out;
+
+    const ProcessResult off = probe(testing_support::locksOffEnv());
+    EXPECT_EQ(off.exitStatus, 0) << off.out << off.err;
+    EXPECT_NE(off.out.find("flock 0\nsecond flock 0\n"), std::string::npos) << off.out;
+
+    // The variable's only value.
+    Environment on = preloadEnv();
+    on["FAULT_LOCKS"] = "on";
+    const ProcessResult refused = probe(on);
+    EXPECT_EQ(refused.exitStatus, 98);
+    EXPECT_EQ(refused.err, "fault_injection: FAULT_LOCKS=\"on\": expected off\n");
+}
 
 }  // namespace

@@ -85,11 +85,11 @@ SlotState stateOf(const SlotInspection& slot) {
     return holds(slot.copies[0]) || holds(slot.copies[1]) ? SlotState::kLost : SlotState::kEmpty;
 }
 
-// Whether someone holds the directory's lock exclusive: one try, released
-// at once.
-bool heldByAChange(int directory) {
+// The directory's lock, shared, in `lock`: one try. Whether a change holds
+// it exclusive.
+bool heldByAChange(int directory, SlotLock& lock) {
     SlotLock::Outcome outcome = SlotLock::Outcome::kUnreachable;
-    (void)SlotLock::take(directory, ".", LockMode::kShared, LockDeadline(), outcome);
+    lock = SlotLock::take(directory, ".", LockMode::kShared, LockDeadline(), outcome);
     return outcome == SlotLock::Outcome::kBusy;
 }
 
@@ -148,7 +148,8 @@ const char* slotStateName(SlotState state) {
     return "unknown";
 }
 
-int inspectSlot(const std::filesystem::path& targetPath, size_t slotCount, size_t index, SlotInspection& slot) {
+int inspectSlot(const std::filesystem::path& targetPath, size_t slotCount, size_t index, SlotInspection& slot,
+                InspectionLocks* keep) {
     SlotInspection result;
     // Followed if it is a link, as the store follows it: the integrator's choice.
     const UniqueFd base(::open(targetPath.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
@@ -159,15 +160,21 @@ int inspectSlot(const std::filesystem::path& targetPath, size_t slotCount, size_
     }
     const std::string slotName = slotDirectoryName(slotCount, index);
     SlotDirectories directories(targetPath, slotName, base.get());
-    result.changeInProgress = heldByAChange(directories.slot(false).fd);
+    SlotLock slotLock;
+    result.changeInProgress = heldByAChange(directories.slot(false).fd, slotLock);
+    slotLock.release();  // tried only to tell
+    InspectionLocks locks;
     for (unsigned i = 0; i < result.copies.size(); ++i) {
-        result.copies[i].beingRewritten = heldByAChange(directories.open(i).fd);
+        result.copies[i].beingRewritten = heldByAChange(directories.open(i).fd, locks.copies[i]);
+    }
+    for (unsigned i = 0; i < result.copies.size(); ++i) {
         result.copies[i].check = checkCopy(directories, i);
         describeCopy(base.get(), slotName, i, result.copies[i]);
     }
     result.current = currentCopy(result.copies[0].check, result.copies[1].check);
     result.state = stateOf(result);
     slot = result;
+    if (keep != nullptr) *keep = std::move(locks);
     return 0;
 }
 

@@ -14,6 +14,7 @@
 #include <string>
 
 #include "lib/storage/copy_check.h"
+#include "lib/storage/slot_lock.h"
 
 namespace Storage {
 
@@ -70,15 +71,25 @@ struct SlotInspection {
     bool changeInProgress = false;  // a change holds the slot's lock
 };
 
+// Shared locks on the copies that no change was rewriting, tried once each
+// and held while both are judged: no change rewrites those copies
+// meanwhile, so the judgement is of one moment. Held on by a dump until
+// its last byte, they keep it true.
+struct InspectionLocks {
+    std::array<SlotLock, 2> copies;
+};
+
 // Inspects slot `index` of the dual-file target at `targetPath` with
 // `slotCount` slots. A target directory that does not exist holds empty
 // slots. Returns 0, or the errno when the target's directory exists but
-// cannot be opened (then `slot` is left as it was).
+// cannot be opened (then `slot` is left as it was). With `keep`, the
+// copies' locks stay held in it.
 [[nodiscard]] int inspectSlot(const std::filesystem::path& targetPath, size_t slotCount, size_t index,
-                              SlotInspection& slot);
+                              SlotInspection& slot, InspectionLocks* keep = nullptr);
 
 // Writes the data of copy `copy` of the slot to `out` whole, reaching it as
-// reads of the store do. 0, or the errno of the failing open, read or
+// reads of the store do; the locks an inspection kept make it the copy
+// that inspection judged. 0, or the errno of the failing open, read or
 // write.
 [[nodiscard]] int copySlotData(const std::filesystem::path& targetPath, size_t slotCount, size_t index, unsigned copy,
                                int out);

@@ -57,7 +57,9 @@ int dumpSlot(const InspectOptions& options) {
     const DualFileRow& row = *options.target;
     const std::filesystem::path path = targetPath(options, row);
     Storage::SlotInspection slot;
-    if (const int error = Storage::inspectSlot(path, row.slotCount, options.slotIndex, slot)) {
+    // Held to the last byte: no change rewrites the copy while it is dumped.
+    Storage::InspectionLocks locks;
+    if (const int error = Storage::inspectSlot(path, row.slotCount, options.slotIndex, slot, &locks)) {
         printError(path, error);
         return kInspectDamage;
     }

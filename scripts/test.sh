@@ -10,6 +10,7 @@ for preset in default asan; do
   cmake --preset "$preset" >/dev/null
   cmake --build --preset "$preset"
   ctest --preset "$preset"
-  # The power-cut exploration's and the soak's totals, from the log of the run above.
-  grep -h -e "crash exploration totals" -e "broken writer:" -e "soak: [0-9]* runs" "build/$preset/Testing/Temporary/LastTest.log" || true
+  # The power-cut exploration's, the soak's and the overlap stress's totals, from the log of the run above.
+  grep -h -e "crash exploration totals" -e "broken writer:" -e "soak: [0-9]* runs" -e "^overlap.*: [0-9]* rounds" \
+    "build/$preset/Testing/Temporary/LastTest.log" || true
 done

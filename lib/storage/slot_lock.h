@@ -1,20 +1,19 @@
-// The lock that serialises everyone who uses one dual-file slot: processes
+// The locks that serialise everyone who uses one dual-file slot: processes
 // of the tool, the application through the library, and target objects in
-// one process. The device targets take the same kind of lock on what they
+// one process. The device updates take the same kind of lock on what they
 // rewrite.
 //
-// It is a flock on the slot's own directory (the target's directory for a
-// one-slot target, else its numbered subdirectory), taken through a
-// descriptor of its own. flock belongs to the open file description: the
-// kernel drops it when its holder dies, an unrelated close in the holder
-// does not, and two target objects of one process exclude each other as two
-// processes do. Locking the directory needs no lock file, so a store's
-// files are exactly what they were without locks.
+// Each is a flock on a directory (a slot's own directory, or a copy's),
+// taken through a descriptor of its own. flock belongs to the open file
+// description: the kernel drops it when its holder dies, an unrelated close
+// in the holder does not, and two target objects of one process exclude
+// each other as two processes do. Locking directories needs no lock file,
+// so a store's files are exactly what they were without locks. Which
+// operation takes which lock, and how, is in dual_file_target.h.
 //
-// Judging and reading take the lock shared; every change takes it
-// exclusive. Anyone who can open the directory can hold a conflicting lock
-// for ever, so nobody waits without bound: the lock is tried without
-// blocking until a deadline, with short sleeps between tries.
+// Anyone who can open a directory can hold a conflicting lock for ever, so
+// nobody waits without bound: a lock is tried without blocking until a
+// deadline, with short sleeps between tries.
 #pragma once
 
 #include <chrono>

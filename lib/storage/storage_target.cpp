@@ -60,6 +60,12 @@ fs::path withSuffix(const fs::path& path, const char* suffix) {
 
 std::error_code errorCode(int error) { return std::error_code(error, std::generic_category()); }
 
+// Logs that `what` at `path` stayed locked by another past the bound.
+Status lockTimedOut(const char* what, const std::string& path) {
+    LOGE << what << " " << std::quoted(path) << " is busy: not locked within " << kSlotLockWait.count() << " ms";
+    return STATUS_TIMEOUT;
+}
+
 Status copyFile(const CopyDirectory& from, const CopyDirectory& to) {
     const UniqueFd source = from.open(kDataName, O_RDONLY);
     if (!source) return STATUS_FAILED;
@@ -176,11 +182,7 @@ void DualFileTarget::Slot::refresh(SlotDirectories& directories) const {
     }
 }
 
-Status DualFileTarget::Slot::busy() const {
-    LOGE << "Store " << std::quoted(directoryPath().string()) << " is busy: not locked within " << kSlotLockWait.count()
-         << " ms";
-    return STATUS_TIMEOUT;
-}
+Status DualFileTarget::Slot::busy() const { return lockTimedOut("Store", directoryPath().string()); }
 
 Status DualFileTarget::Slot::lockCurrent(SlotDirectories& directories, SlotLock& lock) const {
     // A begun write of this slot holds the slot's lock: nobody else commits.
@@ -643,9 +645,7 @@ Status lockDeviceUpdate(const char* what, const char* path, SlotLock& lock) {
     SlotLock::Outcome outcome = SlotLock::Outcome::kUnreachable;
     lock =
         SlotLock::take(AT_FDCWD, path, LockMode::kExclusive, std::chrono::steady_clock::now() + kSlotLockWait, outcome);
-    if (outcome != SlotLock::Outcome::kBusy) return STATUS_OK;
-    LOGE << what << " " << std::quoted(path) << " is busy: not locked within " << kSlotLockWait.count() << " ms";
-    return STATUS_TIMEOUT;
+    return outcome == SlotLock::Outcome::kBusy ? lockTimedOut(what, path) : STATUS_OK;
 }
 
 }  // namespace

@@ -38,6 +38,8 @@ std::filesystem::path slotPath(const TargetReport& target, size_t index) {
 std::vector<std::string> damageLines(const TargetReport& target, size_t index, unsigned copy,
                                      const CopyInspection& inspected) {
     std::vector<std::string> lines;
+    // What looks damaged is the half-made copy of a change in progress.
+    if (inspected.beingRewritten) return lines;
     const auto add = [&](const std::filesystem::path& path, const std::string& text) {
         lines.push_back(path.string() + ": " + text);
     };
@@ -246,8 +248,7 @@ bool showsDamage(const StoreReport& report) {
         for (const SlotReport& slot : target.slots) {
             if (slot.inspection.state == SlotState::kLost) return true;
             for (unsigned copy = 0; copy < 2; ++copy) {
-                const CopyInspection& inspected = slot.inspection.copies[copy];
-                if (!inspected.beingRewritten && !damageLines(target, slot.index, copy, inspected).empty()) return true;
+                if (!damageLines(target, slot.index, copy, slot.inspection.copies[copy]).empty()) return true;
             }
         }
     }

@@ -15,6 +15,7 @@ EMPTY = "exists=0 valid=0 read=1 size=0 crc32=00000000"
 FIRST = "exists=1 valid=1 read=0 size=100 crc32=11111111"
 SECOND = "exists=1 valid=1 read=0 size=4000 crc32=22222222"
 MIX = "exists=1 valid=1 read=0 size=4000 crc32=33333333"
+RIVAL = "exists=1 valid=1 read=0 size=2000 crc32=44444444"
 
 
 def report(settings, driver, query="10"):
@@ -79,6 +80,36 @@ class Judgement(unittest.TestCase):
         c = self.started()
         c.follow(["@@ op 1 settings expect=" + SECOND, "@@ ack 1 0 " + MIX])
         self.assertEqual(c.violations, 1)
+
+    def test_a_rival_that_succeeded_may_be_the_one_acknowledged(self):
+        for found, rival_status, violations in ((RIVAL, 0, 0), (SECOND, 0, 0), (RIVAL, 1, 1), (FIRST, 0, 1)):
+            c = self.started()
+            c.follow(["@@ op 1 settings expect=" + SECOND, "@@ rival 1 settings expect=" + RIVAL,
+                      f"@@ rivalack 1 {rival_status}", "@@ queries 1 present=7 absent=0 other=0",
+                      "@@ ack 1 0 " + found])
+            self.assertEqual(c.violations, violations, (found, rival_status))
+            self.assertEqual(c.acknowledged, 2 + (rival_status == 0))
+
+    def test_console_lines_of_any_shape_are_passed_over(self):
+        c = self.started()
+        c.follow(["@@ op 1 settings expect=" + SECOND, "[   3.1] random: crng init done", "@@", "x y z",
+                  "@@ state settings " + FIRST, "@@ ack 1 0 " + SECOND])
+        self.assertEqual((c.violations, c.acknowledged), (0, 2))
+
+    def test_a_cut_beside_a_rival_may_leave_either_blob_or_the_old_one(self):
+        for found, violations in ((FIRST, 0), (SECOND, 0), (RIVAL, 0), (MIX, 1)):
+            c = self.started()
+            c.follow(["@@ op 1 settings expect=" + SECOND, "@@ rival 1 settings expect=" + RIVAL])
+            c.check(report(found, EMPTY, "0"))
+            self.assertEqual(c.violations, violations, found)
+
+    def test_a_query_beside_the_writers_must_not_call_a_present_slot_absent(self):
+        for counts, violations in (("present=5 absent=0 other=0", 0), ("present=4 absent=1 other=0", 1),
+                                   ("present=4 absent=0 other=1", 1)):
+            c = self.started()
+            c.follow(["@@ op 1 settings expect=" + SECOND, "@@ rival 1 settings expect=" + RIVAL,
+                      "@@ rivalack 1 0", f"@@ queries 1 {counts}", "@@ ack 1 0 " + SECOND])
+            self.assertEqual(c.violations, violations, counts)
 
     def test_query_present_must_agree_with_the_slot(self):
         c = self.started()

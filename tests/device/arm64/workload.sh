@@ -16,6 +16,13 @@
 # copy of the stores in memory) and the state it left:
 #   @@ op N KEY expect=STATE
 #   @@ ack N STATUS STATE
+# A migration has a rival: another migration of the same slot with a blob
+# of its own, started beside it, and a loop of --query-present of the slot
+# beside both. They are announced after the operation and reported before
+# its acknowledgement:
+#   @@ rival N KEY expect=STATE
+#   @@ rivalack N STATUS
+#   @@ queries N present=P absent=A other=O
 # With arm64_writer=broken the operations are those of a writer that
 # rewrites the current copy in place, which a power cut can catch.
 . /etc/arm64-device.conf
@@ -81,6 +88,8 @@ make_blobs() {
     # the other candidate.
     cp "$blobs/settings-mid" "$blobs/settings-bad"
     printf '\377\377\377\377' | dd of="$blobs/settings-bad" bs=1 seek=8 conv=notrunc 2>/dev/null
+    "$make_data" settings "$blobs/settings-rival" 2000 >/dev/null
+    "$make_data" overlay "$blobs/overlay-rival" 50000 >/dev/null
     head -c 1048576 "$blobs/overlay-large" >"$blobs/raw-large"
     tail -c 5000 "$blobs/overlay-mid" >"$blobs/raw-small"
 }
@@ -106,6 +115,34 @@ operations() {
     echo driver driver erase
     echo overlay1 tool --target overlay --index 1 --type checked --check overlay --data overlay-large
     echo overlay2 tool --target overlay --index 2 --type simple --data overlay-small
+}
+
+# rival KEY KIND: the migration that runs beside an operation of KIND on
+# KEY, or nothing.
+rival() {
+    [ "$2" = tool ] || return 0
+    case $1 in
+        settings) echo tool --target settings --type simple --data settings-rival ;;
+        overlay*) echo tool --target overlay --index "${1#overlay}" --type simple --data overlay-rival ;;
+    esac
+}
+
+# queries KEY FLAG: --query-present of the slot while FLAG exists, then how
+# many answers said present, absent and anything else.
+queries() {
+    present=0 absent=0 other=0
+    set -- $(slots | while read -r key store count slot target index; do
+        [ "$key" = "$1" ] && echo "$target $index"
+    done) "$2"
+    while [ -e "$3" ]; do
+        "$tool" --base "$stores/app" --target "$1" --index "$2" --query-present >/dev/null 2>&1
+        case $? in
+            0) present=$((present + 1)) ;;
+            10) absent=$((absent + 1)) ;;
+            *) other=$((other + 1)) ;;
+        esac
+    done
+    echo "present=$present absent=$absent other=$other"
 }
 
 # run ROOT KIND ARGS...: one operation on the stores under ROOT.
@@ -148,8 +185,27 @@ while :; do
     cp -a "$stores" "$copy"
     run "$copy" "$@"
     echo "@@ op $op $key expect=$(state "$copy" "$key")"
+    rival_words=$(rival "$key" "$1")
+    if [ -n "$rival_words" ]; then
+        rm -rf "$copy"
+        cp -a "$stores" "$copy"
+        run "$copy" $rival_words
+        echo "@@ rival $op $key expect=$(state "$copy" "$key")"
+        touch /tmp/querying
+        queries "$key" /tmp/querying >/tmp/query-counts &
+        querying=$!
+        run "$stores" $rival_words &
+        rivalling=$!
+    fi
     run "$stores" "$@"
     status=$?
+    if [ -n "$rival_words" ]; then
+        wait "$rivalling"
+        echo "@@ rivalack $op $?"
+        rm -f /tmp/querying
+        wait "$querying"
+        echo "@@ queries $op $(cat /tmp/query-counts)"
+    fi
     echo "@@ ack $op $status $(state "$stores" "$key")"
     op=$((op + 1))
 done

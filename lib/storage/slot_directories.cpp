@@ -49,7 +49,7 @@ std::string slotDirectoryName(size_t slotCount, size_t index) {
 
 Status CopyDirectory::computeCheckAndSync(uint64_t& value) const {
     struct stat status {};
-    const UniqueFd data = open(kDataName, O_RDONLY, 0, &status);
+    const UniqueFd data = openToRead(kDataName, &status);
     if (data) {
         // The check file that vouches for the data must never reach the
         // disk first. Where ext4 allocates blocks as unwritten extents, its
@@ -98,8 +98,14 @@ int CopyDirectory::remove(const char* name) const {
     return ::unlinkat(fd, name, AT_REMOVEDIR) == 0 ? 0 : errno;
 }
 
-UniqueFd CopyDirectory::open(const char* name, int flags, mode_t mode, struct stat* status) const {
-    if (fd >= 0) return openRegularAt(fd, name, flags, mode, status);
+UniqueFd CopyDirectory::openToRead(const char* name, struct stat* status) const {
+    if (fd >= 0) return openRegularAt(fd, name, O_RDONLY, 0, status);
+    errno = missing ? ENOENT : error;
+    return UniqueFd();
+}
+
+UniqueFd CopyDirectory::openToWrite(const char* name, int flags, mode_t mode) const {
+    if (fd >= 0) return openRegularToWriteAt(fd, name, flags, mode);
     errno = missing ? ENOENT : error;
     return UniqueFd();
 }
@@ -132,7 +138,7 @@ UniqueFd SlotDirectories::openForReading(unsigned copy, const char* name, struct
         UniqueFd fd = openRegularBeneath(base.fd, path.c_str(), O_RDONLY, &status);
         if (fd || errno != ENOSYS) return fd;
     }
-    return open(copy).open(name, O_RDONLY, 0, &status);
+    return open(copy).openToRead(name, &status);
 }
 
 fs::path SlotDirectories::copyPath(unsigned copy) const {

@@ -53,9 +53,13 @@ struct CopyDirectory {
     // an empty directory. 0 when done or when there is nothing to remove,
     // else the errno.
     int remove(const char* name) const;
-    // openRegularAt in this directory; errno is ENOENT when the directory is
-    // missing and its own error when it is unusable.
-    UniqueFd open(const char* name, int flags, mode_t mode = 0, struct stat* status = nullptr) const;
+    // openRegularAt for reading in this directory, with the file's fstat in
+    // `status` when not null; errno is ENOENT when the directory is missing
+    // and its own error when it is unusable.
+    UniqueFd openToRead(const char* name, struct stat* status = nullptr) const;
+    // The same for writing with `flags`, through openRegularToWriteAt: never
+    // into a file that has another name.
+    UniqueFd openToWrite(const char* name, int flags, mode_t mode) const;
     // An entry `name` of any kind is there.
     bool holds(const char* name) const;
 };

@@ -67,9 +67,9 @@ Status lockTimedOut(const char* what, const std::string& path) {
 }
 
 Status copyFile(const CopyDirectory& from, const CopyDirectory& to) {
-    const UniqueFd source = from.open(kDataName, O_RDONLY);
+    const UniqueFd source = from.openToRead(kDataName);
     if (!source) return STATUS_FAILED;
-    const UniqueFd target = to.open(kDataName, O_WRONLY | O_CREAT | O_TRUNC, kFileMode);
+    const UniqueFd target = to.openToWrite(kDataName, O_WRONLY | O_CREAT | O_TRUNC, kFileMode);
     if (!target) return STATUS_FAILED;
     uint8_t block[65536];
     for (;;) {
@@ -271,7 +271,7 @@ Status DualFileTarget::Slot::openCopyData(unsigned index, SlotDirectories& direc
     }
     if (const int error = directory.remove(kCheckName)) return static_cast<Status>(error);
     copies_[index].identity = CheckIdentity{};
-    fd = directory.open(kDataName, flags, kFileMode);
+    fd = directory.openToWrite(kDataName, flags, kFileMode);
     if (!fd) logOpenFailure(copies_[index].dataPath.c_str(), errno);
     return fd ? STATUS_OK : STATUS_FAILED;
 }
@@ -284,7 +284,7 @@ Status DualFileTarget::Slot::commit(unsigned index, SlotDirectories& directories
 
     CheckIdentity installed;  // what the check file will be once renamed into place
     {
-        const UniqueFd tmp = directory.open(kTransientName, O_WRONLY | O_CREAT | O_TRUNC, kFileMode);
+        const UniqueFd tmp = directory.openToWrite(kTransientName, O_WRONLY | O_CREAT | O_TRUNC, kFileMode);
         // A failed open is logged here; the write below then fails.
         if (!tmp) logOpenFailure(withSuffix(copy.checkPath, ".tmp").c_str(), errno);
         uint8_t bytes[kCheckValueSize];
@@ -320,7 +320,7 @@ Status DualFileTarget::Slot::commit(unsigned index, SlotDirectories& directories
     // Whatever follows, this file is the copy's check file now.
     copy.identity = installed;
 
-    const UniqueFd check = directory.open(kCheckName, O_RDONLY);
+    const UniqueFd check = directory.openToRead(kCheckName);
     if (!check) {
         logOpenFailure(copy.checkPath.c_str(), errno);
         LOGE_AT(kSyncOpenLine) << "Failed to open path " << std::quoted(copy.checkPath.string()) << " for  fs sync";

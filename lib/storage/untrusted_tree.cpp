@@ -48,6 +48,10 @@ UniqueFd regularOnly(UniqueFd fd, struct stat* status) {
     return fd;
 }
 
+// How often a writer unlinks a name of several links and creates the file
+// afresh before it gives up.
+constexpr int kFreshFileAttempts = 3;
+
 // Cleared by the first openat2 that the kernel does not know.
 std::atomic<bool> kernelOpensBeneath{true};
 
@@ -55,6 +59,32 @@ std::atomic<bool> kernelOpensBeneath{true};
 
 UniqueFd openRegularAt(int directory, const char* name, int flags, mode_t mode, struct stat* status) {
     return regularOnly(UniqueFd(::openat(directory, name, flags | kSafeFlags, mode)), status);
+}
+
+UniqueFd openRegularToWriteAt(int directory, const char* name, int flags, mode_t mode) {
+    const bool truncate = (flags & O_TRUNC) != 0;
+    int openFlags = flags & ~O_TRUNC;
+    // Bounded: someone who plants a link again as fast as it goes is refused.
+    for (int attempt = 0; attempt < kFreshFileAttempts; ++attempt) {
+        struct stat status {};
+        UniqueFd fd = openRegularAt(directory, name, openFlags, mode, &status);
+        if (!fd && attempt > 0 && errno == EEXIST) continue;  // planted again meanwhile
+        if (!fd) return fd;
+        if (status.st_nlink <= 1) {
+            if (truncate && ::ftruncate(fd.get(), 0) != 0) {
+                const int error = errno;
+                fd.reset();
+                errno = error;
+            }
+            return fd;
+        }
+        fd.reset();
+        if (::unlinkat(directory, name, 0) != 0 && errno != ENOENT) return UniqueFd();
+        if (!truncate) break;
+        openFlags |= O_CREAT | O_EXCL;
+    }
+    errno = EMLINK;
+    return UniqueFd();
 }
 
 UniqueFd openRegularBeneath(int directory, const char* path, int flags, struct stat* status) {

@@ -32,6 +32,15 @@ UniqueFd makeDirectoryAt(int parent, const char* name);
 // `status`, when not null, receives the file's fstat.
 UniqueFd openRegularAt(int directory, const char* name, int flags, mode_t mode = 0, struct stat* status = nullptr);
 
+// openRegularAt for writing (`flags` ask for it), sure that the file has no
+// other name before a byte of it changes: a file of several links is
+// someone else's file that a planted link made look like ours. Such a name
+// is unlinked here, so the file's other names keep their bytes; then, with
+// O_TRUNC (the old bytes are not wanted), the file is created afresh, and
+// without it the open fails with EMLINK. O_TRUNC acts only once the file is
+// known to be this name's alone.
+UniqueFd openRegularToWriteAt(int directory, const char* name, int flags, mode_t mode);
+
 // openRegularAt of an existing file (`flags` without O_CREAT) for a
 // relative `path` of any number of components below `directory`, in one
 // call that follows no link anywhere on the way:

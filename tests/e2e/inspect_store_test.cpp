@@ -622,6 +622,7 @@ TEST_F(InspectStore, ABadCommandLineIs2WithUsageOnStandardError) {
 // report names it, nothing is followed or waited on, nothing changes.
 TEST_F(InspectStore, PlantedEntriesAreNamedAndLeftAlone) {
     const testing_support::Victims victims(scratch / "victims");
+    const std::string victimsBefore = testing_support::snapshotTree(scratch / "victims");
     const std::pair<const char*, const char*> places[] = {{"1/data", "data is a "},
                                                           {"1/data.chk", "check file is a "},
                                                           {"1/data.chk.tmp", ""},
@@ -634,14 +635,19 @@ TEST_F(InspectStore, PlantedEntriesAreNamedAndLeftAlone) {
             std::string why;
             if (!testing_support::plantAt(slotDirectory(base, kLut, 3) / place, plant, victims, why)) continue;
             const ProcessResult result = run({"--target", "lut", "--index", "3", "--json"});
-            // A directory where a copy directory belongs is only a copy without files.
-            const bool harmless = std::string(place) == "1" && plant == testing_support::Plant::kDirectory;
-            EXPECT_EQ(result.exitStatus, harmless ? 0 : 1) << result.out << result.err;
+            // A directory where a copy directory belongs is only a copy
+            // without files; a hard link where a file belongs is a file
+            // with someone else's bytes.
+            const bool copyWithoutFiles = std::string(place) == "1" && plant == testing_support::Plant::kDirectory;
+            const bool filesBytes = std::string(place) != "1" && testing_support::isHardLink(plant);
+            EXPECT_EQ(result.exitStatus, copyWithoutFiles || filesBytes ? 0 : 1) << result.out << result.err;
             const JsonValue document = parsed(result);
             if (document.isNull()) continue;
             const JsonValue& slot = document["targets"][0]["slots"][0];
-            if (harmless) {
+            if (copyWithoutFiles) {
                 EXPECT_EQ(slot["copies"][0]["reason"].text, "no check file");
+            } else if (filesBytes && *reason != '\0') {
+                EXPECT_FALSE(slot["copies"][0]["valid"].boolean) << result.out;
             } else if (*reason == '\0') {
                 EXPECT_TRUE(slot["copies"][0]["valid"].boolean);
                 ASSERT_EQ(slot["leftover_tmp"].items.size(), 1u);
@@ -650,6 +656,7 @@ TEST_F(InspectStore, PlantedEntriesAreNamedAndLeftAlone) {
             }
             EXPECT_EQ(slot["state"].text, "present");
             EXPECT_EQ(slot["current"].number, *reason == '\0' ? 1 : 2);
+            EXPECT_EQ(testing_support::snapshotTree(scratch / "victims"), victimsBefore);
         }
     }
 }

@@ -1,8 +1,9 @@
 // The real migrate_settings, as root, over stores into which a less trusted
-// program has planted links, FIFOs, sockets, device nodes and directories:
-// no run writes outside the base directory or waits, and each one either
-// stores the blob or fails.
+// program has planted links (symbolic and hard), FIFOs, sockets, device
+// nodes and directories: no run writes outside the base directory or
+// waits, and each one either stores the blob or fails.
 #include <sys/stat.h>
+#include <unistd.h>
 #include <csignal>
 #include <filesystem>
 #include <iterator>
@@ -12,6 +13,8 @@
 
 #include <gtest/gtest.h>
 
+#include "child_process.h"
+#include "files.h"
 #include "hostile_tree.h"
 #include "scratch_dir.h"
 #include "tool_run.h"
@@ -26,6 +29,8 @@ using testing_support::Plant;
 
 // Long enough for an emulated run; a wait never ends by itself.
 constexpr unsigned kTimeLimitSeconds = 30;
+// The unprivileged user an application runs as.
+constexpr uid_t kNobody = 65534;
 
 class HostileStores : public ::testing::Test {
 protected:
@@ -76,6 +81,100 @@ TEST_F(HostileStores, LinkAtTheOtherCopysDataIsNeverWrittenThrough) {
     EXPECT_EQ(outside(), before);
     EXPECT_TRUE(fs::is_symlink(base / "settings/2/data"));
     EXPECT_EQ(run({"--target", "settings", "--query-present"}).exitStatus, 10);
+}
+
+// Whether one copy of the store at `store` holds `blob` with its check file.
+bool committed(const fs::path& store, const Bytes& blob) {
+    for (const char* copy : {"1", "2"}) {
+        const fs::path data = store / copy / "data";
+        const fs::path check = store / copy / "data.chk";
+        if (fs::is_regular_file(data) && fs::is_regular_file(check) && testing_support::readBytes(data) == blob &&
+            testing_support::readBytes(check) == e2e::checkFileFor(blob)) {
+            return true;
+        }
+    }
+    return false;
+}
+
+// A hard link planted at a copy's data file, to a root-only file on the
+// same file system, used to make the migration into that copy overwrite
+// the file with the blob and exit 0. Both copies are written here, so the
+// plant is met whichever copy is current.
+TEST_F(HostileStores, HardLinkAtADataFileIsNeverWrittenThrough) {
+    plant("app/utilSave/2/data", Plant::kHardLinkToRootOnlyFile);
+    const std::string before = outside();
+    for (int round = 0; round < 2; ++round) {
+        const Bytes blob = e2e::pattern(64 + round, 30);
+        const ProcessResult result =
+            run({"--target", "util_save", "--type", "simple", "--data", dataFile("blob", blob)});
+        expectFinished(result);
+        EXPECT_EQ(result.exitStatus, 0) << result.out;
+        EXPECT_TRUE(committed(base / "app/utilSave", blob)) << "round " << round;
+    }
+    EXPECT_EQ(outside(), before);
+    EXPECT_EQ(run({"--target", "util_save", "--query-present"}).exitStatus, 0);
+}
+
+// A hard link planted at the transient check file used to make the next
+// commit truncate the link's target and write the 8 check bytes into it.
+TEST_F(HostileStores, HardLinkAtTheTransientCheckFileIsNeverWrittenThrough) {
+    plant("app/utilSave/1/data.chk.tmp", Plant::kHardLinkToRootOnlyFile);
+    const std::string before = outside();
+    for (int round = 0; round < 2; ++round) {
+        const Bytes blob = e2e::pattern(64 + round, 40);
+        const ProcessResult result =
+            run({"--target", "util_save", "--type", "simple", "--data", dataFile("blob", blob)});
+        expectFinished(result);
+        EXPECT_EQ(result.exitStatus, 0) << result.out;
+        EXPECT_TRUE(committed(base / "app/utilSave", blob)) << "round " << round;
+    }
+    EXPECT_EQ(outside(), before);
+    EXPECT_FALSE(fs::exists(fs::symlink_status(base / "app/utilSave/1/data.chk.tmp")));
+}
+
+// What /proc/sys/fs/protected_hardlinks holds: "1" where the kernel refuses
+// a user a hard link to a file it does not own.
+std::string protectedHardlinks() {
+    const fs::path setting = "/proc/sys/fs/protected_hardlinks";
+    return fs::exists(setting) ? testing_support::readText(setting).substr(0, 1) : "";
+}
+
+// The plant made as an application makes it: by an unprivileged user who
+// owns the store, linking a root-only file it cannot even read.
+TEST_F(HostileStores, AnApplicationsHardLinkToARootOnlyFileIsNeverWrittenThrough) {
+    if (::geteuid() != 0) GTEST_SKIP() << "needs root, to run the application as nobody and the tool as root";
+    if (protectedHardlinks() != "0") {
+        GTEST_SKIP() << "fs.protected_hardlinks is on here, so no unprivileged user can make this link; "
+                        "the device's kernel, with no init system to turn it on, leaves it off";
+    }
+    const Bytes first = e2e::pattern(50, 50);
+    ASSERT_EQ(run({"--target", "util_save", "--type", "simple", "--data", dataFile("first", first)}).exitStatus, 0);
+    // The application owns its store; the victims lie where it can reach them.
+    for (const fs::path& path : {base / "app/utilSave", base / "app/utilSave/1", base / "app/utilSave/2"}) {
+        fs::create_directories(path);
+        ASSERT_EQ(::chown(path.c_str(), kNobody, kNobody), 0) << path;
+    }
+    fs::permissions(scratch.path(), fs::perms::others_exec, fs::perm_options::add);
+    const fs::path victim = victims.rootOnlyFile();
+    const std::string before = outside();
+    for (const char* place : {"app/utilSave/1/data", "app/utilSave/2/data", "app/utilSave/1/data.chk.tmp"}) {
+        const fs::path where = base / place;
+        const testing_support::ProcessResult planted = testing_support::runInChild([&] {
+            if (::setgid(kNobody) != 0 || ::setuid(kNobody) != 0) return 2;
+            (void)::unlink(where.c_str());
+            return ::link(victim.c_str(), where.c_str()) == 0 ? 0 : 1;
+        });
+        ASSERT_EQ(planted.exitStatus, 0) << "nobody could not link " << victim << " at " << where;
+    }
+    for (int round = 0; round < 2; ++round) {
+        const Bytes blob = e2e::pattern(64 + round, 60);
+        const ProcessResult result =
+            run({"--target", "util_save", "--type", "simple", "--data", dataFile("blob", blob)});
+        expectFinished(result);
+        EXPECT_EQ(result.exitStatus, 0) << result.out;
+        EXPECT_TRUE(committed(base / "app/utilSave", blob)) << "round " << round;
+    }
+    EXPECT_EQ(outside(), before);
 }
 
 // A FIFO planted in one store used to make every run wait forever while

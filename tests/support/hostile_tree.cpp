@@ -19,6 +19,7 @@ namespace {
 
 // Fixed, clearly past times: any write or creation would move them.
 constexpr time_t kVictimTime = 1262304000;  // 2010-01-01
+constexpr uid_t kNobody = 65534;
 
 void setTimes(const fs::path& path) {
     const struct timespec times[2] = {{kVictimTime, 0}, {kVictimTime, 0}};
@@ -46,10 +47,17 @@ void makeSocket(const fs::path& where) {
     check(bound, "bind", where);
 }
 
+bool hardLink(const fs::path& target, const fs::path& where, std::string& reason) {
+    if (::link(target.c_str(), where.c_str()) == 0) return true;
+    reason = "link " + where.string() + " to " + target.string() + ": " + std::strerror(errno);
+    return false;
+}
+
 std::string entryLine(const fs::path& path, const std::string& relative) {
     struct stat status {};
     check(::lstat(path.c_str(), &status) == 0, "lstat", path);
     std::string line = relative + " mode=" + std::to_string(status.st_mode) +
+                       " owner=" + std::to_string(status.st_uid) + ":" + std::to_string(status.st_gid) +
                        " mtime=" + std::to_string(status.st_mtim.tv_sec) + "." + std::to_string(status.st_mtim.tv_nsec);
     if (S_ISREG(status.st_mode)) line += " bytes=" + hex(readBytes(path));
     if (S_ISLNK(status.st_mode)) line += " target=" + fs::read_symlink(path).string();
@@ -60,10 +68,23 @@ std::string entryLine(const fs::path& path, const std::string& relative) {
 }  // namespace
 
 const std::vector<Plant>& allPlants() {
-    static const std::vector<Plant> plants = {
-        Plant::kLinkToFile, Plant::kLinkToDirectory, Plant::kDanglingLink, Plant::kLinkLoop,
-        Plant::kFifo,       Plant::kSocket,          Plant::kDirectory,    Plant::kDeviceNode};
+    static const std::vector<Plant> plants = {Plant::kLinkToFile,
+                                              Plant::kLinkToDirectory,
+                                              Plant::kDanglingLink,
+                                              Plant::kLinkLoop,
+                                              Plant::kFifo,
+                                              Plant::kSocket,
+                                              Plant::kDirectory,
+                                              Plant::kDeviceNode,
+                                              Plant::kHardLinkToFile,
+                                              Plant::kHardLinkToRootOnlyFile,
+                                              Plant::kHardLinkToStoreFile};
     return plants;
+}
+
+bool isHardLink(Plant plant) {
+    return plant == Plant::kHardLinkToFile || plant == Plant::kHardLinkToRootOnlyFile ||
+           plant == Plant::kHardLinkToStoreFile;
 }
 
 std::string plantName(Plant plant) {
@@ -84,17 +105,35 @@ std::string plantName(Plant plant) {
             return "directory";
         case Plant::kDeviceNode:
             return "device_node";
+        case Plant::kHardLinkToFile:
+            return "hard_link_to_file";
+        case Plant::kHardLinkToRootOnlyFile:
+            return "hard_link_to_root_only_file";
+        case Plant::kHardLinkToStoreFile:
+            return "hard_link_to_store_file";
     }
     return "unknown";
 }
 
 Victims::Victims(const fs::path& directory)
-    : file_(directory / "victim-file"), directory_(directory / "victim-directory"), missing_(directory / "missing") {
+    : file_(directory / "victim-file"),
+      rootOnlyFile_(directory / "root-only-file"),
+      storeFile_(directory / "other-store" / "1" / "data"),
+      directory_(directory / "victim-directory"),
+      missing_(directory / "missing") {
     fs::create_directory(directory);
     writeText(file_, "victim bytes\n");
+    if (::geteuid() == 0) check(::chown(file_.c_str(), kNobody, kNobody) == 0, "chown", file_);
+    writeText(rootOnlyFile_, "only root reads these bytes\n");
+    fs::permissions(rootOnlyFile_, fs::perms::owner_read | fs::perms::owner_write);
+    fs::create_directories(storeFile_.parent_path());
+    writeText(storeFile_, "another store's blob\n");
     fs::create_directory(directory_);
     writeText(directory_ / "inside", "inside the victim directory\n");
-    for (const fs::path& path : {directory_ / "inside", file_, directory_, directory}) setTimes(path);
+    for (const fs::path& path : {directory_ / "inside", file_, rootOnlyFile_, storeFile_, storeFile_.parent_path(),
+                                 storeFile_.parent_path().parent_path(), directory_, directory}) {
+        setTimes(path);
+    }
 }
 
 bool plantAt(const fs::path& where, Plant plant, const Victims& victims, std::string& reason) {
@@ -129,6 +168,12 @@ bool plantAt(const fs::path& where, Plant plant, const Victims& victims, std::st
                 return false;
             }
             break;
+        case Plant::kHardLinkToFile:
+            return hardLink(victims.file(), where, reason);
+        case Plant::kHardLinkToRootOnlyFile:
+            return hardLink(victims.rootOnlyFile(), where, reason);
+        case Plant::kHardLinkToStoreFile:
+            return hardLink(victims.storeFile(), where, reason);
     }
     return true;
 }

@@ -6,6 +6,7 @@
 #include <unistd.h>
 #include <cerrno>
 #include <csignal>
+#include <cstring>
 #include <filesystem>
 #include <string>
 
@@ -73,6 +74,79 @@ INSTANTIATE_TEST_SUITE_P(Planted, RegularFilesOnly,
                          [](const ::testing::TestParamInfo<Refusal>& info) {
                              return testing_support::plantName(info.param.plant);
                          });
+
+// The number of names the file `path` has.
+nlink_t linksOf(const fs::path& path) {
+    struct stat status {};
+    return ::lstat(path.c_str(), &status) == 0 ? status.st_nlink : 0;
+}
+
+// A hard link cannot be told from the file's own name by any open: the
+// writer unlinks it, and the other name keeps its bytes.
+TEST_F(UntrustedTree, AWriteWithTruncationReplacesAHardLinkWithAFreshFile) {
+    for (const Plant plant : {Plant::kHardLinkToFile, Plant::kHardLinkToRootOnlyFile, Plant::kHardLinkToStoreFile}) {
+        SCOPED_TRACE(testing_support::plantName(plant));
+        if (!planted("entry", plant)) GTEST_SKIP() << skipReason;
+        const std::string victimsBefore = testing_support::snapshotTree(dir / "victims");
+        const UniqueFd fd =
+            Storage::openRegularToWriteAt(directoryFd.get(), "entry", O_WRONLY | O_CREAT | O_TRUNC, 0640);
+        ASSERT_TRUE(fd) << std::strerror(errno);
+        ASSERT_EQ(::write(fd.get(), "new", 3), 3);
+        EXPECT_EQ(testing_support::readText(dir / "entry"), "new");
+        EXPECT_EQ(linksOf(dir / "entry"), 1U);
+        EXPECT_EQ(testing_support::snapshotTree(dir / "victims"), victimsBefore);
+        EXPECT_EQ(linksOf(victims.file()), 1U);
+        EXPECT_EQ(linksOf(victims.rootOnlyFile()), 1U);
+        EXPECT_EQ(linksOf(victims.storeFile()), 1U);
+    }
+}
+
+// Without O_TRUNC the old bytes are wanted, and a hard link's are not
+// ours: the name goes and the open fails as on a damaged file.
+TEST_F(UntrustedTree, AWriteKeepingTheBytesRefusesAHardLink) {
+    if (!planted("entry", Plant::kHardLinkToFile)) GTEST_SKIP() << skipReason;
+    const std::string victimsBefore = testing_support::snapshotTree(dir / "victims");
+    const UniqueFd fd = Storage::openRegularToWriteAt(directoryFd.get(), "entry", O_RDWR | O_CREAT, 0640);
+    EXPECT_FALSE(fd);
+    EXPECT_EQ(errno, EMLINK);
+    EXPECT_FALSE(fs::exists(fs::symlink_status(dir / "entry")));
+    EXPECT_EQ(testing_support::snapshotTree(dir / "victims"), victimsBefore);
+    EXPECT_EQ(linksOf(victims.file()), 1U);
+}
+
+// A file with one name is opened as it is: truncated when asked, its bytes
+// kept when not, and the same file either way.
+TEST_F(UntrustedTree, AWriteOpensAFileOfOneNameInPlace) {
+    testing_support::writeText(dir / "kept", "kept bytes");
+    testing_support::writeText(dir / "cut", "cut bytes");
+    struct stat keptBefore {};
+    struct stat cutBefore {};
+    ASSERT_EQ(::stat((dir / "kept").c_str(), &keptBefore), 0);
+    ASSERT_EQ(::stat((dir / "cut").c_str(), &cutBefore), 0);
+
+    const UniqueFd kept = Storage::openRegularToWriteAt(directoryFd.get(), "kept", O_RDWR, 0);
+    ASSERT_TRUE(kept);
+    const UniqueFd cut = Storage::openRegularToWriteAt(directoryFd.get(), "cut", O_WRONLY | O_TRUNC, 0);
+    ASSERT_TRUE(cut);
+    EXPECT_EQ(testing_support::readText(dir / "kept"), "kept bytes");
+    EXPECT_EQ(testing_support::readText(dir / "cut"), "");
+    struct stat keptAfter {};
+    struct stat cutAfter {};
+    ASSERT_EQ(::fstat(kept.get(), &keptAfter), 0);
+    ASSERT_EQ(::fstat(cut.get(), &cutAfter), 0);
+    EXPECT_EQ(keptAfter.st_ino, keptBefore.st_ino);
+    EXPECT_EQ(cutAfter.st_ino, cutBefore.st_ino);
+    EXPECT_NE(::fcntl(cut.get(), F_GETFD) & FD_CLOEXEC, 0);
+}
+
+// The write open refuses what is not a regular file as the read open does.
+TEST_F(UntrustedTree, AWriteRefusesALinkWithoutTouchingItsTarget) {
+    if (!planted("entry", Plant::kLinkToFile)) GTEST_SKIP() << skipReason;
+    const std::string victimsBefore = testing_support::snapshotTree(dir / "victims");
+    EXPECT_FALSE(Storage::openRegularToWriteAt(directoryFd.get(), "entry", O_WRONLY | O_CREAT | O_TRUNC, 0640));
+    EXPECT_EQ(errno, ELOOP);
+    EXPECT_EQ(testing_support::snapshotTree(dir / "victims"), victimsBefore);
+}
 
 TEST_F(UntrustedTree, RegularFileOpensWithItsStatus) {
     testing_support::writeText(dir / "file", "twelve bytes");

@@ -25,6 +25,9 @@ mount -t tmpfs -o mode=1777 tmpfs /dev/shm
 chmod 1777 /tmp
 # Only the kernel's errors on the console: the tests report over it.
 dmesg -n 1
+# A device whose init does not turn it on: any user may hard-link any file
+# it can reach, and the tests plant such links as an application would.
+echo 0 >/proc/sys/fs/protected_hardlinks
 
 . /etc/arm64-device.conf
 for module in $modules; do

@@ -280,8 +280,19 @@ std::string caseName(const ::testing::TestParamInfo<HostileStoreSweep::ParamType
            testing_support::plantName(std::get<1>(info.param));
 }
 
+// Each case costs five runs of the tool, and a run costs the emulated
+// device twenty to fifty times what it costs the host: there the tool meets
+// every plant at a data, check and transient file and at both kinds of
+// directory (the places of copy 1 take the first write after the plant),
+// while the library's sweep, in one process, covers every place there too.
+#ifdef MIGRATE_SETTINGS_ON_DEVICE
+const size_t kSweptPlaces[] = {3, 4, 5, 6, 8};
+#else
+const size_t kSweptPlaces[] = {0, 1, 2, 3, 4, 5, 6, 7, 8};
+#endif
+
 INSTANTIATE_TEST_SUITE_P(Planted, HostileStoreSweep,
-                         ::testing::Combine(::testing::Range<size_t>(0, std::size(kPlaces)),
+                         ::testing::Combine(::testing::ValuesIn(kSweptPlaces),
                                             ::testing::ValuesIn(testing_support::allPlants())),
                          caseName);
 

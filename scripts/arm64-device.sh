@@ -16,9 +16,10 @@
 #   arm64-device.sh faults [--full|--broken]
 #                                    real faults of the card under the stores: reads and writes
 #                                    failing, a full and a read-only file system, on ext4 and
-#                                    f2fs (tests/device/arm64/faults.sh); CI's few cases, or every
-#                                    case; each ends with a broken store that must be caught
-#                                    (--broken: only that)
+#                                    f2fs, and under the boot file's and the resource partition's
+#                                    updates (tests/device/arm64/faults.sh); CI's few cases, or
+#                                    every case; each ends with a broken store that must be
+#                                    caught (--broken: only that)
 # test, shell, power-cuts, replay and faults build first (again only what changed). Exit
 # status: 0 when everything passed; 1 otherwise (a failed test, a boot that
 # did not reach its end in time, a violation).

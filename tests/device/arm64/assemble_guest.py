@@ -27,7 +27,7 @@ PROGRAM_PACKAGES = ["dash", "bash", "coreutils", "util-linux", "mount", "fdisk",
 PROGRAMS = [
     "bin/dash", "bin/bash", "bin/mountpoint", "sbin/sfdisk", "sbin/losetup", "bin/mount", "bin/umount", "usr/bin/unshare", "usr/bin/setpriv",
     "usr/bin/nsenter", "sbin/mke2fs", "sbin/e2fsck", "sbin/tune2fs", "sbin/dumpe2fs", "sbin/dmsetup",
-    "usr/bin/strace", "sbin/mkfs.f2fs", "sbin/fsck.f2fs", "usr/sbin/filefrag", "usr/bin/fallocate",
+    "usr/bin/strace", "sbin/mkfs.f2fs", "sbin/fsck.f2fs", "sbin/f2fs_io", "usr/sbin/filefrag", "usr/bin/fallocate",
 ]
 # Every program of these directories of coreutils, ahead of busybox's.
 WHOLE_PACKAGES = ["coreutils"]

@@ -8,7 +8,9 @@
 # card). An exact step of an operation is reached by letting the operation
 # stop itself before its Nth mutating call on the store (the
 # fault-injection shim's FAULT_ACTION=stop), switching the table, and
-# continuing it: the call then meets the kernel's own failure.
+# continuing it: the call then meets the kernel's own failure. The boot
+# file's update and the resource partition's image write meet the same
+# failing writes on their own partitions.
 #
 #   faults.sh bounded   CI's cases: a few steps of each operation
 #   faults.sh full      every step, recovery and free-space level
@@ -29,13 +31,14 @@
 #   @@ faults: C cases, A acknowledged, L lost, H hangs, K crashes
 #   @@ faults: F failed otherwise
 #   @@ faults: S failures without a log line
-#   @@ faults: B boot-file updates returned 0 while the card kept the old file
+#   @@ faults: B boot-file and partition updates returned 0 while the card kept the old one
 #   @@ broken store: ... (the same lines)
 #   @@ end of faults
 #
 # RESULT is ok, lost (a slot serving neither blob, or tools that disagree),
 # hang (a run past $run_limit s), crash (a run ended by a signal), failed
-# (a next migration that failed) or, for the boot file, stale. A failure
+# (a next migration that failed) or, for the boot file and the partition
+# image, stale. A failure
 # without a log line is named as such and counted, not failed.
 set -u
 . /etc/arm64-device.conf
@@ -108,17 +111,40 @@ make_fs() {
     mount -t "$fs" -o "$(mount_options)" /dev/mapper/faults "$mnt"
 }
 
+# unmount DIRECTORY: within a minute, or the campaign cannot go on: an
+# unmount stuck in the kernel cannot be killed.
+unmount() {
+    local pid waited=0
+    umount "$1" &
+    pid=$!
+    while kill -0 "$pid" 2>/dev/null; do
+        if [ "$waited" -ge 600 ]; then
+            hangs=$((hangs + 1))
+            echo "@@ the unmount of $1 ($fs) did not return within 60 s: the campaign stops"
+            totals
+            echo "@@ end of faults after $((SECONDS - start)) s"
+            exit 1
+        fi
+        sleep 0.1
+        waited=$((waited + 1))
+    done
+    wait "$pid" || echo "@@ the unmount of $1 ($fs) failed"
+}
+
 # recover card|cut: the card works again and the device boots as usual, or
 # the power went during the fault and the device boots on what reached it.
+# Without power f2fs would retry its checkpoint's writes at the unmount for
+# good: it is shut down first, without a sync.
 recover() {
     if [ "$1" = card ]; then
         table "$linear"
-        timeout 60 umount "$mnt" || echo "@@ umount after the fault failed"
+        unmount "$mnt"
         repair /dev/mapper/faults
         mount -t "$fs" -o "$(mount_options)" /dev/mapper/faults "$mnt"
     else
         table "$power_gone"
-        timeout 60 umount "$mnt" || { echo "@@ umount without power failed"; umount -l "$mnt"; }
+        [ "$fs" = ext4 ] || f2fs_io shutdown 2 "$mnt" >/dev/null
+        unmount "$mnt"
         dmsetup remove faults
         blockdev --flushbufs "$part"
         repair "$part"
@@ -427,7 +453,7 @@ boot_case() {
     fi
     op_status=$(sed -n 's/^finalise \([0-9]*\) .*/\1/p' "$work/op.log")
     if [ "$recovery" = cut ]; then table "0 $size error" bootfaults; else table "$boot_linear" bootfaults; fi
-    timeout 60 umount /media/boot || umount -l /media/boot
+    unmount /media/boot
     dmsetup remove bootfaults
     blockdev --flushbufs /dev/mmcblk0p1
     fs=ext4 repair /dev/mmcblk0p1
@@ -453,6 +479,85 @@ boot_case() {
         mount -o remount,rw /media/boot && cp "$work/boot-old" /media/boot/BOOT.BIN && sync
         mount -o remount,ro /media/boot
     fi
+}
+
+# Case 5: the resource partition's image written while the card fails
+# writes, from before the update (STEP 0) or from its STEPth mutating call
+# on the device on, then RECOVERY; judged as the boot file. The product
+# writes the fixed /dev/mmcblk0p2: in a mount namespace of the update's own
+# that node is the faults device's (a bind mount), and /media/resources is
+# mounted from it.
+partition_update() {
+    unshare -m sh -c 'mount --bind "$1" /dev/mmcblk0p2 && mount "$1" /media/resources && shift && exec "$@"' \
+        sh /dev/mapper/partfaults "${wrap[@]}" "$boot_driver" partition-update "$work/part-new"
+}
+
+# The resource partition's marker: new, old or neither.
+resources_marker() {
+    mount -o ro /dev/mmcblk0p2 /media/resources 2>/dev/null || { echo neither; return; }
+    case $(cat /media/resources/resources.id 2>/dev/null) in
+        "faulted resources") echo new ;;
+        "simulated resource partition") echo old ;;
+        *) echo neither ;;
+    esac
+    umount /media/resources
+}
+
+partition_case() {
+    local step=$1 recovery=$2 size served why part_linear attempt
+    size=$(blockdev --getsz /dev/mmcblk0p2)
+    part_linear="0 $size linear /dev/mmcblk0p2 0"
+    if [ ! -f "$work/part-new" ]; then
+        umount /media/resources 2>/dev/null
+        # The update's image: a smaller ext4 whose marker differs; only its
+        # 8 MiB of the partition change, and are put back after each case.
+        mkdir -p "$work/part-root"
+        echo "faulted resources" >"$work/part-root/resources.id"
+        mkfs.ext4 -q -F -b 4096 -d "$work/part-root" -E nodiscard "$work/part-new" 8M
+        dd if=/dev/mmcblk0p2 of="$work/part-old" bs=1M count=8 2>/dev/null
+    fi
+    dm_create partfaults "$part_linear"
+    outcome=ok
+    if [ "$step" = 0 ]; then
+        table "0 $size flakey /dev/mmcblk0p2 0 0 86400 1 error_writes" partfaults
+        wrap=(timeout -k 5 "$run_limit")
+        partition_update >"$work/op.log" 2>&1
+        status=$?
+        judge_status
+    else
+        fault_at "$step" /dev/mmcblk0p2 "0 $size flakey /dev/mmcblk0p2 0 0 86400 1 error_writes" partfaults \
+            partition_update
+    fi
+    op_status=$(sed -n 's/^finalise \([0-9]*\)$/\1/p' "$work/op.log")
+    if [ "$recovery" = cut ]; then table "0 $size error" partfaults; else table "$part_linear" partfaults; fi
+    # The namespace's mount goes with its last process, not at once.
+    for attempt in 1 2 3 4 5 6 7 8 9 10; do
+        dmsetup remove partfaults 2>/dev/null && break
+        sleep 0.5
+    done
+    blockdev --flushbufs /dev/mmcblk0p2
+    fs=ext4 repair /dev/mmcblk0p2
+    served=$(resources_marker)
+    cases=$((cases + 1))
+    why=
+    if [ "${op_status:-none}" = 0 ]; then
+        acknowledged=$((acknowledged + 1))
+        [ "$served" = new ] || why="finalise returned 0, the partition holds the $served image"
+    fi
+    if [ "$outcome" = ok ] && [ -n "$why" ]; then
+        if [ "$served" = old ]; then outcome=stale stale=$((stale + 1)); else outcome=lost lost=$((lost + 1)); fi
+    fi
+    echo "@@ case $cases ext4 partition-image writes-fail@$step $recovery: finalise=${op_status:-none}" \
+        "served=$served $outcome${why:+ ($why)} [log: $(grep -E 'Failed|failed|rror' "$work/op.log" | head -n 2 |
+            tr '\n' ' ' | sed 's/ *$//')]"
+    [ "$served" = old ] || dd if="$work/part-old" of=/dev/mmcblk0p2 bs=1M conv=fsync 2>/dev/null
+}
+
+partition_steps() {
+    case $set_name in
+        full) echo 0:cut 1:cut 2:cut 2:card 1025:cut 2050:cut ;;
+        bounded) echo 2:cut ;;
+    esac
 }
 
 boot_steps() {
@@ -502,7 +607,8 @@ space_levels() {
 # campaign NAME: every case of the set on ext4 and f2fs, and the boot file;
 # the broken store's commits on ext4 only. Its totals line starts with NAME.
 campaign() {
-    local name=$1 operations="commit begun-write erase" file_systems="ext4 f2fs"
+    name=$1
+    local operations="commit begun-write erase" file_systems="ext4 f2fs"
     cases=0 acknowledged=0 lost=0 hangs=0 crashes=0 failed=0 silent=0 stale=0
     [ "$broken" = 0 ] || operations=commit file_systems=ext4
     for fs in $file_systems; do
@@ -523,11 +629,16 @@ campaign() {
     done
     if [ "$broken" = 0 ]; then
         for choice in $(boot_steps); do boot_case "${choice%%:*}" "${choice#*:}"; done
+        for choice in $(partition_steps); do partition_case "${choice%%:*}" "${choice#*:}"; done
     fi
+    totals
+}
+
+totals() {
     echo "@@ $name: $cases cases, $acknowledged acknowledged, $lost lost, $hangs hangs, $crashes crashes"
     echo "@@ $name: $failed failed otherwise"
     echo "@@ $name: $silent failures without a log line"
-    echo "@@ $name: $stale boot-file updates returned 0 while the card kept the old file"
+    echo "@@ $name: $stale boot-file and partition updates returned 0 while the card kept the old one"
 }
 
 case $set_name in bounded | full | broken) ;; *)

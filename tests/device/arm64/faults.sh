@@ -111,16 +111,15 @@ make_fs() {
     mount -t "$fs" -o "$(mount_options)" /dev/mapper/faults "$mnt"
 }
 
-# unmount DIRECTORY: within a minute, or the campaign cannot go on: an
-# unmount stuck in the kernel cannot be killed.
-unmount() {
-    local pid waited=0
-    umount "$1" &
-    pid=$!
+# await PID SECONDS WHAT: waits for the background job PID, which must end
+# within SECONDS, or the campaign cannot go on: a process stuck in the
+# kernel dies of no signal. Returns the job's status.
+await() {
+    local pid=$1 limit=$(($2 * 10)) waited=0
     while kill -0 "$pid" 2>/dev/null; do
-        if [ "$waited" -ge 600 ]; then
+        if [ "$waited" -ge "$limit" ]; then
             hangs=$((hangs + 1))
-            echo "@@ the unmount of $1 ($fs) did not return within 60 s: the campaign stops"
+            echo "@@ $3 ($fs) did not return within $2 s: the campaign stops"
             totals
             echo "@@ end of faults after $((SECONDS - start)) s"
             exit 1
@@ -128,8 +127,18 @@ unmount() {
         sleep 0.1
         waited=$((waited + 1))
     done
-    wait "$pid" || echo "@@ the unmount of $1 ($fs) failed"
+    wait "$pid"
 }
+
+# within SECONDS COMMAND...: COMMAND under await.
+within() {
+    local limit=$1
+    shift
+    "$@" &
+    await $! "$limit" "$*"
+}
+
+unmount() { within 60 umount "$1" || echo "@@ the unmount of $1 ($fs) failed"; }
 
 # recover card|cut: the card works again and the device boots as usual, or
 # the power went during the fault and the device boots on what reached it.
@@ -139,16 +148,16 @@ recover() {
     if [ "$1" = card ]; then
         table "$linear"
         unmount "$mnt"
-        repair /dev/mapper/faults
-        mount -t "$fs" -o "$(mount_options)" /dev/mapper/faults "$mnt"
+        within 120 repair /dev/mapper/faults
+        within 60 mount -t "$fs" -o "$(mount_options)" /dev/mapper/faults "$mnt"
     else
         table "$power_gone"
         [ "$fs" = ext4 ] || f2fs_io shutdown 2 "$mnt" >/dev/null
         unmount "$mnt"
         dmsetup remove faults
         blockdev --flushbufs "$part"
-        repair "$part"
-        mount -t "$fs" -o "$(mount_options)" "$part" "$mnt"
+        within 120 repair "$part"
+        within 60 mount -t "$fs" -o "$(mount_options)" "$part" "$mnt"
     fi
 }
 
@@ -322,7 +331,8 @@ fault_at() {
     done
     table "$new_table" "$device"
     for stopped_pid in $(stopped); do kill -CONT "$stopped_pid"; done
-    wait "$pid"
+    # Past its own time limit only when stuck in the kernel.
+    await "$pid" $((run_limit + 30)) "the operation at step $step"
     status=$?
     op_status=$status
     judge_status

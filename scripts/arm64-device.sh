@@ -13,7 +13,14 @@
 #                                    that, the stores of N (1 or 3) slots only; --scenarios: of
 #                                    that, these scenarios only (e.g. WEA,TTT); FS: only these
 #                                    file systems (ext4, ext4-journal, ext4-writeback, f2fs)
-# test, shell, power-cuts and replay build first (again only what changed). Exit
+#   arm64-device.sh faults [--full|--broken]
+#                                    real faults of the card under the stores: reads and writes
+#                                    failing, a full and a read-only file system, on ext4 and
+#                                    f2fs, and under the boot file's and the resource partition's
+#                                    updates (tests/device/arm64/faults.sh); CI's few cases, or
+#                                    every case; each ends with a broken store that must be
+#                                    caught (--broken: only that)
+# test, shell, power-cuts, replay and faults build first (again only what changed). Exit
 # status: 0 when everything passed; 1 otherwise (a failed test, a boot that
 # did not reach its end in time, a violation).
 set -euo pipefail
@@ -27,7 +34,7 @@ card=$out/card.img
 assembled=$out/guest-assembled
 
 usage() {
-  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED] | replay [--quick|--sample|--clock=CLOCK [--slots=N] [--scenarios=S,...]] [FS...]" >&2
+  echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED] | replay [--quick|--sample|--clock=CLOCK [--slots=N] [--scenarios=S,...]] [FS...] | faults [--full|--broken]" >&2
   exit 2
 }
 
@@ -157,6 +164,37 @@ run_replay() {
   fi
 }
 
+# The faults' set (bounded, full or broken) in the guest, its cases on the
+# console; fails unless the store lost nothing, nothing hung or crashed and
+# the broken store lost a blob.
+run_faults() {
+  local set=$1 limit=$2
+  build
+  local log=$out/faults-$set-console.log work=$out/faults-card.img start=$SECONDS
+  fresh_card "$work"
+  boot "faults arm64_faults=$set" "$limit" "$work" </dev/null | sed -u 's/\r$//' | tee "$log" |
+    grep --line-buffered -E '^(@@ |arm64-device:)' | sed -u 's/^@@ //' || true
+  rm -f "$work"
+  echo "=== arm64-device faults $set: $((SECONDS - start)) s"
+  if ! grep -q '^@@ end of faults' "$log"; then
+    echo "arm64-device: the guest did not reach the end of the faults (console: $log)" >&2
+    return 1
+  fi
+  local totals='[0-9]+ cases, [0-9]+ acknowledged, [0-9]+ lost, [0-9]+ hangs, [0-9]+ crashes$'
+  if [ "$set" != broken ]; then
+    grep -qE "^@@ faults: $totals" "$log" || { echo "arm64-device: no totals line (console: $log)" >&2; return 1; }
+    if ! grep -qE '^@@ faults: [0-9]+ cases, [0-9]+ acknowledged, 0 lost, 0 hangs, 0 crashes$' "$log" ||
+      ! grep -q '^@@ faults: 0 failed otherwise$' "$log"; then
+      echo "arm64-device: the store failed under faults (console: $log)" >&2
+      return 1
+    fi
+  fi
+  if ! grep -qE "^@@ broken store: $totals" "$log" || grep -qE '^@@ broken store: [0-9]+ cases, [0-9]+ acknowledged, 0 lost' "$log"; then
+    echo "arm64-device: the broken store was not caught (console: $log)" >&2
+    return 1
+  fi
+}
+
 case ${1:-} in
   build) mkdir -p "$out"; build ;;
   test) mkdir -p "$out"; run_tests ;;
@@ -193,6 +231,15 @@ case ${1:-} in
       case $file_system in ext4 | ext4-journal | ext4-writeback | f2fs) ;; *) usage ;; esac
     done
     run_replay "$set_name" "$limit" "$@"
+    ;;
+  faults)
+    mkdir -p "$out"
+    case ${2:-} in
+      "") run_faults bounded 900 ;;
+      --full) run_faults full 14400 ;;
+      --broken) run_faults broken 900 ;;
+      *) usage ;;
+    esac
     ;;
   *) usage ;;
 esac

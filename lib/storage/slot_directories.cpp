@@ -47,7 +47,8 @@ std::string slotDirectoryName(size_t slotCount, size_t index) {
     return slotCount == 1 ? std::string() : std::to_string(index);
 }
 
-Status CopyDirectory::computeCheckAndSync(uint64_t& value) const {
+Status CopyDirectory::computeCheckAndSync(uint64_t& value, int& syncError) const {
+    syncError = 0;
     struct stat status {};
     const UniqueFd data = openToRead(kDataName, &status);
     if (data) {
@@ -61,7 +62,9 @@ Status CopyDirectory::computeCheckAndSync(uint64_t& value) const {
         if (const Status computed = computeCheckValue(data.get(), status, value); computed != STATUS_OK) {
             return computed;
         }
-        return ::fsync(data.get()) == 0 ? STATUS_OK : STATUS_FAILED;
+        if (::fsync(data.get()) == 0) return STATUS_OK;
+        syncError = errno;
+        return STATUS_FAILED;
     }
     if (errno != ENOENT) return STATUS_FAILED;
     value = kAbsentBlobCheckValue;

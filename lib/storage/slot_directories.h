@@ -41,8 +41,10 @@ struct CopyDirectory {
 
     // The check value of the data file (check_value.h), once the file is
     // on the medium (fsync); a missing file, or a missing directory, holds
-    // an absent blob. STATUS_FAILED when it cannot be computed or synced.
-    [[nodiscard]] Status computeCheckAndSync(uint64_t& value) const;
+    // an absent blob. STATUS_FAILED when it cannot be computed or synced;
+    // `syncError` is then the fsync's errno, or 0 when the sync was not
+    // what failed.
+    [[nodiscard]] Status computeCheckAndSync(uint64_t& value, int& syncError) const;
     // The modification time of the check file; unknown unless it is a
     // regular file.
     CheckTime checkTime() const;

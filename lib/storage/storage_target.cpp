@@ -280,7 +280,16 @@ Status DualFileTarget::Slot::commit(unsigned index, SlotDirectories& directories
     Copy& copy = copies_[index];
     const CopyDirectory directory = directories.open(index);
     uint64_t value = 0;
-    if (directory.computeCheckAndSync(value) != STATUS_OK) return STATUS_FAILED;
+    int syncError = 0;
+    if (directory.computeCheckAndSync(value, syncError) != STATUS_OK) {
+        // A card that fails its writes says so here first, before the
+        // check file is touched.
+        if (syncError != 0) {
+            LOGE << "Failed to sync " << std::quoted(copy.dataPath.string()) << ": " << std::strerror(syncError) << " ("
+                 << syncError << ")";
+        }
+        return STATUS_FAILED;
+    }
 
     CheckIdentity installed;  // what the check file will be once renamed into place
     {
@@ -720,6 +729,9 @@ Status FirmwareUpdateBootTarget::Slot::compareWithDestination() {
         logOpenFailure(destination_.c_str(), errno);
         return STATUS_INVALID_OPERATION;
     }
+    // Pages whose write-back the card refused stay cached as if stored;
+    // dropped, they are read again from the card.
+    (void)::posix_fadvise(file.get(), 0, 0, POSIX_FADV_DONTNEED);
 
     (void)::lseek(receive_.get(), 0, SEEK_SET);
     uint8_t received[kCompareBlock];
@@ -779,6 +791,10 @@ Status FirmwareUpdateBootTarget::Slot::writeDestination() {
             uint32_t written = 0;
             status = copyToDestination(file.get(), written);
             LOGI << "Wrote " << written << " bytes";
+            // The read-back must judge what the card holds: the write-back
+            // is settled here, and a failed one is caught by the compare,
+            // which reads past the page cache.
+            (void)::fsync(file.get());
             file.reset();
         }
         // Read back whatever the attempt did, even a failed open.

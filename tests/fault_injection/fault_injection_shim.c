@@ -37,6 +37,10 @@
  *                          flushing
  *                        short:BYTES  write and pwrite transfer at most
  *                          BYTES; any other call is made unchanged
+ *                        stop  the process stops itself with SIGSTOP
+ *                          before the call, and makes it once continued:
+ *                          a test changes what lies under the file system
+ *                          (the device's table, say) at an exact call
  *   FAULT_PATH_SUBSTR  only calls whose file's path contains this text are
  *                      counted, recorded and given the fake time. Path
  *                      arguments are matched as given (a relative path
@@ -90,6 +94,12 @@
  *                      is recorded). The program's own utimensat and
  *                      futimens are left as they are. Works without
  *                      FAULT_CALL.
+ *   FAULT_WRITE_ERRORS "ignore": a write, pwrite, writev, pwritev, fsync,
+ *                      fdatasync or syncfs that fails (in the kernel or
+ *                      through FAULT_ACTION) returns success instead, a
+ *                      write as though it wrote every byte: a store that
+ *                      ignores its device's failures, which a test must
+ *                      catch. Works without FAULT_CALL.
  *   FAULT_LOCKS        "off": flock takes and drops no lock and returns 0,
  *                      so every lock is granted at once and nobody is kept
  *                      out; how a test shows what the locks prevent. Works
@@ -209,7 +219,7 @@ static const struct ErrnoName kErrnoNames[] = {
     {"ENOSYS", ENOSYS},
 };
 
-enum Action { ACTION_NONE, ACTION_ERRNO, ACTION_CRASH, ACTION_SHORT };
+enum Action { ACTION_NONE, ACTION_ERRNO, ACTION_CRASH, ACTION_SHORT, ACTION_STOP };
 
 enum Verdict { VERDICT_PROCEED, VERDICT_FAIL, VERDICT_SHORT };
 
@@ -233,6 +243,7 @@ static struct {
     int hasClock;
     time_t clock;
     int locksOff;
+    int writeErrorsIgnored;
     pid_t pid;
 } config;
 
@@ -342,6 +353,8 @@ static void parseAction(const char* value) {
     unsigned long number = 0;
     if (strcmp(value, "crash") == 0) {
         config.action = ACTION_CRASH;
+    } else if (strcmp(value, "stop") == 0) {
+        config.action = ACTION_STOP;
     } else if (strncmp(value, "errno:", 6) == 0) {
         const char* error = value + 6;
         config.action = ACTION_ERRNO;
@@ -360,7 +373,7 @@ static void parseAction(const char* value) {
         config.action = ACTION_SHORT;
         config.shortLength = number;
     } else {
-        configError("FAULT_ACTION", value, "expected errno:NAME, errno:NUMBER, crash or short:BYTES");
+        configError("FAULT_ACTION", value, "expected errno:NAME, errno:NUMBER, crash, short:BYTES or stop");
     }
 }
 
@@ -397,12 +410,13 @@ static void loadConfig(void) {
     const char* record = setting("FAULT_RECORD");
     const char* clock = setting("FAULT_MTIME");
     const char* locks = setting("FAULT_LOCKS");
+    const char* writeErrors = setting("FAULT_WRITE_ERRORS");
 
     if (call == NULL && (nth != NULL || action != NULL || countFile != NULL ||
                          (pathSubstr != NULL && record == NULL && clock == NULL))) {
         configError("FAULT_CALL", NULL, "missing, but other FAULT_ variables are set");
     }
-    if (call == NULL && record == NULL && clock == NULL && locks == NULL) return;
+    if (call == NULL && record == NULL && clock == NULL && locks == NULL && writeErrors == NULL) return;
     if (call != NULL) {
         config.counting = 1;
         config.family = -1;
@@ -426,6 +440,10 @@ static void loadConfig(void) {
     if (locks != NULL) {
         if (strcmp(locks, "off") != 0) configError("FAULT_LOCKS", locks, "expected off");
         config.locksOff = 1;
+    }
+    if (writeErrors != NULL) {
+        if (strcmp(writeErrors, "ignore") != 0) configError("FAULT_WRITE_ERRORS", writeErrors, "expected ignore");
+        config.writeErrorsIgnored = 1;
     }
     if (pathSubstr != NULL) {
         if (!copyValue(config.pathSubstr, sizeof config.pathSubstr, pathSubstr)) {
@@ -452,6 +470,7 @@ static void loadConfig(void) {
     unsetenv("FAULT_RECORD");
     unsetenv("FAULT_MTIME");
     unsetenv("FAULT_LOCKS");
+    unsetenv("FAULT_WRITE_ERRORS");
 }
 
 /* True when calls are to be inspected. Loads the configuration on first
@@ -561,6 +580,10 @@ static enum Verdict decide(const char* function, enum Family family, int mutatin
             return VERDICT_FAIL;
         case ACTION_SHORT:
             return VERDICT_SHORT;
+        case ACTION_STOP:
+            rawSyscall(SYS_kill, rawSyscall(SYS_getpid), SIGSTOP);
+            errno = saved;
+            break;
         case ACTION_NONE:
             break;
     }
@@ -586,6 +609,20 @@ static int openMutates(int flags) {
 static int openNeedsMode(int flags) { return (flags & O_CREAT) != 0 || (flags & O_TMPFILE) == O_TMPFILE; }
 
 static size_t shortened(size_t count) { return count < config.shortLength ? count : config.shortLength; }
+
+/* A failed write's or sync's result as the caller is to see it. */
+static ssize_t writeResult(ssize_t result, size_t wanted) {
+    const int saved = errno;
+    const int ignored = result < 0 && enabled() && config.writeErrorsIgnored;
+    errno = saved;
+    return ignored ? (ssize_t)wanted : result;
+}
+
+static size_t vectorBytes(const struct iovec* vector, int count) {
+    size_t total = 0;
+    for (int i = 0; i < count; ++i) total += vector[i].iov_len;
+    return total;
+}
 
 /* ---- recording and the fake clock ---- */
 
@@ -1061,7 +1098,7 @@ static ssize_t forwardWrite(void** slot, const char* symbol, int positioned, int
     const enum Family family = positioned ? FAMILY_PWRITE : FAMILY_WRITE;
     switch (decide(positioned ? "pwrite" : "write", family, 1, target)) {
         case VERDICT_FAIL:
-            return -1;
+            return writeResult(-1, count);
         case VERDICT_SHORT:
             count = shortened(count);
             break;
@@ -1072,7 +1109,7 @@ static ssize_t forwardWrite(void** slot, const char* symbol, int positioned, int
     const ssize_t done = positioned ? ((PwriteFn)real)(fd, data, count, offset) : ((WriteFn)real)(fd, data, count);
     const struct iovec buffer = {(void*)data, count};
     if (done >= 0 && watched) afterWrite(fd, positioned ? offset : -1, &buffer, 1, done);
-    return done;
+    return writeResult(done, count);
 }
 
 EXPORT ssize_t write(int fd, const void* data, size_t count) {
@@ -1096,12 +1133,14 @@ static ssize_t forwardWritev(void** slot, const char* symbol, int positioned, in
     void* const real = next(slot, symbol);
     const struct Target target = FD_TARGET(fd);
     const enum Family family = positioned ? FAMILY_PWRITE : FAMILY_WRITE;
-    if (decide(positioned ? "pwritev" : "writev", family, 1, target) == VERDICT_FAIL) return -1;
+    if (decide(positioned ? "pwritev" : "writev", family, 1, target) == VERDICT_FAIL) {
+        return writeResult(-1, vectorBytes(vector, count));
+    }
     const int watched = watching(&target);
     const ssize_t done =
         positioned ? ((PwritevFn)real)(fd, vector, count, offset) : ((WritevFn)real)(fd, vector, count);
     if (done >= 0 && watched) afterWrite(fd, positioned ? offset : -1, vector, count, done);
-    return done;
+    return writeResult(done, vectorBytes(vector, count));
 }
 
 EXPORT ssize_t writev(int fd, const struct iovec* vector, int count) {
@@ -1325,22 +1364,22 @@ EXPORT int futimens(int fd, const struct timespec times[2]) {
 EXPORT int syncfs(int fd) {
     static void* slot;
     const FdFn real = (FdFn)next(&slot, "syncfs");
-    if (decide("syncfs", FAMILY_SYNC, 1, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
+    if (decide("syncfs", FAMILY_SYNC, 1, FD_TARGET(fd)) == VERDICT_FAIL) return (int)writeResult(-1, 0);
     const int watched = watching(NULL);
     const int result = real(fd);
     if (result == 0 && watched) afterSyncfs();
-    return result;
+    return (int)writeResult(result, 0);
 }
 
 /* fsync and fdatasync. */
 static int forwardFsync(void** slot, const char* symbol, int fd) {
     const FdFn real = (FdFn)next(slot, symbol);
     const struct Target target = FD_TARGET(fd);
-    if (decide(symbol, FAMILY_SYNC, 1, target) == VERDICT_FAIL) return -1;
+    if (decide(symbol, FAMILY_SYNC, 1, target) == VERDICT_FAIL) return (int)writeResult(-1, 0);
     const int watched = watching(&target);
     const int result = real(fd);
     if (result == 0 && watched) recordNamed("fsync", &target, 0, 0);
-    return result;
+    return (int)writeResult(result, 0);
 }
 
 EXPORT int fsync(int fd) {

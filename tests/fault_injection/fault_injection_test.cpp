@@ -14,6 +14,7 @@
 #include <fcntl.h>
 #include <sys/file.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -341,7 +342,8 @@ TEST_P(FaultInjection, BadSettingsEndTheProcessAtLoad) {
         {{{"FAULT_CALL", "rename"}, {"FAULT_NTH", "1"}, {"FAULT_ACTION", "errno:EWHAT"}},
          "fault_injection: FAULT_ACTION=\"errno:EWHAT\": unknown errno\n"},
         {{{"FAULT_CALL", "rename"}, {"FAULT_NTH", "1"}, {"FAULT_ACTION", "explode"}},
-         "fault_injection: FAULT_ACTION=\"explode\": expected errno:NAME, errno:NUMBER, crash or short:BYTES\n"},
+         "fault_injection: FAULT_ACTION=\"explode\": expected errno:NAME, errno:NUMBER, crash, short:BYTES or stop\n"},
+        {{{"FAULT_WRITE_ERRORS", "on"}}, "fault_injection: FAULT_WRITE_ERRORS=\"on\": expected ignore\n"},
         {{{"FAULT_CALL", "rename"}, {"FAULT_NTH", "1"}},
          "fault_injection: FAULT_ACTION: missing, but FAULT_NTH is set\n"},
         {{{"FAULT_CALL", "rename"}, {"FAULT_ACTION", "crash"}},
@@ -411,6 +413,61 @@ TEST_P(FaultInjection, CoverageCountFilesAreNeverFailedCountedOrRecorded) {
         EXPECT_EQ(fs::exists(record) ? testing_support::readText(record) : "", "") << call;
         EXPECT_EQ(snapshot(dir.path()), Snapshot{}) << call;
     }
+}
+
+// FAULT_WRITE_ERRORS=ignore: a failed write or sync says it succeeded (a
+// write as though every byte went), while the failure still took effect;
+// other calls fail as before.
+TEST_P(FaultInjection, IgnoredWriteErrorsReportSuccess) {
+    const std::vector<FaultRow> rows = {
+        {"write", 1, "errno:EIO", "", "write", "11", 1},
+        {"pwrite", 1, "errno:ENOSPC", "", "pwrite", "2", 1},
+        {"fsync", 1, "errno:EIO", "", "fsync", "0", 1},
+        {"syncfs", 1, "errno:EROFS", "", "syncfs", "0", 1},
+        {"rename", 1, "errno:EXDEV", "", "rename", "failed 18", 1},
+    };
+    for (const FaultRow& row : rows) {
+        ScratchDir dir;
+        prepareScriptDir(dir.path());
+        Environment env = faultEnv(row.call, row.nth, row.action, "", countFile());
+        env["FAULT_WRITE_ERRORS"] = "ignore";
+        const ProcessResult result = runScript(dir.path(), env);
+        EXPECT_EQ(result.exitStatus, 0) << row.call;
+        EXPECT_EQ(result.out, scriptOutput(kScript.size(), row.step, row.result)) << row.call;
+        EXPECT_EQ(result.err, "") << row.call;
+        EXPECT_EQ(snapshot(dir.path()), scriptState(allStepsExcept(row.step))) << row.call;
+    }
+}
+
+// FAULT_ACTION=stop: the process stops before the nth call, with only the
+// earlier steps done, and makes the call once continued.
+TEST_P(FaultInjection, StopsBeforeTheNthCallUntilContinued) {
+    const fs::path out = counts_ / "out";
+    const Environment env = faultEnv("mutating", 3, "stop", "", countFile());
+    const pid_t child = fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        for (const auto& [name, value] : env) setenv(name.c_str(), value.c_str(), 1);
+        const int fd = open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+        if (fd < 0 || dup2(fd, STDOUT_FILENO) < 0) _exit(97);
+        execl(GetParam(), GetParam(), "script", dir_.path().c_str(), static_cast<char*>(nullptr));
+        _exit(96);
+    }
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, WUNTRACED), child);
+    ASSERT_TRUE(WIFSTOPPED(status)) << status;
+    EXPECT_EQ(WSTOPSIG(status), SIGSTOP);
+    const size_t stopped = stepOfMutatingCall(3);
+    EXPECT_EQ(testing_support::readText(out), scriptOutput(stopped));
+    EXPECT_EQ(snapshot(dir_.path()), scriptState(stepsBefore(stopped)));
+    EXPECT_EQ(count(), 3u);
+
+    ASSERT_EQ(kill(child, SIGCONT), 0);
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFEXITED(status)) << status;
+    EXPECT_EQ(WEXITSTATUS(status), 0);
+    EXPECT_EQ(testing_support::readText(out), scriptOutput());
+    EXPECT_EQ(snapshot(dir_.path()), scriptState(stepsBefore(kScript.size())));
 }
 
 INSTANTIATE_TEST_SUITE_P(Probes, FaultInjection, ::testing::Values(FAULT_PROBE, FAULT_PROBE_INSTRUMENTED),

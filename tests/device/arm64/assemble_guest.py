@@ -27,7 +27,7 @@ PROGRAM_PACKAGES = ["dash", "bash", "coreutils", "util-linux", "mount", "fdisk",
 PROGRAMS = [
     "bin/dash", "bin/bash", "bin/mountpoint", "sbin/sfdisk", "sbin/losetup", "bin/mount", "bin/umount", "usr/bin/unshare", "usr/bin/setpriv",
     "usr/bin/nsenter", "sbin/mke2fs", "sbin/e2fsck", "sbin/tune2fs", "sbin/dumpe2fs", "sbin/dmsetup",
-    "usr/bin/strace", "sbin/mkfs.f2fs", "sbin/fsck.f2fs",
+    "usr/bin/strace", "sbin/mkfs.f2fs", "sbin/fsck.f2fs", "sbin/f2fs_io", "usr/sbin/filefrag", "usr/bin/fallocate",
 ]
 # Every program of these directories of coreutils, ahead of busybox's.
 WHOLE_PACKAGES = ["coreutils"]
@@ -36,7 +36,8 @@ WHOLE_PACKAGES = ["coreutils"]
 RUNTIME_PACKAGES = ["libc6", "libstdc++6", "libgcc-s1"]
 
 # The kernel's modules the guest loads, with what they need (modules.dep).
-MODULES = ["sdhci-pci", "ext4", "crc32c_generic", "crc32_generic", "loop", "dm-mod", "dm-log-writes", "dm-snapshot", "f2fs", "vfat"]
+MODULES = ["sdhci-pci", "ext4", "crc32c_generic", "crc32_generic", "loop", "dm-mod", "dm-log-writes", "dm-snapshot", "dm-flakey",
+           "f2fs", "vfat"]
 # Modules a mode loads itself, with parameters of its own: the replay's RAM disks.
 MODULES_ON_DEMAND = ["brd"]
 

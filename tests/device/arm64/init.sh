@@ -9,6 +9,8 @@
 #   verify    print what every store of the workload holds, power off
 #   replay    record and replay block writes (replay.sh), with
 #             arm64_replay=quick|full, report over the console, power off
+#   faults    real faults of the card under the stores (faults.sh), with
+#             arm64_faults=bounded|full|broken, report, power off
 /bin/busybox --install -s
 export PATH=/usr/sbin:/usr/bin:/sbin:/bin
 export HOME=/root
@@ -58,10 +60,12 @@ echo /dev/mmcblk0 >/run/arm64-device
 
 mode=
 replay_set=
+faults_set=
 for word in $(cat /proc/cmdline); do
     case $word in
         arm64_device=*) mode=${word#arm64_device=} ;;
         arm64_replay=*) replay_set=${word#arm64_replay=} ;;
+        arm64_faults=*) faults_set=${word#arm64_faults=} ;;
     esac
 done
 echo "arm64-device: ready after $(cut -d ' ' -f 1 /proc/uptime) s, mode ${mode:-none}"
@@ -73,6 +77,7 @@ case $mode in
     workload) sh "$guest/workload.sh" ;;
     verify) sh "$guest/workload.sh" verify ;;
     replay) bash "$guest/replay.sh" "$replay_set" ;;
+    faults) bash "$guest/faults.sh" "$faults_set" ;;
     *) echo "arm64-device: unknown mode '$mode'" ;;
 esac
 cd /

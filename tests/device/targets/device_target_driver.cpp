@@ -7,6 +7,9 @@
 //   device_target_driver boot-update SLOT FILE
 //       streams FILE in 4096-byte blocks into the boot-file slot:
 //       "begin <status>", "writes <status>", "finalise <status> valid <0|1>"
+//   device_target_driver partition-update FILE
+//       the same into the resource partition's slot: "begin <status>",
+//       "writes <status>", "finalise <status>"
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
@@ -20,6 +23,7 @@
 #include "files.h"
 #include "lib/storage/boot_vector_target.h"
 #include "lib/storage/firmware_update_boot_target.h"
+#include "lib/storage/firmware_update_partition_target.h"
 #include "lib/util/log.h"
 
 namespace {
@@ -29,7 +33,8 @@ using Bytes = std::vector<uint8_t>;
 int usage() {
     std::fprintf(stderr,
                  "usage: device_target_driver boot-vector-write HEX40\n"
-                 "       device_target_driver boot-update SLOT FILE\n");
+                 "       device_target_driver boot-update SLOT FILE\n"
+                 "       device_target_driver partition-update FILE\n");
     return 2;
 }
 
@@ -51,14 +56,9 @@ int bootVectorWrite(const std::string& recordHex) {
     return 0;
 }
 
-int bootUpdate(const std::string& slotText, const char* file) {
-    std::ifstream in(file, std::ios::binary);
-    if (!in) return usage();
-    const Bytes data((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    Storage::FirmwareUpdateBootTarget target;
-    const Storage::SlotHandle handle = target.getSlot(std::strtoul(slotText.c_str(), nullptr, 10));
-    if (!handle) return usage();
-    Storage::TargetSlot& slot = *handle.get();
+// Begins an update of `slot`, streams `data` into it and prints the first
+// two results; the caller finalises.
+void streamInto(Storage::TargetSlot& slot, const Bytes& data) {
     std::printf("begin %u\n", slot.beginWrite());
     Status writes = STATUS_OK;
     for (size_t offset = 0; offset < data.size() && writes == STATUS_OK; offset += 4096) {
@@ -66,8 +66,35 @@ int bootUpdate(const std::string& slotText, const char* file) {
         writes = slot.writeAt(static_cast<int64_t>(offset), data.data() + offset, size);
     }
     std::printf("writes %u\n", writes);
+}
+
+bool readFile(const char* file, Bytes& data) {
+    std::ifstream in(file, std::ios::binary);
+    if (!in) return false;
+    data.assign(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+    return true;
+}
+
+int bootUpdate(const std::string& slotText, const char* file) {
+    Bytes data;
+    if (!readFile(file, data)) return usage();
+    Storage::FirmwareUpdateBootTarget target;
+    const Storage::SlotHandle handle = target.getSlot(std::strtoul(slotText.c_str(), nullptr, 10));
+    if (!handle) return usage();
+    Storage::TargetSlot& slot = *handle.get();
+    streamInto(slot, data);
     const Status finalised = slot.finalise();
     std::printf("finalise %u valid %d\n", finalised, slot.isValid() ? 1 : 0);
+    return 0;
+}
+
+int partitionUpdate(const char* file) {
+    Bytes data;
+    if (!readFile(file, data)) return usage();
+    Storage::FirmwareUpdatePartitionTarget target;
+    Storage::TargetSlot& slot = *target.getSlot(0).get();
+    streamInto(slot, data);
+    std::printf("finalise %u\n", slot.finalise());
     return 0;
 }
 
@@ -78,5 +105,6 @@ int main(int argc, char** argv) {
     setLogLevel(LOG_PRIORITY_INFO);
     if (argc == 3 && std::strcmp(argv[1], "boot-vector-write") == 0) return bootVectorWrite(argv[2]);
     if (argc == 4 && std::strcmp(argv[1], "boot-update") == 0) return bootUpdate(argv[2], argv[3]);
+    if (argc == 3 && std::strcmp(argv[1], "partition-update") == 0) return partitionUpdate(argv[2]);
     return usage();
 }

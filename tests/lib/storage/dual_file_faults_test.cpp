@@ -210,6 +210,19 @@ TEST_F(DualFileFaults, RenameFailsInFinalise) {
     expectReopenedAs(holding(old_));
 }
 
+// A card that fails its writes shows first at the data file's sync: the
+// commit stops there, says why, and the old copy is served.
+TEST_F(DualFileFaults, DataFileSyncFails) {
+    prepare();
+    const ProcessResult result = drive({"write", input(new_)}, faultEnv("sync", 1, "errno:EIO", path("1/data")));
+    EXPECT_EQ(result.exitStatus, 1);
+    EXPECT_EQ(result.out, testing_support::errorPrefixOf("lib/storage/storage_target.cpp", "\"Failed to sync \" <<") +
+                              "Failed to sync \"" + path("1/data") + "\": Input/output error (5)\nwrite: 52\n" +
+                              stateLine(holding(old_)));
+    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(new_) + "\n" + copyLines("2", old_));
+    expectReopenedAs(holding(old_));
+}
+
 // The sync comes after the rename: the new copy is on disk and wins at the
 // next opening, while this process keeps serving the old one.
 TEST_F(DualFileFaults, SyncfsFails) {

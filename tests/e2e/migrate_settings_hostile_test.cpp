@@ -32,6 +32,24 @@ constexpr unsigned kTimeLimitSeconds = 30;
 // The unprivileged user an application runs as.
 constexpr uid_t kNobody = 65534;
 
+void expectFinished(const ProcessResult& result) {
+    EXPECT_NE(result.signal, SIGALRM) << "still running after " << kTimeLimitSeconds << " s";
+    EXPECT_EQ(result.signal, 0) << result.out << result.err;
+}
+
+// Whether one copy of the store at `store` holds `blob` with its check file.
+bool committed(const fs::path& store, const Bytes& blob) {
+    for (const char* copy : {"1", "2"}) {
+        const fs::path data = store / copy / "data";
+        const fs::path check = store / copy / "data.chk";
+        if (fs::is_regular_file(data) && fs::is_regular_file(check) && testing_support::readBytes(data) == blob &&
+            testing_support::readBytes(check) == e2e::checkFileFor(blob)) {
+            return true;
+        }
+    }
+    return false;
+}
+
 class HostileStores : public ::testing::Test {
 protected:
     HostileStores() { fs::create_directory(inputs); }
@@ -53,16 +71,24 @@ protected:
     // Everything outside the base directory and the data files.
     std::string outside() const { return testing_support::snapshotTree(scratch.path(), {"base", "inputs"}); }
 
+    // Two migrations of util_save, one into each copy: each exits 0 and its
+    // blob is committed, whatever was planted in the copies.
+    void migrateUtilSaveTwice(uint8_t seed) {
+        for (int round = 0; round < 2; ++round) {
+            const Bytes blob = e2e::pattern(64 + round, seed);
+            const ProcessResult result =
+                run({"--target", "util_save", "--type", "simple", "--data", dataFile("blob", blob)});
+            expectFinished(result);
+            EXPECT_EQ(result.exitStatus, 0) << result.out;
+            EXPECT_TRUE(committed(base / "app/utilSave", blob)) << "round " << round;
+        }
+    }
+
     void plant(const std::string& relative, Plant what) {
         std::string reason;
         if (!testing_support::plantAt(base / relative, what, victims, reason)) GTEST_SKIP() << reason;
     }
 };
-
-void expectFinished(const ProcessResult& result) {
-    EXPECT_NE(result.signal, SIGALRM) << "still running after " << kTimeLimitSeconds << " s";
-    EXPECT_EQ(result.signal, 0) << result.out << result.err;
-}
 
 // A link planted at the data file that the next migration writes used to
 // make that migration write the blob into the link's target.
@@ -83,19 +109,6 @@ TEST_F(HostileStores, LinkAtTheOtherCopysDataIsNeverWrittenThrough) {
     EXPECT_EQ(run({"--target", "settings", "--query-present"}).exitStatus, 10);
 }
 
-// Whether one copy of the store at `store` holds `blob` with its check file.
-bool committed(const fs::path& store, const Bytes& blob) {
-    for (const char* copy : {"1", "2"}) {
-        const fs::path data = store / copy / "data";
-        const fs::path check = store / copy / "data.chk";
-        if (fs::is_regular_file(data) && fs::is_regular_file(check) && testing_support::readBytes(data) == blob &&
-            testing_support::readBytes(check) == e2e::checkFileFor(blob)) {
-            return true;
-        }
-    }
-    return false;
-}
-
 // A hard link planted at a copy's data file, to a root-only file on the
 // same file system, used to make the migration into that copy overwrite
 // the file with the blob and exit 0. Both copies are written here, so the
@@ -103,14 +116,7 @@ bool committed(const fs::path& store, const Bytes& blob) {
 TEST_F(HostileStores, HardLinkAtADataFileIsNeverWrittenThrough) {
     plant("app/utilSave/2/data", Plant::kHardLinkToRootOnlyFile);
     const std::string before = outside();
-    for (int round = 0; round < 2; ++round) {
-        const Bytes blob = e2e::pattern(64 + round, 30);
-        const ProcessResult result =
-            run({"--target", "util_save", "--type", "simple", "--data", dataFile("blob", blob)});
-        expectFinished(result);
-        EXPECT_EQ(result.exitStatus, 0) << result.out;
-        EXPECT_TRUE(committed(base / "app/utilSave", blob)) << "round " << round;
-    }
+    migrateUtilSaveTwice(30);
     EXPECT_EQ(outside(), before);
     EXPECT_EQ(run({"--target", "util_save", "--query-present"}).exitStatus, 0);
 }
@@ -120,14 +126,7 @@ TEST_F(HostileStores, HardLinkAtADataFileIsNeverWrittenThrough) {
 TEST_F(HostileStores, HardLinkAtTheTransientCheckFileIsNeverWrittenThrough) {
     plant("app/utilSave/1/data.chk.tmp", Plant::kHardLinkToRootOnlyFile);
     const std::string before = outside();
-    for (int round = 0; round < 2; ++round) {
-        const Bytes blob = e2e::pattern(64 + round, 40);
-        const ProcessResult result =
-            run({"--target", "util_save", "--type", "simple", "--data", dataFile("blob", blob)});
-        expectFinished(result);
-        EXPECT_EQ(result.exitStatus, 0) << result.out;
-        EXPECT_TRUE(committed(base / "app/utilSave", blob)) << "round " << round;
-    }
+    migrateUtilSaveTwice(40);
     EXPECT_EQ(outside(), before);
     EXPECT_FALSE(fs::exists(fs::symlink_status(base / "app/utilSave/1/data.chk.tmp")));
 }
@@ -166,14 +165,7 @@ TEST_F(HostileStores, AnApplicationsHardLinkToARootOnlyFileIsNeverWrittenThrough
         });
         ASSERT_EQ(planted.exitStatus, 0) << "nobody could not link " << victim << " at " << where;
     }
-    for (int round = 0; round < 2; ++round) {
-        const Bytes blob = e2e::pattern(64 + round, 60);
-        const ProcessResult result =
-            run({"--target", "util_save", "--type", "simple", "--data", dataFile("blob", blob)});
-        expectFinished(result);
-        EXPECT_EQ(result.exitStatus, 0) << result.out;
-        EXPECT_TRUE(committed(base / "app/utilSave", blob)) << "round " << round;
-    }
+    migrateUtilSaveTwice(60);
     EXPECT_EQ(outside(), before);
 }
 

@@ -437,6 +437,22 @@ space_case() {
 # file on, then RECOVERY. A file that is neither the old nor the new one
 # needs a failed update (else: lost); an update that returned 0 while the
 # card kept the old file is counted apart, as stale.
+# judge_update WHAT: counts an update of the boot file or the partition
+# that ended with $op_status and left $served (new, old or neither), WHAT
+# saying what it left; an update that returned 0 over anything but the new
+# content is stale (the old one) or lost. Sets why and outcome.
+judge_update() {
+    cases=$((cases + 1))
+    why=
+    if [ "${op_status:-none}" = 0 ]; then
+        acknowledged=$((acknowledged + 1))
+        [ "$served" = new ] || why="finalise returned 0, $1"
+    fi
+    if [ "$outcome" = ok ] && [ -n "$why" ]; then
+        if [ "$served" = old ]; then outcome=stale stale=$((stale + 1)); else outcome=lost lost=$((lost + 1)); fi
+    fi
+}
+
 boot_update() { "${wrap[@]}" "$boot_driver" boot-update 0 "$work/boot-new"; }
 
 boot_case() {
@@ -473,15 +489,7 @@ boot_case() {
         "$old_sum") served=old ;;
         *) served=neither ;;
     esac
-    cases=$((cases + 1))
-    why=
-    if [ "${op_status:-none}" = 0 ]; then
-        acknowledged=$((acknowledged + 1))
-        [ "$served" = new ] || why="finalise returned 0, the boot file is the $served one"
-    fi
-    if [ "$outcome" = ok ] && [ -n "$why" ]; then
-        if [ "$served" = old ]; then outcome=stale stale=$((stale + 1)); else outcome=lost lost=$((lost + 1)); fi
-    fi
+    judge_update "the boot file is the $served one"
     echo "@@ case $cases ext4 boot-file writes-fail@$step $recovery: finalise=${op_status:-none} served=$served" \
         "$outcome${why:+ ($why)} [log: $(grep -E 'Readback|Failed|failed' "$work/op.log" | head -n 3 | tr '\n' ' ' | sed 's/ *$//')]"
     # The old file back for the next case.
@@ -548,15 +556,7 @@ partition_case() {
     blockdev --flushbufs /dev/mmcblk0p2
     fs=ext4 repair /dev/mmcblk0p2
     served=$(resources_marker)
-    cases=$((cases + 1))
-    why=
-    if [ "${op_status:-none}" = 0 ]; then
-        acknowledged=$((acknowledged + 1))
-        [ "$served" = new ] || why="finalise returned 0, the partition holds the $served image"
-    fi
-    if [ "$outcome" = ok ] && [ -n "$why" ]; then
-        if [ "$served" = old ]; then outcome=stale stale=$((stale + 1)); else outcome=lost lost=$((lost + 1)); fi
-    fi
+    judge_update "the partition holds the $served image"
     echo "@@ case $cases ext4 partition-image writes-fail@$step $recovery: finalise=${op_status:-none}" \
         "served=$served $outcome${why:+ ($why)} [log: $(grep -E 'Failed|failed|rror' "$work/op.log" | head -n 2 |
             tr '\n' ' ' | sed 's/ *$//')]"

@@ -263,6 +263,7 @@ check() {
         failed) failed=$((failed + 1)) ;;
     esac
     steps_said=$(grep -E '^(write|writeAt|beginWrite|finalise|erase): [1-9][0-9]*$' "$work/op.log" | tr '\n' ' ')
+    touch "$work/progress"
     echo "@@ case $cases $fs $label: exit=$op_status${steps_said:+ (${steps_said% })} served=$served query=$query inspect=$inspected/$inspect_status" \
         "$outcome${why:+ ($why)}$(l=$(log_line "$work/op.log"); [ -z "$l" ] || echo " [log: $l]")"
 }
@@ -443,6 +444,7 @@ space_case() {
 # content is stale (the old one) or lost. Sets why and outcome.
 judge_update() {
     cases=$((cases + 1))
+    touch "$work/progress"
     why=
     if [ "${op_status:-none}" = 0 ]; then
         acknowledged=$((acknowledged + 1))
@@ -651,12 +653,36 @@ totals() {
     echo "@@ $name: $stale boot-file and partition updates returned 0 while the card kept the old one"
 }
 
+# A case takes seconds. Whatever holds the campaign in the kernel for
+# longer (a program the time limits cannot end, a sync, an unmount) is
+# shown with its kernel stack, and the campaign ends as a hang.
+stall_limit=180
+watch_for_stalls() {
+    local pid
+    while sleep 10; do
+        [ $(($(date +%s) - $(stat -c %Y "$work/progress"))) -ge "$stall_limit" ] || continue
+        echo "@@ faults: no case ended for $stall_limit s; the programs, and the kernel's stack of each waiting in it:"
+        for pid in $(ls /proc | grep -E '^[0-9]+$'); do
+            [ -s "/proc/$pid/cmdline" ] || continue
+            echo "@@   $pid $(awk '{ print $3 }' "/proc/$pid/stat") $(tr '\0' ' ' <"/proc/$pid/cmdline")"
+            [ "$(awk '{ print $3 }' "/proc/$pid/stat")" != D ] || sed 's/^/@@     /' "/proc/$pid/stack"
+        done 2>/dev/null
+        echo "@@ faults: the kernel's last words:"
+        dmesg | tail -n 30 | sed 's/^/@@   /'
+        sync &
+        sleep 2
+        poweroff -f
+    done
+}
+
 case $set_name in bounded | full | broken) ;; *)
     echo "@@ faults: unknown set '$set_name'"
     exit 1
     ;;
 esac
 start=$SECONDS
+touch "$work/progress"
+watch_for_stalls &
 umount "$mnt" || echo "@@ faults: cannot unmount $mnt"
 make_blobs
 if [ "$set_name" != broken ]; then

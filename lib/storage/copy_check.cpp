@@ -92,6 +92,17 @@ CopyCheck checkCopy(SlotDirectories& directories, unsigned copy) {
     return judgeData(directories, copy, stored, result);
 }
 
+bool failedToRead(const CopyCheck& check) {
+    switch (check.fault) {
+        case CopyFault::kCheckUnopenable:
+        case CopyFault::kCheckUnreadable:
+        case CopyFault::kDataUnreadable:
+            return check.error != ELOOP && check.error != ENOTDIR && check.error != EISDIR && check.error != ENXIO;
+        default:
+            return false;
+    }
+}
+
 unsigned currentCopy(const CopyCheck& copy0, const CopyCheck& copy1) {
     return copy1.valid() && isLater(copy1.checkTime, copy0.valid() ? copy0.checkTime : CheckTime{}) ? 1 : 0;
 }

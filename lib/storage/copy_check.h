@@ -56,6 +56,13 @@ struct CopyCheck {
     bool valid() const { return fault == CopyFault::kNone; }
 };
 
+// The copy's check or data file could not be opened or read for a cause
+// below the store's tree (a failing card, the file system, permissions)
+// rather than for what the tree holds there (a link, something that is not
+// a regular file). Such a copy is not valid like any other, but the cause
+// is worth a log line.
+bool failedToRead(const CopyCheck& check);
+
 // Judges copy 0 or 1 by its check file and data file. The stored value is
 // read first: data that no check file vouches for is not read.
 CopyCheck checkCopy(SlotDirectories& directories, unsigned copy);

@@ -135,7 +135,15 @@ fs::path DualFileTarget::Slot::directoryPath() const { return name_.empty() ? ba
 
 void DualFileTarget::Slot::judge(SlotDirectories& directories, const LockDeadline* cleanUp) const {
     CopyCheck checks[2];
-    for (unsigned i = 0; i < copies_.size(); ++i) checks[i] = validate(i, directories, cleanUp);
+    for (unsigned i = 0; i < copies_.size(); ++i) {
+        checks[i] = validate(i, directories, cleanUp);
+        if (failedToRead(checks[i])) {
+            const Copy& copy = copies_[i];
+            const fs::path& file = checks[i].fault == CopyFault::kDataUnreadable ? copy.dataPath : copy.checkPath;
+            LOGE << "Failed to read " << std::quoted(file.string()) << ": " << std::strerror(checks[i].error) << " ("
+                 << checks[i].error << ")";
+        }
+    }
     current_ = currentCopy(checks[0], checks[1]);
 }
 

@@ -20,6 +20,8 @@
  *                        sync      syncfs, fsync, fdatasync
  *                        mkdir     mkdir, mkdirat
  *                        chmod     chmod, fchmod, fchmodat
+ *                        read      read, pread: a card that cannot read
+ *                                  a file's blocks
  *                        mutating  every call above except opens that
  *                                  neither write, create nor truncate
  *                      A family name wins over the function of the same
@@ -161,11 +163,12 @@ enum Family {
     FAMILY_SYNC,
     FAMILY_MKDIR,
     FAMILY_CHMOD,
+    FAMILY_READ,
     FAMILY_COUNT
 };
 
 static const char* const kFamilyNames[FAMILY_COUNT] = {
-    "open", "write", "pwrite", "copy", "rename", "unlink", "truncate", "utimens", "sync", "mkdir", "chmod",
+    "open", "write", "pwrite", "copy", "rename", "unlink", "truncate", "utimens", "sync", "mkdir", "chmod", "read",
 };
 
 struct Function {
@@ -184,6 +187,7 @@ static const struct Function kFunctions[] = {
     {"futimens", FAMILY_UTIMENS},   {"syncfs", FAMILY_SYNC},          {"fsync", FAMILY_SYNC},
     {"fdatasync", FAMILY_SYNC},     {"mkdir", FAMILY_MKDIR},          {"mkdirat", FAMILY_MKDIR},
     {"chmod", FAMILY_CHMOD},        {"fchmod", FAMILY_CHMOD},         {"fchmodat", FAMILY_CHMOD},
+    {"read", FAMILY_READ},          {"pread", FAMILY_READ},
 };
 
 struct ErrnoName {
@@ -1110,6 +1114,63 @@ static ssize_t forwardWrite(void** slot, const char* symbol, int positioned, int
     const struct iovec buffer = {(void*)data, count};
     if (done >= 0 && watched) afterWrite(fd, positioned ? offset : -1, &buffer, 1, done);
     return writeResult(done, count);
+}
+
+typedef ssize_t (*ReadFn)(int, void*, size_t);
+typedef ssize_t (*PreadFn)(int, void*, size_t, off_t);
+
+/* read, and pread when `positioned`. */
+static ssize_t forwardRead(void** slot, const char* symbol, int positioned, int fd, void* data, size_t count,
+                           off_t offset) {
+    void* const real = next(slot, symbol);
+    if (decide(positioned ? "pread" : "read", FAMILY_READ, 0, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
+    return positioned ? ((PreadFn)real)(fd, data, count, offset) : ((ReadFn)real)(fd, data, count);
+}
+
+EXPORT ssize_t read(int fd, void* data, size_t count) {
+    static void* slot;
+    return forwardRead(&slot, "read", 0, fd, data, count, 0);
+}
+
+EXPORT ssize_t pread(int fd, void* data, size_t count, off_t offset) {
+    static void* slot;
+    return forwardRead(&slot, "pread", 1, fd, data, count, offset);
+}
+
+EXPORT ssize_t pread64(int fd, void* data, size_t count, off64_t offset) {
+    static void* slot;
+    return forwardRead(&slot, "pread64", 1, fd, data, count, offset);
+}
+
+/* The fortified variants check the buffer's size in the real one. */
+typedef ssize_t (*ReadChkFn)(int, void*, size_t, size_t);
+typedef ssize_t (*PreadChkFn)(int, void*, size_t, off_t, size_t);
+ssize_t __read_chk(int fd, void* data, size_t count, size_t capacity);
+ssize_t __pread_chk(int fd, void* data, size_t count, off_t offset, size_t capacity);
+ssize_t __pread64_chk(int fd, void* data, size_t count, off64_t offset, size_t capacity);
+
+EXPORT ssize_t __read_chk(int fd, void* data, size_t count, size_t capacity) {
+    static void* slot;
+    const ReadChkFn real = (ReadChkFn)next(&slot, "__read_chk");
+    if (decide("read", FAMILY_READ, 0, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
+    return real(fd, data, count, capacity);
+}
+
+static ssize_t forwardPreadChk(void** slot, const char* symbol, int fd, void* data, size_t count, off_t offset,
+                               size_t capacity) {
+    const PreadChkFn real = (PreadChkFn)next(slot, symbol);
+    if (decide("pread", FAMILY_READ, 0, FD_TARGET(fd)) == VERDICT_FAIL) return -1;
+    return real(fd, data, count, offset, capacity);
+}
+
+EXPORT ssize_t __pread_chk(int fd, void* data, size_t count, off_t offset, size_t capacity) {
+    static void* slot;
+    return forwardPreadChk(&slot, "__pread_chk", fd, data, count, offset, capacity);
+}
+
+EXPORT ssize_t __pread64_chk(int fd, void* data, size_t count, off64_t offset, size_t capacity) {
+    static void* slot;
+    return forwardPreadChk(&slot, "__pread64_chk", fd, data, count, offset, capacity);
 }
 
 EXPORT ssize_t write(int fd, const void* data, size_t count) {

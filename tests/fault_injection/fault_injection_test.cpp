@@ -383,6 +383,32 @@ TEST_P(FaultInjection, LibraryCallsAreCountedByFamily) {
     }
 }
 
+// Reads are no mutating calls; a card that cannot read one file fails
+// only that file's reads.
+TEST_P(FaultInjection, ReadsFailOnlyWhenTheirFamilyIsNamed) {
+    struct Row {
+        const char* call;
+        const char* pathSubstr;
+        unsigned long counted;
+        const char* out;
+    };
+    const Row rows[] = {
+        {"read", "", 2, "read 7\npread failed 5\n"},
+        {"read", "source", 2, "read 7\npread failed 5\n"},
+        {"read", "elsewhere", 0, "read 7\npread 6\n"},
+        {"mutating", "", 0, "read 7\npread 6\n"},
+    };
+    for (const Row& row : rows) {
+        ScratchDir dir;
+        writeText(dir / "source", "source\n");
+        const ProcessResult result = runProgram({GetParam(), "read", dir.path().string()},
+                                                faultEnv(row.call, 2, "errno:EIO", row.pathSubstr, countFile()));
+        EXPECT_EQ(result.exitStatus, 0) << row.call << " " << row.pathSubstr;
+        EXPECT_EQ(result.out, row.out) << row.call << " " << row.pathSubstr;
+        EXPECT_EQ(count(), row.counted) << row.call << " " << row.pathSubstr;
+    }
+}
+
 TEST_P(FaultInjection, LibraryReportsEachFailedMutatingCall) {
     for (size_t i = 0; i < kLibraryMutatingCallOwners.size(); ++i) {
         const std::string& owner = kLibraryMutatingCallOwners[i];

@@ -12,6 +12,7 @@
 //   fault_probe record DIR   every call the shim records (fault_probe.h)
 //   fault_probe gcda DIR     what gcov does to its count files: creates,
 //                            renames and removes DIR/probe.gcda
+//   fault_probe read DIR     reads DIR/source with read, then pread
 #include <cerrno>
 #include <chrono>
 #include <cstdio>
@@ -152,6 +153,16 @@ int runCoverageCounts(const std::string& dir) {
     return 0;
 }
 
+int runReads(const std::string& dir) {
+    const int fd = open((dir + "/source").c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) return 1;
+    char buffer[64];
+    step("read", [&] { return static_cast<long>(read(fd, buffer, sizeof buffer)); });
+    step("pread", [&] { return static_cast<long>(pread(fd, buffer, sizeof buffer, 1)); });
+    close(fd);
+    return 0;
+}
+
 int runSpawn(const char* self, const std::string& dir) {
     const std::string childDir = dir + "/child";
     std::string script = "script";
@@ -175,7 +186,7 @@ int runSpawn(const char* self, const std::string& dir) {
 int main(int argc, char** argv) {
     std::setvbuf(stdout, nullptr, _IONBF, 0);
     if (argc != 3) {
-        std::fprintf(stderr, "usage: fault_probe script|library|spawn|record|gcda DIR\n");
+        std::fprintf(stderr, "usage: fault_probe script|library|spawn|record|gcda|read DIR\n");
         return 2;
     }
     const std::string mode = argv[1];
@@ -184,6 +195,7 @@ int main(int argc, char** argv) {
     if (mode == "spawn") return runSpawn(argv[0], argv[2]);
     if (mode == "record") return fault_probe::runRecord(argv[2]);
     if (mode == "gcda") return runCoverageCounts(argv[2]);
+    if (mode == "read") return runReads(argv[2]);
     std::fprintf(stderr, "unknown mode %s\n", argv[1]);
     return 2;
 }

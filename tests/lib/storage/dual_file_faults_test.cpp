@@ -41,6 +41,7 @@ using store_test::SlotContent;
 using testing_support::Environment;
 using testing_support::faultCountEnv;
 using testing_support::faultEnv;
+using testing_support::faultFromEnv;
 using testing_support::ProcessResult;
 using testing_support::readFaultCount;
 using testing_support::ScratchDir;
@@ -380,6 +381,32 @@ TEST_F(DualFileFaults, OpeningCannotRemoveADamagedCopysCheckFile) {
     EXPECT_EQ(testing_support::readBytes(base() / "1" / "data.chk"), expectedCheckFile(older_));
     expectReopenedAs(holding(old_));
     EXPECT_FALSE(fs::exists(base() / "1" / "data.chk"));
+}
+
+// A card that cannot read the current copy's check file: opening says so,
+// and the copy is judged as any whose check file does not vouch for its
+// data (its check file removed), so the older copy is served.
+TEST_F(DualFileFaults, CheckFileReadFailsAtOpening) {
+    prepare();
+    const ProcessResult result = drive({}, faultFromEnv("read", 1, "errno:EIO", path("2/data.chk")));
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(result.out, testing_support::errorPrefixOf("lib/storage/storage_target.cpp", "\"Failed to read \" <<") +
+                              "Failed to read \"" + path("2/data.chk") + "\": Input/output error (5)\n" +
+                              stateLine(holding(older_)));
+    EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", older_) + "f 2/data " + hex(old_) + "\n");
+    expectReopenedAs(holding(older_));
+}
+
+// A read that fails once is read again under the copy's lock before
+// anything is removed: the copy stays, and nothing is logged.
+TEST_F(DualFileFaults, DataReadThatFailsOnceKeepsTheCopy) {
+    prepare();
+    // The current copy's check file is read first, then its data.
+    const ProcessResult result = drive({}, faultEnv("read", 2, "errno:EIO", path("2/data")));
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(result.out, stateLine(holding(old_)));
+    EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", older_) + copyLines("2", old_));
+    expectReopenedAs(holding(old_));
 }
 
 // Opening opens each file of a copy once (and each directory on the way to

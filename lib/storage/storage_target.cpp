@@ -66,6 +66,13 @@ Status lockTimedOut(const char* what, const std::string& path) {
     return STATUS_TIMEOUT;
 }
 
+// A short write carries no errno (a file system that filled up, mostly):
+// the line says how far it got.
+Status shortWrite(const fs::path& path, ssize_t written, size_t size) {
+    LOGE << "Short write to " << std::quoted(path.string()) << ": " << written << " of " << size << " bytes";
+    return STATUS_FAILED;
+}
+
 Status copyFile(const CopyDirectory& from, const CopyDirectory& to) {
     const UniqueFd source = from.openToRead(kDataName);
     if (!source) return STATUS_FAILED;
@@ -374,7 +381,7 @@ Status DualFileTarget::Slot::write(const uint8_t* data, size_t size) {
         LOGE_AT(kWriteFailedLine) << "write failed: " << error << ": " << std::strerror(error);
         return static_cast<Status>(error);
     }
-    if (static_cast<size_t>(written) != size) return STATUS_FAILED;
+    if (static_cast<size_t>(written) != size) return shortWrite(copies_[otherIndex()].dataPath, written, size);
     fd.reset();
     return commitOther(reached, previousTime);
 }
@@ -418,7 +425,8 @@ Status DualFileTarget::Slot::writeAt(int64_t offset, const uint8_t* data, size_t
     if (const Status status = openCopyData(target, reached, O_RDWR | O_CREAT, fd)) return status;
     const ssize_t written = ::pwrite(fd.get(), data, size, offset);
     if (written < 0 && errno != 0) return static_cast<Status>(errno);
-    if (written < 0 || static_cast<size_t>(written) != size) return STATUS_FAILED;
+    if (written < 0) return STATUS_FAILED;
+    if (static_cast<size_t>(written) != size) return shortWrite(copies_[target].dataPath, written, size);
     fd.reset();
     return writing_ ? STATUS_OK : commitOther(reached, previousTime);
 }

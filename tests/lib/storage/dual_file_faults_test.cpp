@@ -58,6 +58,11 @@ std::string stateLine(const SlotContent& content) {
            " data=" + hex(content.data) + "\n";
 }
 
+std::string shortWriteLine(const std::string& path, size_t written, size_t size) {
+    return testing_support::errorPrefixOf("lib/storage/storage_target.cpp", "\"Short write to \" <<") +
+           "Short write to \"" + path + "\": " + std::to_string(written) + " of " + std::to_string(size) + " bytes\n";
+}
+
 class DualFileFaults : public ::testing::Test {
 protected:
     fs::path base() const { return dir / "store"; }
@@ -474,7 +479,7 @@ TEST_F(DualFileFaults, ShortDataWrite) {
     prepare();
     const ProcessResult result = drive({"write", input(new_)}, faultEnv("write", 1, "short:4", path("1/data")));
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "write: 52\n" + stateLine(holding(old_)));
+    EXPECT_EQ(result.out, shortWriteLine(path("1/data"), 4, new_.size()) + "write: 52\n" + stateLine(holding(old_)));
     EXPECT_EQ(describeTree(base()),
               "d 1\nd 2\nf 1/data " + hex(Bytes(new_.begin(), new_.begin() + 4)) + "\n" + copyLines("2", old_));
     expectReopenedAs(holding(old_));
@@ -510,7 +515,7 @@ TEST_F(DualFileFaults, ShortBlockWrite) {
     const ProcessResult result =
         drive({"writeAt", "10", input(bytesOf("block"))}, faultEnv("pwrite", 1, "short:2", path("1/data")));
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "writeAt: 52\n" + stateLine(holding(old_)));
+    EXPECT_EQ(result.out, shortWriteLine(path("1/data"), 2, 5) + "writeAt: 52\n" + stateLine(holding(old_)));
     expectReopenedAs(holding(old_));
 }
 

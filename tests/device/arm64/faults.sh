@@ -37,9 +37,9 @@
 #
 # RESULT is ok, lost (a slot serving neither blob, or tools that disagree),
 # hang (a run past $run_limit s), crash (a run ended by a signal), failed
-# (a next migration that failed) or, for the boot file and the partition
-# image, stale. A failure
-# without a log line is named as such and counted, not failed.
+# (a failure without a log line, a read fault the tool did not log, or a
+# next migration that failed) or, for the boot file and the partition
+# image, stale.
 set -u
 . /etc/arm64-device.conf
 set_name=${1:-bounded}
@@ -244,6 +244,7 @@ check() {
     if [ "$outcome" = ok ] && [ -n "$why" ]; then outcome=lost; fi
     if [ "$op_status" -ne 0 ] && [ -z "$(log_line "$work/op.log")" ]; then
         silent=$((silent + 1)) why="${why:+$why, }no log line says why"
+        [ "$outcome" != ok ] || outcome=failed
     fi
     [ "$op_status" -ne 0 ] || [ "$reading" = 1 ] || acknowledged=$((acknowledged + 1))
     if [ "$outcome" = ok ] && [ -n "$next_blob" ]; then
@@ -369,6 +370,7 @@ read_case() {
     run "$work/op.log" "$tool" --base "$base" --target settings --query-present
     op_status=$status
     tool_says=$(log_line "$work/op.log")
+    [ -n "$tool_says" ] || outcome=failed
     grep -o 'copy [12]: [a-z ]*unreadable: [A-Za-z/ ]*' "$work/reason.log" >>"$work/op.log"
     # Served while the fault lasts: the other copy, as acknowledged before.
     next_blob= reading=1

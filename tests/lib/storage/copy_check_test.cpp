@@ -20,7 +20,8 @@ CopyCheck checkOf(CopyFault fault, int error = 0) {
 // A failing card or file system is worth a log line; what the tree holds
 // (links, directories, FIFOs) and damaged contents are not.
 TEST(FailedToRead, OnlyOpensAndReadsThatFailBelowTheTree) {
-    for (const CopyFault fault : {CopyFault::kCheckUnopenable, CopyFault::kCheckUnreadable, CopyFault::kDataUnreadable}) {
+    for (const CopyFault fault :
+         {CopyFault::kCheckUnopenable, CopyFault::kCheckUnreadable, CopyFault::kDataUnreadable}) {
         for (const int error : {EIO, EACCES, ENOMEM, EUCLEAN}) {
             EXPECT_TRUE(failedToRead(checkOf(fault, error))) << static_cast<int>(fault) << " " << error;
         }

@@ -27,7 +27,7 @@
 # --query-present and inspect_store must agree; the next migration must
 # succeed. One line a case, then the totals:
 #
-#   @@ case N FS OPERATION FAULT@STEP/CALLS RECOVERY: exit=S served=STATE query=Q inspect=STATE/EXIT RESULT [log: LINES]
+#   @@ case N FS OPERATION FAULT@STEP/CALLS RECOVERY: exit=S served=STATE/WHICH query=Q inspect=STATE/EXIT RESULT [log: LINES]
 #   @@ faults: C cases, A acknowledged, L lost, H hangs, K crashes
 #   @@ faults: F failed otherwise
 #   @@ faults: S failures without a log line
@@ -35,7 +35,9 @@
 #   @@ broken store: ... (the same lines)
 #   @@ end of faults
 #
-# RESULT is ok, lost (a slot serving neither blob, or tools that disagree),
+# WHICH says whether the slot serves the blob acknowledged before the
+# operation (old), the operation's own (new) or neither (other). RESULT is
+# ok, lost (a slot serving neither blob, or tools that disagree),
 # hang (a run past $run_limit s), crash (a run ended by a signal), failed
 # (a failure without a log line, a read fault the tool did not log, or a
 # next migration that failed) or, for the boot file and the partition
@@ -142,19 +144,29 @@ unmount() { within 60 umount "$1" || echo "@@ the unmount of $1 ($fs) failed"; }
 
 # recover card|cut: the card works again and the device boots as usual, or
 # the power went during the fault and the device boots on what reached it.
-# Without power f2fs would retry its checkpoint's writes at the unmount for
-# good: it is shut down first, without a sync.
+#
+# f2fs is shut down without a sync and unmounted first, while its writes
+# still fail: at its first failed write it stops writing for good (no
+# checkpoint, not even at the unmount, where it would retry without end
+# once the power is gone), and a table loaded under it while it handles a
+# failed write could wait for ever on this kernel (the suspend waits for
+# the failed write, whose completion waits for a write of its own that the
+# suspend holds back). On f2fs the two recoveries then differ only in the
+# device the repair and the mount see.
 recover() {
-    if [ "$1" = card ]; then
-        table "$linear"
+    if [ "$fs" = f2fs ]; then
+        within 60 f2fs_io shutdown 2 "$mnt" >/dev/null
         unmount "$mnt"
+    fi
+    if [ "$1" = card ]; then
+        within 60 table "$linear"
+        [ "$fs" = f2fs ] || unmount "$mnt"
         within 120 repair /dev/mapper/faults
         within 60 mount -t "$fs" -o "$(mount_options)" /dev/mapper/faults "$mnt"
     else
-        table "$power_gone"
-        [ "$fs" = ext4 ] || f2fs_io shutdown 2 "$mnt" >/dev/null
-        unmount "$mnt"
-        dmsetup remove faults
+        within 60 table "$power_gone"
+        [ "$fs" = f2fs ] || unmount "$mnt"
+        within 60 dmsetup remove faults
         blockdev --flushbufs "$part"
         within 120 repair "$part"
         within 60 mount -t "$fs" -o "$(mount_options)" "$part" "$mnt"
@@ -227,7 +239,7 @@ fresh() {
 # check LABEL OLD NEW: judges the slot after a case whose run left $status
 # and $outcome; NEW is the only state allowed when the run returned 0.
 check() {
-    local label=$1 old=$2 new=$3 served query inspected inspect_status allowed why steps_said
+    local label=$1 old=$2 new=$3 served query inspected inspect_status allowed why steps_said which
     cases=$((cases + 1))
     served=$(state "$base")
     inspect_status=$(cat "$work/inspect.status")
@@ -264,8 +276,11 @@ check() {
         failed) failed=$((failed + 1)) ;;
     esac
     steps_said=$(grep -E '^(write|writeAt|beginWrite|finalise|erase): [1-9][0-9]*$' "$work/op.log" | tr '\n' ' ')
+    which=other
+    [ "$served" != "$new" ] || which=new
+    [ "$served" != "$old" ] || which=old
     touch "$work/progress"
-    echo "@@ case $cases $fs $label: exit=$op_status${steps_said:+ (${steps_said% })} served=$served query=$query inspect=$inspected/$inspect_status" \
+    echo "@@ case $cases $fs $label: exit=$op_status${steps_said:+ (${steps_said% })} served=$served/$which query=$query inspect=$inspected/$inspect_status" \
         "$outcome${why:+ ($why)}$(l=$(log_line "$work/op.log"); [ -z "$l" ] || echo " [log: $l]")"
 }
 
@@ -331,7 +346,7 @@ fault_at() {
         sleep 0.02
         waited=$((waited + 1))
     done
-    table "$new_table" "$device"
+    within 60 table "$new_table" "$device"
     for stopped_pid in $(stopped); do kill -CONT "$stopped_pid"; done
     # Past its own time limit only when stuck in the kernel.
     await "$pid" $((run_limit + 30)) "the operation at step $step"

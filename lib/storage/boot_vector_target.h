@@ -2,6 +2,8 @@
 // target. The record is located and read once, at construction; a slot
 // whose record could not be located, read or validated stays unusable and
 // refuses every read and write (the reason was logged at construction).
+//
+// Implemented in storage_target.cpp.
 #pragma once
 
 #include "lib/storage/boot_vector_record.h"

@@ -1,59 +1,32 @@
 // A crash-safe store that keeps each slot's blob as two complete copies,
-// each with an 8-byte check file beside it (see check_value.h).
+// each with an 8-byte check file beside it. Reads see the current copy;
+// every change goes to the other one and makes it current only once it is
+// complete on the medium, so a power cut at any instant leaves the blob
+// acknowledged last or the one in flight. Any number of processes, and
+// target objects in one process, may use one store at once: flock locks
+// on the store's own directories serialise the changes of a slot, and
+// reads go on beside them. No operation waits for a lock longer than
+// kSlotLockWait (kOpeningLockWait for opening); then it fails with
+// STATUS_TIMEOUT.
 //
-// Layout of a target with base directory B: a one-slot target uses B as
-// its slot directory, an n-slot target B/0 ... B/(n-1). In a slot
-// directory D: copy 0 is "D/1/data" with "D/1/data.chk", copy 1 is
-// "D/2/data" with "D/2/data.chk"; "<check>.tmp" exists only while a commit
-// is under way.
-//
-// Reads see the current copy; every change goes to the other one and
-// becomes current only when its data has been synced and its check file
-// written under the temporary name, renamed into place and the file system
-// synced. At
-// opening, a copy is valid when its check file matches its data, invalid
-// check files are deleted, and the valid copy whose check file is strictly
-// newer wins (equal times: copy 0). A power cut at any instant therefore
-// leaves at least the previous version readable.
-//
-// Less trusted code may write below the base directory (the base itself
-// may be a link). Nothing below it is reached through a symbolic link, and
-// nothing but a regular file is read or written as a data or check file:
-// a link, FIFO, socket, device node or directory where a store file or
-// directory should be makes that copy invalid at opening, and an update of
-// that copy fails (ENOTDIR, ELOOP, EISDIR or ENXIO, or STATUS_FAILED where
-// the open of a data file is logged) without following it or waiting on it.
-// An entry in the place of a check or transient file is removed or
-// replaced, never followed.
+// The layout, the check value, the commit with each sync, which copy wins,
+// what opening cleans up, the locks and the log lines are in
+// docs/STORE_FORMAT.md; what the store trusts is in docs/SECURITY.md.
+// Nothing below the base directory is reached through a symbolic link, and
+// nothing but a regular file with one name is read or written as a data or
+// check file.
 //
 // The store relies on its file system: a torn write of the file system's
 // own super block or group descriptors loses it whole, and ext4 writes
-// them in place, as forced-unit-access writes and as ordinary ones.
-// Devices need an eMMC that does not tear a write when its power fails
-// (reliable write for every write, or power-loss protection) and the
-// store's file system mounted with barriers on: never barrier=0 or
+// them in place. Devices need an eMMC that does not tear a write when its
+// power fails (reliable write for every write, or power-loss protection)
+// and the store's file system mounted with barriers on: never barrier=0 or
 // nobarrier.
 //
-// Any number of processes, and target objects in one process, may use one
-// store at once. Two kinds of lock keep them apart (slot_lock.h): the
-// slot's own directory is held exclusive by every change, for all of it
-// (an incremental write from beginWrite to finalise), so changes come one
-// at a time; a copy's directory ("1" or "2") is held shared by whoever
-// reads that copy, and exclusive by the change that rewrites it. Reads
-// and queries therefore go on beside a change, which never touches the
-// copy they see. Every operation first checks that the check files are
-// those it judged, and judges again when another has committed or
-// invalidated a copy since: a change never overwrites what another
-// committed, and a read serves the newest commit. Opening removes a check
-// file that does not vouch for its data only after judging the copy again
-// under its lock; when that lock is not granted within kOpeningLockWait
-// (for all the target's slots together) it removes nothing. Other
-// operations wait at most kSlotLockWait and then fail with STATUS_TIMEOUT,
-// logged with the slot's directory; exists() then answers from the copies
-// as they look without the lock.
-//
 // Failures are returned as errno values or STATUS_FAILED; nothing is
-// thrown but allocation failures.
+// thrown but allocation failures. Implemented in storage_target.cpp, with
+// the copies' judgement in copy_check.cpp and the directories in
+// slot_directories.cpp.
 #pragma once
 
 #include <array>

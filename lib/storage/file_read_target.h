@@ -6,6 +6,8 @@
 // write, and nothing is ever written here: names may be links and are
 // followed. Opening never waits, though: a FIFO opens at once and, like a
 // directory, then has no file size.
+//
+// Implemented in storage_target.cpp.
 #pragma once
 
 #include <filesystem>

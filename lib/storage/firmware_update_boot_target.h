@@ -3,6 +3,8 @@
 // finalise compares them with the boot file and only when they differ makes
 // the boot file system writable, rewrites the file and reads it back (up to
 // five attempts), then makes it read-only again.
+//
+// Implemented in storage_target.cpp.
 #pragma once
 
 #include <filesystem>

@@ -2,6 +2,8 @@
 // "/dev/mmcblk0p2": begin unmounts "/media/resources" and opens the raw
 // device, blocks go straight to the device at the caller's offsets, and
 // finalise closes it and mounts the partition again.
+//
+// Implemented in storage_target.cpp.
 #pragma once
 
 #include <filesystem>

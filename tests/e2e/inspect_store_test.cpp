@@ -189,6 +189,20 @@ const StateRow kStateRows[] = {
      {true, false},
      0,
      "/1: interrupted update (CRC differs), normal after a power cut"},
+    // An erased slot is served too: its other copy's damage is an
+    // interrupted update as well.
+    {"crc_differs_beside_an_erased_copy",
+     [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
+         twoWrites(b, target, index);
+         withSlot(b, target, index, [](Storage::TargetSlot& s) { ASSERT_EQ(s.erase(), STATUS_OK); });
+         store_test::flipByte(d / "1/data", 99);
+     },
+     "absent-blob",
+     2,
+     {"CRC differs", ""},
+     {true, false},
+     0,
+     "/1: interrupted update (CRC differs), normal after a power cut"},
     {"size_differs",
      [](const fs::path& b, const Target& target, size_t index, const fs::path& d) {
          twoWrites(b, target, index);

@@ -402,6 +402,23 @@ TEST_F(DualFileFaults, CheckFileReadFailsAtOpening) {
     expectReopenedAs(holding(older_));
 }
 
+// A planted check file of any size but 8 costs opening no read, and a
+// data file whose size the check file does not claim is not read either.
+TEST_F(DualFileFaults, OpeningReadsNoCheckFileOfAnotherSizeAndNoDataOfAnotherSize) {
+    prepare();
+    testing_support::writeBytes(base() / "2" / "data.chk", Bytes(1 << 20, 0xa5));
+    EXPECT_EQ(countCalls("read", path("2/data.chk"), {}), 0u);
+    // "2/data" names the check file too: all its reads are the check file's.
+    const auto readsOf = [&](const std::string& substr) {
+        prepare();
+        testing_support::writeBytes(base() / "2" / "data", Bytes(1 << 20, 0x5a));
+        return countCalls("read", path(substr), {});
+    };
+    const unsigned long checkReads = readsOf("2/data.chk");
+    EXPECT_GT(checkReads, 0u);
+    EXPECT_EQ(readsOf("2/data"), checkReads);
+}
+
 // A read that fails once is read again under the copy's lock before
 // anything is removed: the copy stays, and nothing is logged.
 TEST_F(DualFileFaults, DataReadThatFailsOnceKeepsTheCopy) {

@@ -15,7 +15,8 @@
 #   install-deps.sh fuzz    also clang and its libFuzzer runtime
 #   install-deps.sh device  also what builds and boots the emulated ARM64
 #                           device: qemu-system-aarch64, cpio, the file
-#                           system and module tools, Python for its lists;
+#                           system and module tools, Python for its lists,
+#                           pgrep to see that the emulator still runs;
 #                           and Debian's arm64 packages become reachable
 #                           (dpkg --add-architecture arm64), where the
 #                           guest's kernel and programs come from
@@ -31,7 +32,7 @@ arm64_packages=0
 for group in "$@"; do
   case "$group" in
     device)
-      packages+=(qemu-system-arm cpio fdisk e2fsprogs kmod python3 binutils)
+      packages+=(qemu-system-arm cpio fdisk e2fsprogs kmod python3 binutils procps)
       arm64_packages=1
       ;;
     tests) packages+=(fdisk e2fsprogs strace make pkgconf python3) ;;

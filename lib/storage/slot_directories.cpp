@@ -15,8 +15,6 @@ namespace Storage {
 namespace fs = std::filesystem;
 namespace {
 
-constexpr const char* kCopyNames[2] = {"1", "2"};
-
 CopyDirectory reached(int fd) {
     CopyDirectory directory;
     directory.fd = fd;
@@ -42,10 +40,6 @@ CopyDirectory reachBelow(const CopyDirectory& parent, const char* name, bool cre
 }
 
 }  // namespace
-
-std::string slotDirectoryName(size_t slotCount, size_t index) {
-    return slotCount == 1 ? std::string() : std::to_string(index);
-}
 
 Status CopyDirectory::computeCheckAndSync(uint64_t& value, int& syncError) const {
     syncError = 0;
@@ -137,7 +131,8 @@ UniqueFd SlotDirectories::openForReading(unsigned copy, const char* name, struct
             errno = base.missing ? ENOENT : base.error;
             return UniqueFd();
         }
-        const std::string path = (slotName_.empty() ? std::string() : slotName_ + "/") + kCopyNames[copy] + "/" + name;
+        const std::string path =
+            (slotName_.empty() ? std::string() : slotName_ + "/") + kCopyDirectoryNames[copy] + "/" + name;
         UniqueFd fd = openRegularBeneath(base.fd, path.c_str(), O_RDONLY, &status);
         if (fd || errno != ENOSYS) return fd;
     }
@@ -145,11 +140,11 @@ UniqueFd SlotDirectories::openForReading(unsigned copy, const char* name, struct
 }
 
 fs::path SlotDirectories::copyPath(unsigned copy) const {
-    return (slotName_.empty() ? basePath_ : basePath_ / slotName_) / kCopyNames[copy];
+    return (slotName_.empty() ? basePath_ : basePath_ / slotName_) / kCopyDirectoryNames[copy];
 }
 
 CopyDirectory SlotDirectories::reach(unsigned copy, bool create) {
-    return reachBelow(reachSlot(create), kCopyNames[copy], create, copies_[copy]);
+    return reachBelow(reachSlot(create), kCopyDirectoryNames[copy], create, copies_[copy]);
 }
 
 CopyDirectory SlotDirectories::reachSlot(bool create) {

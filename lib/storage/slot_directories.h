@@ -19,19 +19,11 @@
 
 #include "lib/storage/check_value.h"
 #include "lib/storage/copy_check.h"
+#include "lib/storage/store_names.h"
 #include "lib/util/fd.h"
 #include "lib/util/status.h"
 
 namespace Storage {
-
-// The names inside a copy directory.
-constexpr const char* kDataName = "data";
-constexpr const char* kCheckName = "data.chk";
-constexpr const char* kTransientName = "data.chk.tmp";
-
-// The directory of slot `index` below the base directory: none (empty)
-// when the target has one slot, else the index in decimal.
-std::string slotDirectoryName(size_t slotCount, size_t index);
 
 // A copy's directory as far as an operation could reach it.
 struct CopyDirectory {

@@ -52,12 +52,6 @@ constexpr std::chrono::milliseconds kLockSlice{50};
 // back.
 constexpr time_t kCheckTimeStepSeconds = 2;
 
-fs::path withSuffix(const fs::path& path, const char* suffix) {
-    fs::path result = path;
-    result += suffix;
-    return result;
-}
-
 std::error_code errorCode(int error) { return std::error_code(error, std::generic_category()); }
 
 // Logs that `what` at `path` stayed locked by another past the bound.
@@ -125,12 +119,11 @@ SlotHandle DualFileTarget::getSlot(size_t index) {
 
 DualFileTarget::Slot::Slot(fs::path baseDirectory, std::string name, int base, LockDeadline deadline)
     : baseDirectory_(std::move(baseDirectory)), name_(std::move(name)) {
-    const char* const names[] = {"1/data", "2/data"};
     const fs::path directory = directoryPath();
     for (unsigned i = 0; i < copies_.size(); ++i) {
         Copy& copy = copies_[i];
-        copy.dataPath = directory / names[i];
-        copy.checkPath = withSuffix(copy.dataPath, ".chk");
+        copy.dataPath = directory / kCopyDirectoryNames[i] / kDataName;
+        copy.checkPath = directory / kCopyDirectoryNames[i] / kCheckName;
     }
     SlotDirectories opening(baseDirectory_, name_, base);
     judge(opening, &deadline);
@@ -310,7 +303,7 @@ Status DualFileTarget::Slot::commit(unsigned index, SlotDirectories& directories
     {
         const UniqueFd tmp = directory.openToWrite(kTransientName, O_WRONLY | O_CREAT | O_TRUNC, kFileMode);
         // A failed open is logged here; the write below then fails.
-        if (!tmp) logOpenFailure(withSuffix(copy.checkPath, ".tmp").c_str(), errno);
+        if (!tmp) logOpenFailure((copy.dataPath.parent_path() / kTransientName).c_str(), errno);
         uint8_t bytes[kCheckValueSize];
         encodeCheckValue(value, bytes);
         const ssize_t written = ::write(tmp.get(), bytes, sizeof bytes);

@@ -12,8 +12,6 @@
 namespace Storage {
 namespace {
 
-constexpr const char* kCopyNames[2] = {"1", "2"};
-
 EntryKind kindOf(mode_t mode) {
     if (S_ISREG(mode)) return EntryKind::kFile;
     if (S_ISDIR(mode)) return EntryKind::kDirectory;
@@ -58,7 +56,7 @@ void describeCopy(int base, const std::string& slotName, unsigned index, CopyIns
         parent = slot.get();
     }
     UniqueFd directory;
-    if (!descend(parent, kCopyNames[index], way, copy, directory)) return;
+    if (!descend(parent, kCopyDirectoryNames[index], way, copy, directory)) return;
     copy.data = entryAt(directory.get(), kDataName);
     copy.checkFile = entryAt(directory.get(), kCheckName);
     copy.transient = entryAt(directory.get(), kTransientName);

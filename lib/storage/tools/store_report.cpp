@@ -17,8 +17,6 @@ using Storage::EntryKind;
 using Storage::SlotInspection;
 using Storage::SlotState;
 
-constexpr const char* kCopyNames[2] = {"1", "2"};
-
 bool isFileOrMissing(EntryKind kind) { return kind == EntryKind::kFile || kind == EntryKind::kMissing; }
 
 std::string kindText(EntryKind kind) { return std::string("is a ") + Storage::entryKindName(kind); }
@@ -91,7 +89,7 @@ std::string copySummary(const CopyInspection& copy) {
 }
 
 std::string currentText(const SlotInspection& slot) {
-    return slot.copies[slot.current].check.valid() ? kCopyNames[slot.current] : "-";
+    return slot.copies[slot.current].check.valid() ? Storage::kCopyDirectoryNames[slot.current] : "-";
 }
 
 std::string padded(const std::string& text, size_t width) {
@@ -145,7 +143,7 @@ std::string copyReason(const CopyInspection& copy) {
 }
 
 std::filesystem::path copyPath(const TargetReport& target, size_t index, unsigned copy, const char* name) {
-    std::filesystem::path path = slotPath(target, index) / kCopyNames[copy];
+    std::filesystem::path path = slotPath(target, index) / Storage::kCopyDirectoryNames[copy];
     if (*name != '\0') path /= name;
     return path;
 }

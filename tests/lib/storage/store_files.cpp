@@ -1,5 +1,7 @@
 #include "store_files.h"
 
+#include "lib/storage/store_names.h"
+
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -76,7 +78,8 @@ int64_t touchNow(const fs::path& path) {
 }
 
 std::string copyLines(const std::string& copy, const Bytes& blob) {
-    return "f " + copy + "/data " + hex(blob) + "\nf " + copy + "/data.chk " + hex(expectedCheckFile(blob)) + "\n";
+    return "f " + copy + "/" + Storage::kDataName + " " + hex(blob) + "\nf " + copy + "/" + Storage::kCheckName + " " +
+           hex(expectedCheckFile(blob)) + "\n";
 }
 
 std::string describeTree(const fs::path& root, bool withTimes) {
@@ -100,16 +103,16 @@ std::string describeTree(const fs::path& root, bool withTimes) {
 
 void writeCopy(const fs::path& copyDir, const Bytes& data, int64_t checkTimeNs) {
     fs::create_directories(copyDir);
-    testing_support::writeBytes(copyDir / "data", data);
-    testing_support::writeBytes(copyDir / "data.chk", expectedCheckFile(data));
-    setMtimeNs(copyDir / "data.chk", checkTimeNs);
+    testing_support::writeBytes(copyDir / Storage::kDataName, data);
+    testing_support::writeBytes(copyDir / Storage::kCheckName, expectedCheckFile(data));
+    setMtimeNs(copyDir / Storage::kCheckName, checkTimeNs);
 }
 
 void writeAbsentCopy(const fs::path& copyDir, int64_t checkTimeNs) {
     fs::create_directories(copyDir);
-    fs::remove(copyDir / "data");
-    testing_support::writeBytes(copyDir / "data.chk", absentCheckFile());
-    setMtimeNs(copyDir / "data.chk", checkTimeNs);
+    fs::remove(copyDir / Storage::kDataName);
+    testing_support::writeBytes(copyDir / Storage::kCheckName, absentCheckFile());
+    setMtimeNs(copyDir / Storage::kCheckName, checkTimeNs);
 }
 
 bool SlotContent::operator==(const SlotContent& other) const {
@@ -157,9 +160,10 @@ void flipByte(const fs::path& path, size_t offset) {
 }
 
 void damageAtRandom(const fs::path& slotDirectory, std::mt19937& random) {
-    const char* const files[] = {"1/data", "1/data.chk", "2/data", "2/data.chk"};
     for (int damage = 1 + static_cast<int>(random() % 3); damage > 0; --damage) {
-        const fs::path file = slotDirectory / files[random() % 4];
+        const unsigned pick = random() % 4;
+        const fs::path file = slotDirectory / Storage::kCopyDirectoryNames[pick / 2] /
+                              (pick % 2 == 0 ? Storage::kDataName : Storage::kCheckName);
         if (!fs::exists(file)) continue;
         switch (random() % 4) {
             case 0:

@@ -1,9 +1,9 @@
 # The faults campaign's cases as a Markdown table, a row for each file
 # system, operation, fault and recovery:
 #   awk -f faults_table.awk build/arm64-device/faults-full-console.log
-# Only the lines of the campaign proper ("@@ case N ...") before the broken
-# store's count.
-/^@@ broken store:/ { done = 1 }
+# Only the lines of the campaign proper ("@@ case N ..."), up to its totals:
+# the broken store's cases follow them.
+/^@@ faults: [0-9]+ cases/ { done = 1 }
 done || !/^@@ case [0-9]+ / { next }
 {
     fs = $4

@@ -14,6 +14,7 @@
 #include <cstring>
 #include <filesystem>
 #include <functional>
+#include <initializer_list>
 #include <iterator>
 #include <memory>
 #include <stdexcept>
@@ -85,8 +86,17 @@ protected:
     static Status writeAt(TargetSlot& slot, int64_t offset, const Bytes& block) {
         return slot.writeAt(offset, block.data(), block.size());
     }
+    // The slot of a fresh one-slot target after each blob was written to it in
+    // turn; the target lives as long as the test.
+    TargetSlot& slotAfterWrites(std::initializer_list<Bytes> blobs) {
+        written = open();
+        TargetSlot& slot = slotOf(*written);
+        for (const Bytes& blob : blobs) EXPECT_EQ(write(slot, blob), STATUS_OK);
+        return slot;
+    }
 
     ScratchDir dir;
+    std::unique_ptr<DualFileTarget> written;
 };
 
 // ---- the target ----
@@ -793,11 +803,7 @@ TEST_F(DualFileStore, CheckFileOfALargerBlob) {
 }
 
 TEST_F(DualFileStore, WriteReplacesALongerLeftover) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, patternBytes(3000, 14)), STATUS_OK);
-    EXPECT_EQ(write(slot, patternBytes(100, 15)), STATUS_OK);
-    EXPECT_EQ(write(slot, bytesOf("short")), STATUS_OK);
+    slotAfterWrites({patternBytes(3000, 14), patternBytes(100, 15), bytesOf("short")});
     EXPECT_EQ(readBytes(data(1)), bytesOf("short"));
     EXPECT_EQ(reopened(), holding(bytesOf("short")));
 }
@@ -824,9 +830,7 @@ TEST_F(DualFileStore, FirstCommitKeepsItsOwnTime) {
 }
 
 TEST_F(DualFileStore, LaterCommitIsStrictlyNewer) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("a")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("a")});
     for (int i = 0; i < 5; ++i) {
         const fs::path previous = check((i + 1) % 2);
         const fs::path next = check(i % 2);
@@ -855,9 +859,7 @@ protected:
 };
 
 TEST_P(FutureDatedPrevious, NextCheckFileIsTwoSecondsLater) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("first")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("first")});
     const int64_t future = store_test::nowNs() + 3600 * kSecond + 123456789;
     setMtimeNs(check(1), future);
 
@@ -954,10 +956,7 @@ TEST_F(DualFileStore, EraseOfAFreshStoreCommitsAnAbsentBlob) {
 TEST_F(DualFileStore, EraseRemovesTheOtherCopysData) {
     const Bytes first = bytesOf("first");
     const Bytes second = bytesOf("second");
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, first), STATUS_OK);
-    EXPECT_EQ(write(slot, second), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({first, second});
     EXPECT_EQ(slot.erase(), STATUS_OK);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", second) + "f 2/data.chk ffffffffffffffff\n");
     EXPECT_EQ(contentOf(slot), absentBlob());
@@ -989,10 +988,7 @@ TEST_F(DualFileStore, WriteRecreatesAMissingCopyDirectory) {
 // ---- incremental writes ----
 
 TEST_F(DualFileStore, FinaliseWithoutBeginChangesNothing) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("one")), STATUS_OK);
-    EXPECT_EQ(write(slot, bytesOf("two")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("one"), bytesOf("two")});
     const std::string before = describeTree(base(), true);
     EXPECT_EQ(slot.finalise(), STATUS_INVALID_OPERATION);
     EXPECT_EQ(describeTree(base(), true), before);
@@ -1008,10 +1004,7 @@ TEST_F(DualFileStore, FinaliseOfAFreshStoreChangesNothing) {
 }
 
 TEST_F(DualFileStore, BeginThenFinaliseCommitsAnAbsentBlob) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("one")), STATUS_OK);
-    EXPECT_EQ(write(slot, bytesOf("two")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("one"), bytesOf("two")});
     // Current is copy 0; copy 1 still holds "one".
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", bytesOf("two")) + "f 2/data.chk " +
@@ -1026,9 +1019,7 @@ TEST_F(DualFileStore, BeginThenFinaliseCommitsAnAbsentBlob) {
 
 TEST_F(DualFileStore, PendingBlocksAreInvisibleUntilFinalised) {
     const Bytes old = bytesOf("old content");
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, old), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({old});
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
     EXPECT_EQ(writeAt(slot, 0, bytesOf("head")), STATUS_OK);
     EXPECT_EQ(writeAt(slot, 10, bytesOf("tail")), STATUS_OK);
@@ -1045,10 +1036,7 @@ TEST_F(DualFileStore, PendingBlocksAreInvisibleUntilFinalised) {
 }
 
 TEST_F(DualFileStore, BeginDropsTheOtherCopysLeftovers) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, patternBytes(500, 16)), STATUS_OK);
-    EXPECT_EQ(write(slot, bytesOf("current")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({patternBytes(500, 16), bytesOf("current")});
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
     EXPECT_FALSE(fs::exists(data(1)));
     EXPECT_EQ(writeAt(slot, 0, bytesOf("new")), STATUS_OK);
@@ -1057,9 +1045,7 @@ TEST_F(DualFileStore, BeginDropsTheOtherCopysLeftovers) {
 }
 
 TEST_F(DualFileStore, SecondBeginDoesNotRestart) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("current")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("current")});
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
     EXPECT_EQ(writeAt(slot, 0, bytesOf("abc")), STATUS_OK);
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
@@ -1071,9 +1057,7 @@ TEST_F(DualFileStore, SecondBeginDoesNotRestart) {
 }
 
 TEST_F(DualFileStore, WriteAtInsideABegunWriteWithABadOffset) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("current")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("current")});
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
     EXPECT_EQ(writeAt(slot, -1, bytesOf("x")), STATUS_INVALID_PARAMETER);
     EXPECT_EQ(contentOf(slot), holding(bytesOf("current")));
@@ -1108,9 +1092,7 @@ TEST_F(DualFileStore, OneShotWriteInsideABegunWriteLeavesItBegun) {
 
 TEST_F(DualFileStore, WriteAtKeepsTheBytesAroundTheBlock) {
     const Bytes old = patternBytes(300, 17);
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, old), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({old});
     const Bytes block = patternBytes(20, 18);
     EXPECT_EQ(writeAt(slot, 100, block), STATUS_OK);
     Bytes expected = old;
@@ -1121,9 +1103,7 @@ TEST_F(DualFileStore, WriteAtKeepsTheBytesAroundTheBlock) {
 }
 
 TEST_F(DualFileStore, WriteAtPastTheEndExtends) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("0123456789")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("0123456789")});
     EXPECT_EQ(writeAt(slot, 8, bytesOf("ABCDE")), STATUS_OK);
     EXPECT_EQ(contentOf(slot), holding(bytesOf("01234567ABCDE")));
     EXPECT_EQ(writeAt(slot, 15, bytesOf("Z")), STATUS_OK);
@@ -1156,10 +1136,7 @@ TEST_F(DualFileStore, WriteAtOverAnInvalidCurrentCopyWritesIntoTheLeftover) {
 }
 
 TEST_F(DualFileStore, WriteAtAfterEraseCopiesNothing) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("first")), STATUS_OK);
-    EXPECT_EQ(write(slot, bytesOf("second")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("first"), bytesOf("second")});
     EXPECT_EQ(slot.erase(), STATUS_OK);
     // The current copy (1) has no data; copy 0 still holds "second".
     EXPECT_EQ(writeAt(slot, 0, bytesOf("XY")), STATUS_OK);
@@ -1167,10 +1144,7 @@ TEST_F(DualFileStore, WriteAtAfterEraseCopiesNothing) {
 }
 
 TEST_F(DualFileStore, WriteAtWithABadOffsetLeavesTheCurrentCopy) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("first")), STATUS_OK);
-    EXPECT_EQ(write(slot, bytesOf("second")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("first"), bytesOf("second")});
     EXPECT_EQ(writeAt(slot, -5, bytesOf("x")), STATUS_INVALID_PARAMETER);
     EXPECT_EQ(contentOf(slot), holding(bytesOf("second")));
     EXPECT_FALSE(fs::exists(check(1)));

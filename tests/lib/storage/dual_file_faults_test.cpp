@@ -11,6 +11,7 @@
 #include <gtest/gtest.h>
 
 #include "child_process.h"
+#include "dual_file_test_names.h"
 #include "fault_injection.h"
 #include "files.h"
 #include "lib/storage/dual_file_target.h"
@@ -21,30 +22,13 @@
 
 namespace {
 
-// How an open failure reported by the descriptor helpers begins.
-const std::string kOpenFailure = testing_support::openFailurePrefix();
-
-namespace fs = std::filesystem;
-using store_test::absentBlob;
-using store_test::Bytes;
-using store_test::bytesOf;
-using store_test::contentOf;
-using store_test::copyLines;
-using store_test::describeTree;
-using store_test::expectedCheckFile;
-using store_test::hex;
-using store_test::holding;
-using store_test::kPast;
-using store_test::kSecond;
-using store_test::patternBytes;
-using store_test::SlotContent;
+using namespace dual_file_test;
 using testing_support::Environment;
 using testing_support::faultCountEnv;
 using testing_support::faultEnv;
 using testing_support::faultFromEnv;
 using testing_support::ProcessResult;
 using testing_support::readFaultCount;
-using testing_support::ScratchDir;
 
 // Without openat2 (qemu-user), the first read of a store tries it once, fails
 // with ENOSYS and goes through the directories from then on: the open of

@@ -25,6 +25,7 @@
 #include <gtest/gtest.h>
 
 #include "child_process.h"
+#include "dual_file_test_names.h"
 #include "files.h"
 #include "lib/util/log.h"
 #include "scratch_dir.h"
@@ -33,33 +34,14 @@
 
 namespace {
 
-// How an open failure reported by the descriptor helpers begins.
-const std::string kOpenFailure = testing_support::openFailurePrefix();
-
-namespace fs = std::filesystem;
-using Storage::DualFileTarget;
+using namespace dual_file_test;
 using Storage::SlotHandle;
-using Storage::TargetSlot;
-using store_test::absentBlob;
 using store_test::absentCheckFile;
-using store_test::Bytes;
-using store_test::bytesOf;
-using store_test::contentOf;
-using store_test::copyLines;
-using store_test::describeTree;
-using store_test::expectedCheckFile;
-using store_test::hex;
-using store_test::holding;
-using store_test::kPast;
-using store_test::kSecond;
 using store_test::mtimeNs;
 using store_test::nothingStored;
-using store_test::patternBytes;
 using store_test::setMtimeNs;
-using store_test::SlotContent;
 using testing_support::readBytes;
 using testing_support::runInChild;
-using testing_support::ScratchDir;
 using testing_support::writeBytes;
 
 constexpr int64_t kTwoSeconds = 2 * kSecond;

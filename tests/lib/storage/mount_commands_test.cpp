@@ -5,6 +5,7 @@
 #include <filesystem>
 #include <map>
 #include <string>
+#include <tuple>
 
 #include <gtest/gtest.h>
 
@@ -45,7 +46,6 @@ struct MountCase {
 void remountRw() { printStatus(Storage::remountBootPartition(true)); }
 void remountRo() { printStatus(Storage::remountBootPartition(false)); }
 void mountResources() { printStatus(Storage::mountPartition("/media/resources")); }
-void unmountResources() { printStatus(Storage::unmountPartition("/media/resources")); }
 
 const std::map<std::string, std::string> kSucceeds;
 const std::map<std::string, std::string> kExits32 = {{"FAKE_MOUNT_EXIT", "32"}};
@@ -78,34 +78,6 @@ const MountCase kMountCases[] = {
     // Any failure of the command is STATUS_FAILED, a signal too.
     {"RemountKilledMountIsFailed", remountRw, LOG_PRIORITY_ERROR, kKilled,
      "lib/storage/storage_target:N Failed to execute mount\nstatus 52\n", "mount [-o] [remount,rw] [/media/boot]\n"},
-    // ---- mountPartition ----
-    {"MountRunsMountWithTheMountPointOnly", mountResources, LOG_PRIORITY_WARNING, kSucceeds,
-     "Mounting \"/media/resources\"\nstatus 0\n", "mount [/media/resources]\n"},
-    {"MountNoNoticeBelowWarningPriority", mountResources, LOG_PRIORITY_ERROR, kSucceeds, "status 0\n",
-     "mount [/media/resources]\n"},
-    {"MountFailingMountIsReported", mountResources, LOG_PRIORITY_WARNING, kExits32,
-     "Mounting \"/media/resources\"\n"
-     "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\n"
-     "status 52\n",
-     "mount [/media/resources]\n"},
-    {"MountFailureStillReportedAtErrorPriority", mountResources, LOG_PRIORITY_ERROR, kExits1,
-     "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n", "mount [/media/resources]\n"},
-    {"MountNoReportAtCriticalPriority", mountResources, LOG_PRIORITY_CRITICAL, kExits1, "status 52\n",
-     "mount [/media/resources]\n"},
-    {"MountKilledMountIsNotFound", mountResources, LOG_PRIORITY_WARNING, kKilled,
-     "Mounting \"/media/resources\"\n"
-     "[lib/storage/storage_target:N] err_code = 2 (STATUS_NOT_FOUND)\n"
-     "status 2\n",
-     "mount [/media/resources]\n"},
-    // The command's standard output is captured and dropped; its standard
-    // error is left alone.
-    {"MountCommandOutputIsDiscarded",
-     mountResources,
-     LOG_PRIORITY_WARNING,
-     {{"FAKE_MOUNT_STDOUT", "said on stdout"}, {"FAKE_MOUNT_STDERR", "said on stderr"}},
-     "Mounting \"/media/resources\"\nstatus 0\n",
-     "mount [/media/resources]\n",
-     "said on stderr\n"},
     // The notice quotes the mount point; the command line carries it as it
     // stands, so the shell splits it.
     {"MountPointIsNotQuotedForTheShell",
@@ -117,23 +89,6 @@ const MountCase kMountCases[] = {
      "Mounting \"/media/two words\"\nstatus 0\n"
      "Mounting \"/media/\\\"q\\\"\"\nstatus 0\n",
      "mount [/media/two] [words]\nmount [/media/q]\n"},
-    // ---- unmountPartition ----
-    {"UnmountRunsUmountWithTheMountPointOnly", unmountResources, LOG_PRIORITY_WARNING, kSucceeds,
-     "Unmounting \"/media/resources\"\nstatus 0\n", "umount [/media/resources]\n"},
-    {"UnmountNoNoticeBelowWarningPriority", unmountResources, LOG_PRIORITY_ERROR, kSucceeds, "status 0\n",
-     "umount [/media/resources]\n"},
-    {"UnmountFailingUmountIsReported", unmountResources, LOG_PRIORITY_WARNING, kExits32,
-     "Unmounting \"/media/resources\"\n"
-     "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\n"
-     "status 52\n",
-     "umount [/media/resources]\n"},
-    {"UnmountFailureStillReportedAtErrorPriority", unmountResources, LOG_PRIORITY_ERROR, kExits1,
-     "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n", "umount [/media/resources]\n"},
-    {"UnmountKilledUmountIsNotFound", unmountResources, LOG_PRIORITY_WARNING, kKilled,
-     "Unmounting \"/media/resources\"\n"
-     "[lib/storage/storage_target:N] err_code = 2 (STATUS_NOT_FOUND)\n"
-     "status 2\n",
-     "umount [/media/resources]\n"},
 };
 
 class MountCommands : public ::testing::TestWithParam<MountCase> {};
@@ -156,6 +111,75 @@ TEST_P(MountCommands, LogAndCommandsRun) {
 
 INSTANTIATE_TEST_SUITE_P(StandInCommands, MountCommands, ::testing::ValuesIn(kMountCases),
                          [](const ::testing::TestParamInfo<MountCase>& info) { return std::string(info.param.name); });
+
+// ---- mountPartition and unmountPartition ----
+
+// The two commands on a partition behave alike; each runs under every
+// behaviour of the stand-in below.
+struct PartitionCommand {
+    const char* name;
+    Status (*call)(const std::string& mountPoint);
+    // The notice at warning priority, and the command's record.
+    const char* notice;
+    const char* calls;
+};
+
+const PartitionCommand kPartitionCommands[] = {
+    {"Mount", Storage::mountPartition, "Mounting \"/media/resources\"\n", "mount [/media/resources]\n"},
+    {"Unmount", Storage::unmountPartition, "Unmounting \"/media/resources\"\n", "umount [/media/resources]\n"},
+};
+
+// What the stand-in does and what the log shows after the notice, when the
+// threshold lets the notice through.
+struct StandIn {
+    const char* name;
+    int threshold;
+    std::map<std::string, std::string> env;
+    bool noticeShown;
+    const char* afterNotice;
+    const char* err = "";
+};
+
+const StandIn kStandIns[] = {
+    {"RunsWithTheMountPointOnly", LOG_PRIORITY_WARNING, kSucceeds, true, "status 0\n"},
+    {"NoNoticeBelowWarningPriority", LOG_PRIORITY_ERROR, kSucceeds, false, "status 0\n"},
+    {"FailingCommandIsReported", LOG_PRIORITY_WARNING, kExits32, true,
+     "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n"},
+    {"FailureStillReportedAtErrorPriority", LOG_PRIORITY_ERROR, kExits1, false,
+     "[lib/storage/storage_target:N] err_code = 52 (STATUS_FAILED)\nstatus 52\n"},
+    {"NoReportAtCriticalPriority", LOG_PRIORITY_CRITICAL, kExits1, false, "status 52\n"},
+    {"KilledCommandIsNotFound", LOG_PRIORITY_WARNING, kKilled, true,
+     "[lib/storage/storage_target:N] err_code = 2 (STATUS_NOT_FOUND)\nstatus 2\n"},
+    // The command's standard output is captured and dropped; its standard
+    // error is left alone.
+    {"CommandOutputIsDiscarded",
+     LOG_PRIORITY_WARNING,
+     {{"FAKE_MOUNT_STDOUT", "said on stdout"}, {"FAKE_MOUNT_STDERR", "said on stderr"}},
+     true,
+     "status 0\n",
+     "said on stderr\n"},
+};
+
+class PartitionCommands : public ::testing::TestWithParam<std::tuple<PartitionCommand, StandIn>> {};
+
+TEST_P(PartitionCommands, LogAndCommandsRun) {
+    const PartitionCommand& command = std::get<0>(GetParam());
+    const StandIn& standIn = std::get<1>(GetParam());
+    FakeMountCommands fake;
+    const auto result = fake.run(
+        standIn.threshold, [&] { return printStatus(command.call("/media/resources")); }, standIn.env);
+    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(withoutStorageLineNumbers(result.out),
+              std::string(standIn.noticeShown ? command.notice : "") + standIn.afterNotice);
+    EXPECT_EQ(result.err, standIn.err);
+    EXPECT_EQ(fake.calls(), command.calls);
+}
+
+INSTANTIATE_TEST_SUITE_P(StandInCommands, PartitionCommands,
+                         ::testing::Combine(::testing::ValuesIn(kPartitionCommands), ::testing::ValuesIn(kStandIns)),
+                         [](const ::testing::TestParamInfo<std::tuple<PartitionCommand, StandIn>>& info) {
+                             return std::string(std::get<0>(info.param).name) + std::get<1>(info.param).name;
+                         });
 
 // ---- without a mount command ----
 

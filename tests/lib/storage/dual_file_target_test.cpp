@@ -68,6 +68,16 @@ protected:
     static Status writeAt(TargetSlot& slot, int64_t offset, const Bytes& block) {
         return slot.writeAt(offset, block.data(), block.size());
     }
+    // Both reads at offset 0 fail with `status`, leave the buffer as it was
+    // and leave readSome's count alone.
+    static void expectReadsFail(TargetSlot& slot, Status status) {
+        uint8_t buffer[4] = {1, 2, 3, 4};
+        size_t count = 42;
+        EXPECT_EQ(slot.read(buffer, sizeof buffer, 0), status);
+        EXPECT_EQ(slot.readSome(buffer, sizeof buffer, 0, count), status);
+        EXPECT_EQ(count, 42u);
+        EXPECT_EQ(Bytes(buffer, buffer + 4), (Bytes{1, 2, 3, 4}));
+    }
     // The slot of a fresh one-slot target after each blob was written to it in
     // turn; the target lives as long as the test.
     TargetSlot& slotAfterWrites(std::initializer_list<Bytes> blobs) {
@@ -91,12 +101,7 @@ TEST_F(DualFileStore, FreshOneSlotStoreHoldsNothing) {
     EXPECT_FALSE(slot.ownsSlot());
     EXPECT_FALSE(slot->exists());
     EXPECT_FALSE(slot->isValid());
-    uint8_t buffer[4] = {1, 2, 3, 4};
-    size_t count = 99;
-    EXPECT_EQ(slot->read(buffer, sizeof buffer, 0), STATUS_NOT_FOUND);
-    EXPECT_EQ(slot->readSome(buffer, sizeof buffer, 0, count), STATUS_NOT_FOUND);
-    EXPECT_EQ(count, 99u);
-    EXPECT_EQ(Bytes(buffer, buffer + 4), (Bytes{1, 2, 3, 4}));
+    expectReadsFail(*slot.get(), STATUS_NOT_FOUND);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n");
 }
 
@@ -294,11 +299,7 @@ TEST_F(DualFileStore, CommittedAbsentBlob) {
     TargetSlot& slot = slotOf(*target);
     EXPECT_TRUE(slot.isValid());
     EXPECT_FALSE(slot.exists());
-    uint8_t buffer[4] = {};
-    size_t count = 42;
-    EXPECT_EQ(slot.read(buffer, sizeof buffer, 0), STATUS_NOT_FOUND);
-    EXPECT_EQ(slot.readSome(buffer, sizeof buffer, 0, count), STATUS_NOT_FOUND);
-    EXPECT_EQ(count, 42u);
+    expectReadsFail(slot, STATUS_NOT_FOUND);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data.chk ffffffffffffffff\n");
 }
 
@@ -328,11 +329,7 @@ TEST_F(DualFileStore, NeitherCopyValidReadsFailOnCopy0) {
     TargetSlot& slot = slotOf(*target);
     EXPECT_FALSE(slot.isValid());
     EXPECT_FALSE(slot.exists());
-    uint8_t buffer[4] = {};
-    size_t count = 42;
-    EXPECT_EQ(slot.read(buffer, sizeof buffer, 0), STATUS_FAILED);
-    EXPECT_EQ(slot.readSome(buffer, sizeof buffer, 0, count), STATUS_FAILED);
-    EXPECT_EQ(count, 42u);
+    expectReadsFail(slot, STATUS_FAILED);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(bytesOf("unchecked zero")) + "\nf 2/data " +
                                         hex(bytesOf("unchecked one")) + "\n");
 }

@@ -78,6 +78,26 @@ protected:
         EXPECT_EQ(count, 42u);
         EXPECT_EQ(Bytes(buffer, buffer + 4), (Bytes{1, 2, 3, 4}));
     }
+    // In a child with the log on standard output: `body` on the slot of a
+    // fresh one-slot target with the blob "new", then the slot's content in
+    // hex on a line of its own.
+    testing_support::ProcessResult newBlobInChild(const std::function<void(TargetSlot&, const Bytes&)>& body) {
+        return runInChild([&] {
+            setLogOutput(LOG_OUTPUT_STDOUT);
+            DualFileTarget target(base(), 1);
+            TargetSlot& slot = *target.getSlot(0).get();
+            body(slot, bytesOf("new"));
+            std::printf("%s\n", hex(contentOf(slot).data).c_str());
+            return 0;
+        });
+    }
+    // Writes each blob in turn through a one-slot target that is closed
+    // before this returns.
+    void storeInTurn(std::initializer_list<Bytes> blobs) {
+        DualFileTarget target(base(), 1);
+        TargetSlot& slot = slotOf(target);
+        for (const Bytes& blob : blobs) EXPECT_EQ(write(slot, blob), STATUS_OK);
+    }
     // The slot of a fresh one-slot target after each blob was written to it in
     // turn; the target lives as long as the test.
     TargetSlot& slotAfterWrites(std::initializer_list<Bytes> blobs) {
@@ -752,10 +772,7 @@ TEST_F(DualFileStore, WritesAlternateBetweenTheCopies) {
 TEST_F(DualFileStore, WriteAfterReopeningGoesToTheOtherCopy) {
     const Bytes first = bytesOf("first");
     const Bytes second = bytesOf("second");
-    {
-        auto target = open();
-        EXPECT_EQ(write(slotOf(*target), first), STATUS_OK);
-    }
+    storeInTurn({first});
     auto target = open();
     EXPECT_EQ(write(slotOf(*target), second), STATUS_OK);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", second) + copyLines("2", first));
@@ -853,10 +870,7 @@ TEST_P(FutureDatedPrevious, NextCheckFileIsTwoSecondsLater) {
 }
 
 TEST_P(FutureDatedPrevious, ReopeningPicksTheNewCommit) {
-    {
-        auto target = open();
-        EXPECT_EQ(write(slotOf(*target), bytesOf("first")), STATUS_OK);
-    }
+    storeInTurn({bytesOf("first")});
     const int64_t future = store_test::nowNs() + 3600 * kSecond;
     setMtimeNs(check(1), future);
     auto target = open();
@@ -1134,22 +1148,11 @@ TEST_F(DualFileStore, WriteAtWithABadOffsetLeavesTheCurrentCopy) {
 
 // A directory in place of the other copy's check file cannot be removed.
 TEST_F(DualFileStore, UnremovableCheckPathFailsTheWrite) {
-    {
-        auto target = open();
-        EXPECT_EQ(write(slotOf(*target), bytesOf("old")), STATUS_OK);
-        EXPECT_EQ(write(slotOf(*target), bytesOf("older")), STATUS_OK);
-    }
+    storeInTurn({bytesOf("old"), bytesOf("older")});
     fs::remove(check(1));
     fs::create_directories(check(1) / "inside");
-    const auto result = runInChild([&] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        DualFileTarget target(base(), 1);
-        TargetSlot& slot = *target.getSlot(0).get();
-        const Bytes blob = bytesOf("new");
-        std::printf("write %u\n", slot.write(blob.data(), blob.size()));
-        std::printf("%s\n", hex(contentOf(slot).data).c_str());
-        return 0;
-    });
+    const auto result = newBlobInChild(
+        [](TargetSlot& slot, const Bytes& blob) { std::printf("write %u\n", slot.write(blob.data(), blob.size())); });
     EXPECT_EQ(result.out, "lib/storage/storage_target:334 Failure cleaning up checkfile \"" + check(1).string() +
                               "\"\nlib/storage/storage_target:378 generic:39\nwrite 39\n" + hex(bytesOf("older")) +
                               "\n");
@@ -1168,18 +1171,12 @@ TEST_F(DualFileStore, LinkedCopyDirectoryFailsEveryUpdate) {
     // Copy 1's directory becomes a dangling symbolic link.
     fs::remove_all(copyDir(1));
     fs::create_directory_symlink(dir / "nowhere", copyDir(1));
-    const auto result = runInChild([&] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        DualFileTarget target(base(), 1);
-        TargetSlot& slot = *target.getSlot(0).get();
-        const Bytes blob = bytesOf("new");
+    const auto result = newBlobInChild([](TargetSlot& slot, const Bytes& blob) {
         std::printf("write %u\n", slot.write(blob.data(), blob.size()));
         std::printf("writeAt %u\n", slot.writeAt(1, blob.data(), blob.size()));
         std::printf("erase %u\n", slot.erase());
         std::printf("beginWrite %u\n", slot.beginWrite());
         std::printf("finalise %u\n", slot.finalise());
-        std::printf("%s\n", hex(contentOf(slot).data).c_str());
-        return 0;
     });
     const std::string invalidated = "lib/storage/storage_target:378 generic:20\n";
     EXPECT_EQ(result.out, "lib/storage/storage_target:334 Failure cleaning up checkfile \"" +
@@ -1202,20 +1199,10 @@ TEST_F(DualFileStore, LinkedCopyDirectoryFailsEveryUpdate) {
 // A directory in place of the transient file: it can be neither opened nor
 // removed.
 TEST_F(DualFileStore, TransientFileThatCannotBeCleanedUp) {
-    {
-        auto target = open();
-        EXPECT_EQ(write(slotOf(*target), bytesOf("current")), STATUS_OK);
-    }
+    storeInTurn({bytesOf("current")});
     fs::create_directories(copyDir(0) / "data.chk.tmp" / "inside");
-    const auto result = runInChild([&] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        DualFileTarget target(base(), 1);
-        TargetSlot& slot = *target.getSlot(0).get();
-        const Bytes blob = bytesOf("new");
-        std::printf("write %u\n", slot.write(blob.data(), blob.size()));
-        std::printf("%s\n", hex(contentOf(slot).data).c_str());
-        return 0;
-    });
+    const auto result = newBlobInChild(
+        [](TargetSlot& slot, const Bytes& blob) { std::printf("write %u\n", slot.write(blob.data(), blob.size())); });
     EXPECT_EQ(result.out, kOpenFailure + (copyDir(0) / "data.chk.tmp").string() +
                               ": Is a directory\n"
                               "lib/storage/storage_target:461 finalise: write failed: 9: Bad file descriptor\n"

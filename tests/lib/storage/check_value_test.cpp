@@ -5,6 +5,8 @@
 #include <unistd.h>
 #include <filesystem>
 #include <stdexcept>
+#include <string>
+#include <vector>
 
 #include <gtest/gtest.h>
 
@@ -63,37 +65,40 @@ TEST(ReferenceCrc32, MatchesTheStandardCheckValue) {
 
 TEST(CheckValue, AbsentBlobIsAllOnes) { EXPECT_EQ(Storage::kAbsentBlobCheckValue, 0xFFFFFFFFFFFFFFFFull); }
 
-TEST(ComputeCheckValue, EmptyFileIsZero) {
+// A data file's bytes and the check value computed from them.
+struct ComputedRow {
+    std::string name;
+    Bytes data;
+    uint64_t value;
+};
+
+std::vector<ComputedRow> computedRows() {
+    std::vector<ComputedRow> rows = {{"EmptyFileIsZero", {}, 0},
+                                     {"KnownTextGivesSizeAndCrc", bytesOf("123456789"), 0xCBF4392600000009ull}};
+    // Sizes around the 4096-byte blocks a data file is read in, and larger,
+    // against the reference layout.
+    for (const size_t size :
+         {size_t{1}, size_t{7}, size_t{4095}, size_t{4096}, size_t{4097}, size_t{8192}, size_t{12289}, size_t{65535},
+          size_t{65536}, size_t{65537}, size_t{3 * 65536 + 5}, size_t{1000000}}) {
+        const Bytes data = patternBytes(size, static_cast<uint32_t>(size));
+        rows.push_back(
+            {"MatchesTheReferenceLayoutAt" + std::to_string(size), data, littleEndian(expectedCheckFile(data))});
+    }
+    return rows;
+}
+
+class ComputeCheckValueOf : public ::testing::TestWithParam<ComputedRow> {};
+
+TEST_P(ComputeCheckValueOf, SizeAndCrc) {
     ScratchDir dir;
-    writeBytes(dir / "data", {});
+    writeBytes(dir / "data", GetParam().data);
     uint64_t value = 1;
     ASSERT_EQ(computeFor(dir / "data", value), STATUS_OK);
-    EXPECT_EQ(value, 0u);
+    EXPECT_EQ(value, GetParam().value);
 }
 
-TEST(ComputeCheckValue, KnownTextGivesSizeAndCrc) {
-    ScratchDir dir;
-    writeBytes(dir / "data", bytesOf("123456789"));
-    uint64_t value = 0;
-    ASSERT_EQ(computeFor(dir / "data", value), STATUS_OK);
-    EXPECT_EQ(value, 0xCBF4392600000009ull);
-}
-
-class ComputeCheckValueSizes : public ::testing::TestWithParam<size_t> {};
-
-// Sizes around the 4096-byte blocks a data file is read in, and larger.
-TEST_P(ComputeCheckValueSizes, MatchesTheReferenceLayout) {
-    ScratchDir dir;
-    const Bytes data = patternBytes(GetParam(), static_cast<uint32_t>(GetParam()));
-    writeBytes(dir / "data", data);
-    uint64_t value = 0;
-    ASSERT_EQ(computeFor(dir / "data", value), STATUS_OK);
-    EXPECT_EQ(value, littleEndian(expectedCheckFile(data)));
-}
-
-INSTANTIATE_TEST_SUITE_P(Blocks, ComputeCheckValueSizes,
-                         ::testing::Values(1, 7, 4095, 4096, 4097, 8192, 12289, 65535, 65536, 65537, 3 * 65536 + 5,
-                                           1000000));
+INSTANTIATE_TEST_SUITE_P(Rows, ComputeCheckValueOf, ::testing::ValuesIn(computedRows()),
+                         [](const auto& info) { return info.param.name; });
 
 // A read error (a directory passed off as a data file) fails the value.
 TEST(ComputeCheckValue, UnreadableDataFails) {

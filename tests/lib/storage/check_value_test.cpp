@@ -52,6 +52,15 @@ Status readFrom(const std::filesystem::path& path, uint64_t& value) {
     return Storage::readCheckValue(file.fd.get(), file.status, value);
 }
 
+// `use` on a directory named `name` fails and leaves the value alone.
+void expectADirectoryFails(Status (*use)(const std::filesystem::path&, uint64_t&), const char* name) {
+    ScratchDir dir;
+    std::filesystem::create_directory(dir / name);
+    uint64_t value = 7;
+    EXPECT_EQ(use(dir / name, value), STATUS_FAILED);
+    EXPECT_EQ(value, 7u);
+}
+
 uint64_t littleEndian(const Bytes& bytes) {
     uint64_t value = 0;
     for (size_t i = bytes.size(); i-- > 0;) value = (value << 8) | bytes[i];
@@ -101,13 +110,7 @@ INSTANTIATE_TEST_SUITE_P(Rows, ComputeCheckValueOf, ::testing::ValuesIn(computed
                          [](const auto& info) { return info.param.name; });
 
 // A read error (a directory passed off as a data file) fails the value.
-TEST(ComputeCheckValue, UnreadableDataFails) {
-    ScratchDir dir;
-    std::filesystem::create_directory(dir / "data");
-    uint64_t value = 7;
-    EXPECT_EQ(computeFor(dir / "data", value), STATUS_FAILED);
-    EXPECT_EQ(value, 7u);
-}
+TEST(ComputeCheckValue, UnreadableDataFails) { expectADirectoryFails(computeFor, "data"); }
 
 // Only a size that agrees with the stored one lets the data be read.
 TEST(CompareCheckValue, AgreesWithTheComputedValue) {
@@ -221,23 +224,17 @@ INSTANTIATE_TEST_SUITE_P(
 
 // A read error (a directory passed off as an 8-byte check file) fails it.
 TEST(ReadCheckValue, AReadErrorFails) {
-    ScratchDir dir;
-    std::filesystem::create_directory(dir / "data.chk");
-    Opened file = opened(dir / "data.chk");
-    file.status.st_size = 8;
-    uint64_t value = 7;
-    EXPECT_EQ(Storage::readCheckValue(file.fd.get(), file.status, value), STATUS_FAILED);
-    EXPECT_EQ(value, 7u);
+    expectADirectoryFails(
+        [](const std::filesystem::path& path, uint64_t& value) {
+            Opened file = opened(path);
+            file.status.st_size = 8;
+            return Storage::readCheckValue(file.fd.get(), file.status, value);
+        },
+        "data.chk");
 }
 
 // A directory passed off as a check file is not 8 bytes long: not read.
-TEST(ReadCheckValue, DirectoryFails) {
-    ScratchDir dir;
-    std::filesystem::create_directory(dir / "data.chk");
-    uint64_t value = 7;
-    EXPECT_EQ(readFrom(dir / "data.chk", value), STATUS_FAILED);
-    EXPECT_EQ(value, 7u);
-}
+TEST(ReadCheckValue, DirectoryFails) { expectADirectoryFails(readFrom, "data.chk"); }
 
 class ReadCheckValueLength : public ::testing::TestWithParam<size_t> {};
 

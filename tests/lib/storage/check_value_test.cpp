@@ -112,33 +112,39 @@ INSTANTIATE_TEST_SUITE_P(Rows, ComputeCheckValueOf, ::testing::ValuesIn(computed
 // A read error (a directory passed off as a data file) fails the value.
 TEST(ComputeCheckValue, UnreadableDataFails) { expectADirectoryFails(computeFor, "data"); }
 
-// Only a size that agrees with the stored one lets the data be read.
-TEST(CompareCheckValue, AgreesWithTheComputedValue) {
+// A data file of 5000 bytes, opened, and the check value that matches it.
+class CompareCheckValue : public ::testing::Test {
+protected:
+    void SetUp() override {
+        const Bytes data = patternBytes(5000, 4);
+        writeBytes(dir / "data", data);
+        file = opened(dir / "data");
+        good = littleEndian(expectedCheckFile(data));
+    }
+    Storage::CheckMatch compare(uint64_t value) const {
+        return Storage::compareCheckValue(file.fd.get(), file.status, value);
+    }
+
     ScratchDir dir;
-    const Bytes data = patternBytes(5000, 4);
-    writeBytes(dir / "data", data);
-    const Opened file = opened(dir / "data");
-    const uint64_t good = littleEndian(expectedCheckFile(data));
+    Opened file;
+    uint64_t good = 0;
+};
+
+// Only a size that agrees with the stored one lets the data be read.
+TEST_F(CompareCheckValue, AgreesWithTheComputedValue) {
     using Storage::CheckMatch;
-    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good), CheckMatch::kMatches);
-    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good ^ (uint64_t{1} << 40)),
-              CheckMatch::kCrcDiffers);
-    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good + 1), CheckMatch::kSizeDiffers);
+    EXPECT_EQ(compare(good), CheckMatch::kMatches);
+    EXPECT_EQ(compare(good ^ (uint64_t{1} << 40)), CheckMatch::kCrcDiffers);
+    EXPECT_EQ(compare(good + 1), CheckMatch::kSizeDiffers);
     // Only the size half counts as size: bits 32 and up are the CRC's.
-    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good + (uint64_t{1} << 32)),
-              CheckMatch::kCrcDiffers);
+    EXPECT_EQ(compare(good + (uint64_t{1} << 32)), CheckMatch::kCrcDiffers);
 }
 
 // A read would move the file position; a size that cannot match leaves it.
-TEST(CompareCheckValue, ADifferentSizeIsNotRead) {
-    ScratchDir dir;
-    const Bytes data = patternBytes(5000, 5);
-    writeBytes(dir / "data", data);
-    const Opened file = opened(dir / "data");
-    const uint64_t good = littleEndian(expectedCheckFile(data));
-    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good - 1), Storage::CheckMatch::kSizeDiffers);
+TEST_F(CompareCheckValue, ADifferentSizeIsNotRead) {
+    EXPECT_EQ(compare(good - 1), Storage::CheckMatch::kSizeDiffers);
     EXPECT_EQ(::lseek(file.fd.get(), 0, SEEK_CUR), 0);
-    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good), Storage::CheckMatch::kMatches);
+    EXPECT_EQ(compare(good), Storage::CheckMatch::kMatches);
     EXPECT_EQ(::lseek(file.fd.get(), 0, SEEK_CUR), 5000);
 }
 

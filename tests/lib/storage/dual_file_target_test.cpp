@@ -98,6 +98,13 @@ protected:
         TargetSlot& slot = slotOf(target);
         for (const Bytes& blob : blobs) EXPECT_EQ(write(slot, blob), STATUS_OK);
     }
+    // A data file in each copy directory and no check file beside either.
+    void writeUncheckedCopies(const Bytes& zero, const Bytes& one) {
+        fs::create_directories(copyDir(0));
+        fs::create_directories(copyDir(1));
+        writeBytes(data(0), zero);
+        writeBytes(data(1), one);
+    }
     // The slot of a fresh one-slot target after each blob was written to it in
     // turn; the target lives as long as the test.
     TargetSlot& slotAfterWrites(std::initializer_list<Bytes> blobs) {
@@ -341,10 +348,7 @@ TEST_F(DualFileStore, AllOnesBesideADataFileIsInvalid) {
 }
 
 TEST_F(DualFileStore, NeitherCopyValidReadsFailOnCopy0) {
-    fs::create_directories(copyDir(0));
-    fs::create_directories(copyDir(1));
-    writeBytes(data(0), bytesOf("unchecked zero"));
-    writeBytes(data(1), bytesOf("unchecked one"));
+    writeUncheckedCopies(bytesOf("unchecked zero"), bytesOf("unchecked one"));
     auto target = open();
     TargetSlot& slot = slotOf(*target);
     EXPECT_FALSE(slot.isValid());
@@ -1117,10 +1121,7 @@ TEST_F(DualFileStore, WriteAtOnAFreshStoreStartsFromNothing) {
 }
 
 TEST_F(DualFileStore, WriteAtOverAnInvalidCurrentCopyWritesIntoTheLeftover) {
-    fs::create_directories(copyDir(0));
-    fs::create_directories(copyDir(1));
-    writeBytes(data(0), bytesOf("unchecked current"));
-    writeBytes(data(1), bytesOf("ZZZZZZZZZZ"));
+    writeUncheckedCopies(bytesOf("unchecked current"), bytesOf("ZZZZZZZZZZ"));
     auto target = open();
     TargetSlot& slot = slotOf(*target);
     EXPECT_EQ(writeAt(slot, 2, bytesOf("ab")), STATUS_OK);

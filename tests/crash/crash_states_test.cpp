@@ -7,18 +7,10 @@
 #include <gtest/gtest.h>
 
 #include "crash_states.h"
+#include "fs_op_of.h"
 
 namespace crash {
 namespace {
-
-FsOp opOf(FsOpKind kind, const std::string& path, uint64_t inode, int64_t seconds = 0) {
-    FsOp op;
-    op.kind = kind;
-    op.path = path;
-    op.inode = inode;
-    op.mtime.tv_sec = seconds;
-    return op;
-}
 
 FsOp create(const std::string& path, uint64_t inode, int64_t seconds) {
     return opOf(FsOpKind::kCreate, path, inode, seconds);

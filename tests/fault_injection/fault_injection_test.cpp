@@ -20,22 +20,14 @@
 #include <gtest/gtest.h>
 
 #include "child_process.h"
+#include "fault_injection_test_names.h"
 #include "files.h"
 #include "lib/util/fd.h"
 #include "scratch_dir.h"
 
 namespace {
 
-namespace fs = std::filesystem;
-using testing_support::Environment;
-using testing_support::faultCountEnv;
-using testing_support::faultEnv;
-using testing_support::preloadEnv;
-using testing_support::ProcessResult;
-using testing_support::readFaultCount;
-using testing_support::runProgram;
-using testing_support::ScratchDir;
-using testing_support::writeText;
+using namespace fault_injection_test;
 
 // The steps of "fault_probe script", in order, each making one counted call.
 struct ScriptStep {

@@ -14,23 +14,15 @@
 
 #include "child_process.h"
 #include "fault_injection.h"
+#include "fault_injection_test_names.h"
 #include "files.h"
 #include "scratch_dir.h"
 
 namespace {
 
-namespace fs = std::filesystem;
-using testing_support::Environment;
-using testing_support::faultCountEnv;
-using testing_support::faultEnv;
-using testing_support::preloadEnv;
-using testing_support::ProcessResult;
-using testing_support::readFaultCount;
+using namespace fault_injection_test;
 using testing_support::readText;
 using testing_support::recordEnv;
-using testing_support::runProgram;
-using testing_support::ScratchDir;
-using testing_support::writeText;
 
 using Lines = std::vector<std::string>;
 

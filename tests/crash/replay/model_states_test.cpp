@@ -9,25 +9,19 @@
 
 #include <gtest/gtest.h>
 
+#include "fs_op_of.h"
+
 namespace replay {
 namespace {
 
 using crash::FsImage;
 using crash::FsOp;
 using crash::FsOpKind;
+using crash::opOf;
 
 void putFile(FsImage& image, const std::string& path, uint64_t inode, const std::string& bytes, timespec mtime) {
     image.names[path] = inode;
     image.files[inode] = crash::FileNode{crash::Bytes(bytes.begin(), bytes.end()), mtime};
-}
-
-FsOp opOf(FsOpKind kind, const std::string& path, uint64_t inode, int64_t seconds = 0) {
-    FsOp op;
-    op.kind = kind;
-    op.path = path;
-    op.inode = inode;
-    op.mtime.tv_sec = seconds;
-    return op;
 }
 
 FsOp write(const std::string& path, uint64_t inode, const std::string& bytes, int64_t seconds) {

@@ -244,13 +244,20 @@ protected:
     void SetUp() override {
         if (std::filesystem::exists("/dev/mmcblk0")) GTEST_SKIP() << "this host has a /dev/mmcblk0";
     }
+    // Runs `body` on a new target in a child, with the log on standard
+    // output at `threshold`.
+    static testing_support::ProcessResult onTarget(int threshold, int (*body)(BootVectorTarget&)) {
+        return runInChild([&] {
+            setLogOutput(LOG_OUTPUT_STDOUT);
+            setLogLevel(threshold);
+            BootVectorTarget target;
+            return body(target);
+        });
+    }
 };
 
 TEST_F(BootVectorWithoutDevice, ConstructionLogsOneParseFailure) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_DEBUG);
-        BootVectorTarget target;
+    const auto result = onTarget(LOG_PRIORITY_DEBUG, [](BootVectorTarget&) {
         std::printf("built\n");
         return 0;
     });
@@ -262,10 +269,7 @@ TEST_F(BootVectorWithoutDevice, ConstructionLogsOneParseFailure) {
 }
 
 TEST_F(BootVectorWithoutDevice, SlotIsUnusable) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_ERROR);
-        BootVectorTarget target;
+    const auto result = onTarget(LOG_PRIORITY_ERROR, [](BootVectorTarget& target) {
         std::printf("---\n");
         std::printf("count %zu description %s\n", target.getSlotCount(), target.getDescription().c_str());
         std::printf("slot1 %d\n", target.getSlot(1) ? 1 : 0);
@@ -317,10 +321,7 @@ TEST_F(BootVectorWithoutDevice, SlotIsUnusable) {
 
 // Results do not depend on the threshold; the messages do.
 TEST_F(BootVectorWithoutDevice, SilentBelowErrorPriority) {
-    const auto result = runInChild([] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(LOG_PRIORITY_CRITICAL);
-        BootVectorTarget target;
+    const auto result = onTarget(LOG_PRIORITY_CRITICAL, [](BootVectorTarget& target) {
         uint8_t buffer[20] = {};
         const Record record = recordWithValue(258, 1);
         std::printf("read %u\n", target.getSlot(0)->read(buffer, 20, 0));

@@ -5,6 +5,8 @@
 #include <unistd.h>
 #include <filesystem>
 #include <stdexcept>
+#include <string>
+#include <vector>
 
 #include <gtest/gtest.h>
 
@@ -50,6 +52,15 @@ Status readFrom(const std::filesystem::path& path, uint64_t& value) {
     return Storage::readCheckValue(file.fd.get(), file.status, value);
 }
 
+// `use` on a directory named `name` fails and leaves the value alone.
+void expectADirectoryFails(Status (*use)(const std::filesystem::path&, uint64_t&), const char* name) {
+    ScratchDir dir;
+    std::filesystem::create_directory(dir / name);
+    uint64_t value = 7;
+    EXPECT_EQ(use(dir / name, value), STATUS_FAILED);
+    EXPECT_EQ(value, 7u);
+}
+
 uint64_t littleEndian(const Bytes& bytes) {
     uint64_t value = 0;
     for (size_t i = bytes.size(); i-- > 0;) value = (value << 8) | bytes[i];
@@ -63,74 +74,77 @@ TEST(ReferenceCrc32, MatchesTheStandardCheckValue) {
 
 TEST(CheckValue, AbsentBlobIsAllOnes) { EXPECT_EQ(Storage::kAbsentBlobCheckValue, 0xFFFFFFFFFFFFFFFFull); }
 
-TEST(ComputeCheckValue, EmptyFileIsZero) {
+// A data file's bytes and the check value computed from them.
+struct ComputedRow {
+    std::string name;
+    Bytes data;
+    uint64_t value;
+};
+
+std::vector<ComputedRow> computedRows() {
+    std::vector<ComputedRow> rows = {{"EmptyFileIsZero", {}, 0},
+                                     {"KnownTextGivesSizeAndCrc", bytesOf("123456789"), 0xCBF4392600000009ull}};
+    // Sizes around the 4096-byte blocks a data file is read in, and larger,
+    // against the reference layout.
+    for (const size_t size :
+         {size_t{1}, size_t{7}, size_t{4095}, size_t{4096}, size_t{4097}, size_t{8192}, size_t{12289}, size_t{65535},
+          size_t{65536}, size_t{65537}, size_t{3 * 65536 + 5}, size_t{1000000}}) {
+        const Bytes data = patternBytes(size, static_cast<uint32_t>(size));
+        rows.push_back(
+            {"MatchesTheReferenceLayoutAt" + std::to_string(size), data, littleEndian(expectedCheckFile(data))});
+    }
+    return rows;
+}
+
+class ComputeCheckValueOf : public ::testing::TestWithParam<ComputedRow> {};
+
+TEST_P(ComputeCheckValueOf, SizeAndCrc) {
     ScratchDir dir;
-    writeBytes(dir / "data", {});
+    writeBytes(dir / "data", GetParam().data);
     uint64_t value = 1;
     ASSERT_EQ(computeFor(dir / "data", value), STATUS_OK);
-    EXPECT_EQ(value, 0u);
+    EXPECT_EQ(value, GetParam().value);
 }
 
-TEST(ComputeCheckValue, KnownTextGivesSizeAndCrc) {
-    ScratchDir dir;
-    writeBytes(dir / "data", bytesOf("123456789"));
-    uint64_t value = 0;
-    ASSERT_EQ(computeFor(dir / "data", value), STATUS_OK);
-    EXPECT_EQ(value, 0xCBF4392600000009ull);
-}
-
-class ComputeCheckValueSizes : public ::testing::TestWithParam<size_t> {};
-
-// Sizes around the 4096-byte blocks a data file is read in, and larger.
-TEST_P(ComputeCheckValueSizes, MatchesTheReferenceLayout) {
-    ScratchDir dir;
-    const Bytes data = patternBytes(GetParam(), static_cast<uint32_t>(GetParam()));
-    writeBytes(dir / "data", data);
-    uint64_t value = 0;
-    ASSERT_EQ(computeFor(dir / "data", value), STATUS_OK);
-    EXPECT_EQ(value, littleEndian(expectedCheckFile(data)));
-}
-
-INSTANTIATE_TEST_SUITE_P(Blocks, ComputeCheckValueSizes,
-                         ::testing::Values(1, 7, 4095, 4096, 4097, 8192, 12289, 65535, 65536, 65537, 3 * 65536 + 5,
-                                           1000000));
+INSTANTIATE_TEST_SUITE_P(Rows, ComputeCheckValueOf, ::testing::ValuesIn(computedRows()),
+                         [](const auto& info) { return info.param.name; });
 
 // A read error (a directory passed off as a data file) fails the value.
-TEST(ComputeCheckValue, UnreadableDataFails) {
+TEST(ComputeCheckValue, UnreadableDataFails) { expectADirectoryFails(computeFor, "data"); }
+
+// A data file of 5000 bytes, opened, and the check value that matches it.
+class CompareCheckValue : public ::testing::Test {
+protected:
+    void SetUp() override {
+        const Bytes data = patternBytes(5000, 4);
+        writeBytes(dir / "data", data);
+        file = opened(dir / "data");
+        good = littleEndian(expectedCheckFile(data));
+    }
+    Storage::CheckMatch compare(uint64_t value) const {
+        return Storage::compareCheckValue(file.fd.get(), file.status, value);
+    }
+
     ScratchDir dir;
-    std::filesystem::create_directory(dir / "data");
-    uint64_t value = 7;
-    EXPECT_EQ(computeFor(dir / "data", value), STATUS_FAILED);
-    EXPECT_EQ(value, 7u);
-}
+    Opened file;
+    uint64_t good = 0;
+};
 
 // Only a size that agrees with the stored one lets the data be read.
-TEST(CompareCheckValue, AgreesWithTheComputedValue) {
-    ScratchDir dir;
-    const Bytes data = patternBytes(5000, 4);
-    writeBytes(dir / "data", data);
-    const Opened file = opened(dir / "data");
-    const uint64_t good = littleEndian(expectedCheckFile(data));
+TEST_F(CompareCheckValue, AgreesWithTheComputedValue) {
     using Storage::CheckMatch;
-    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good), CheckMatch::kMatches);
-    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good ^ (uint64_t{1} << 40)),
-              CheckMatch::kCrcDiffers);
-    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good + 1), CheckMatch::kSizeDiffers);
+    EXPECT_EQ(compare(good), CheckMatch::kMatches);
+    EXPECT_EQ(compare(good ^ (uint64_t{1} << 40)), CheckMatch::kCrcDiffers);
+    EXPECT_EQ(compare(good + 1), CheckMatch::kSizeDiffers);
     // Only the size half counts as size: bits 32 and up are the CRC's.
-    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good + (uint64_t{1} << 32)),
-              CheckMatch::kCrcDiffers);
+    EXPECT_EQ(compare(good + (uint64_t{1} << 32)), CheckMatch::kCrcDiffers);
 }
 
 // A read would move the file position; a size that cannot match leaves it.
-TEST(CompareCheckValue, ADifferentSizeIsNotRead) {
-    ScratchDir dir;
-    const Bytes data = patternBytes(5000, 5);
-    writeBytes(dir / "data", data);
-    const Opened file = opened(dir / "data");
-    const uint64_t good = littleEndian(expectedCheckFile(data));
-    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good - 1), Storage::CheckMatch::kSizeDiffers);
+TEST_F(CompareCheckValue, ADifferentSizeIsNotRead) {
+    EXPECT_EQ(compare(good - 1), Storage::CheckMatch::kSizeDiffers);
     EXPECT_EQ(::lseek(file.fd.get(), 0, SEEK_CUR), 0);
-    EXPECT_EQ(Storage::compareCheckValue(file.fd.get(), file.status, good), Storage::CheckMatch::kMatches);
+    EXPECT_EQ(compare(good), Storage::CheckMatch::kMatches);
     EXPECT_EQ(::lseek(file.fd.get(), 0, SEEK_CUR), 5000);
 }
 
@@ -216,23 +230,17 @@ INSTANTIATE_TEST_SUITE_P(
 
 // A read error (a directory passed off as an 8-byte check file) fails it.
 TEST(ReadCheckValue, AReadErrorFails) {
-    ScratchDir dir;
-    std::filesystem::create_directory(dir / "data.chk");
-    Opened file = opened(dir / "data.chk");
-    file.status.st_size = 8;
-    uint64_t value = 7;
-    EXPECT_EQ(Storage::readCheckValue(file.fd.get(), file.status, value), STATUS_FAILED);
-    EXPECT_EQ(value, 7u);
+    expectADirectoryFails(
+        [](const std::filesystem::path& path, uint64_t& value) {
+            Opened file = opened(path);
+            file.status.st_size = 8;
+            return Storage::readCheckValue(file.fd.get(), file.status, value);
+        },
+        "data.chk");
 }
 
 // A directory passed off as a check file is not 8 bytes long: not read.
-TEST(ReadCheckValue, DirectoryFails) {
-    ScratchDir dir;
-    std::filesystem::create_directory(dir / "data.chk");
-    uint64_t value = 7;
-    EXPECT_EQ(readFrom(dir / "data.chk", value), STATUS_FAILED);
-    EXPECT_EQ(value, 7u);
-}
+TEST(ReadCheckValue, DirectoryFails) { expectADirectoryFails(readFrom, "data.chk"); }
 
 class ReadCheckValueLength : public ::testing::TestWithParam<size_t> {};
 

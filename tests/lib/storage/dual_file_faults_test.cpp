@@ -11,6 +11,7 @@
 #include <gtest/gtest.h>
 
 #include "child_process.h"
+#include "dual_file_test_names.h"
 #include "fault_injection.h"
 #include "files.h"
 #include "lib/storage/dual_file_target.h"
@@ -21,30 +22,13 @@
 
 namespace {
 
-// How an open failure reported by the descriptor helpers begins.
-const std::string kOpenFailure = testing_support::openFailurePrefix();
-
-namespace fs = std::filesystem;
-using store_test::absentBlob;
-using store_test::Bytes;
-using store_test::bytesOf;
-using store_test::contentOf;
-using store_test::copyLines;
-using store_test::describeTree;
-using store_test::expectedCheckFile;
-using store_test::hex;
-using store_test::holding;
-using store_test::kPast;
-using store_test::kSecond;
-using store_test::patternBytes;
-using store_test::SlotContent;
+using namespace dual_file_test;
 using testing_support::Environment;
 using testing_support::faultCountEnv;
 using testing_support::faultEnv;
 using testing_support::faultFromEnv;
 using testing_support::ProcessResult;
 using testing_support::readFaultCount;
-using testing_support::ScratchDir;
 
 // Without openat2 (qemu-user), the first read of a store tries it once, fails
 // with ENOSYS and goes through the directories from then on: the open of
@@ -113,6 +97,16 @@ protected:
         EXPECT_EQ(reopened(), content);
     }
 
+    // An update that failed and kept `old_`: exit status 1, the driver's
+    // output `out` then the state it still saw, copy 0 left holding `copy0`
+    // beside copy 1's `old_`, and a fresh open reading `old_`.
+    void expectUpdateFailedKeepingOld(const ProcessResult& result, const std::string& out, const Bytes& copy0) {
+        EXPECT_EQ(result.exitStatus, 1);
+        EXPECT_EQ(result.out, out + stateLine(holding(old_)));
+        EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(copy0) + "\n" + copyLines("2", old_));
+        expectReopenedAs(holding(old_));
+    }
+
     // Copy 0 holds `older_`, copy 1 the current `old_` (its check file is
     // newer): every update goes to copy 0, "1/data".
     void prepare(int64_t currentCheckTime = kPast + kSecond) {
@@ -133,14 +127,12 @@ TEST_F(DualFileFaults, TransientFileCannotBeOpened) {
     prepare();
     const ProcessResult result =
         drive({"write", input(new_)}, faultEnv("open", 1, "errno:EIO", path("1/data.chk.tmp")));
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, kOpenFailure + path("1/data.chk.tmp") +
-                              ": Input/output error\n"
-                              "lib/storage/storage_target:461 finalise: write failed: 9: Bad file descriptor\n"
-                              "write: 52\n" +
-                              stateLine(holding(old_)));
-    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(new_) + "\n" + copyLines("2", old_));
-    expectReopenedAs(holding(old_));
+    expectUpdateFailedKeepingOld(result,
+                                 kOpenFailure + path("1/data.chk.tmp") +
+                                     ": Input/output error\n"
+                                     "lib/storage/storage_target:461 finalise: write failed: 9: Bad file descriptor\n"
+                                     "write: 52\n",
+                                 new_);
 }
 
 class CheckValueWriteFails : public DualFileFaults,
@@ -151,11 +143,10 @@ TEST_P(CheckValueWriteFails, TransientFileIsRemoved) {
     const std::string errorName = GetParam().first;
     const ProcessResult result =
         drive({"write", input(new_)}, faultEnv("write", 1, "errno:" + errorName, path("1/data.chk.tmp")));
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, std::string("lib/storage/storage_target:461 finalise: write failed: ") + GetParam().second +
-                              "\nwrite: 52\n" + stateLine(holding(old_)));
-    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(new_) + "\n" + copyLines("2", old_));
-    expectReopenedAs(holding(old_));
+    expectUpdateFailedKeepingOld(
+        result,
+        std::string("lib/storage/storage_target:461 finalise: write failed: ") + GetParam().second + "\nwrite: 52\n",
+        new_);
 }
 
 INSTANTIATE_TEST_SUITE_P(Errors, CheckValueWriteFails,
@@ -177,11 +168,8 @@ TEST_F(DualFileFaults, BelowTheErrorThresholdNothingIsLogged) {
 TEST_F(DualFileFaults, ShortCheckValueWrite) {
     prepare();
     const ProcessResult result = drive({"write", input(new_)}, faultEnv("write", 1, "short:3", path("1/data.chk.tmp")));
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "lib/storage/storage_target:465 Failed to write expected data: 3\nwrite: 52\n" +
-                              stateLine(holding(old_)));
-    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(new_) + "\n" + copyLines("2", old_));
-    expectReopenedAs(holding(old_));
+    expectUpdateFailedKeepingOld(result, "lib/storage/storage_target:465 Failed to write expected data: 3\nwrite: 52\n",
+                                 new_);
 }
 
 // ---- installing the check file ----
@@ -221,12 +209,11 @@ TEST_F(DualFileFaults, RenameFailsInFinalise) {
 TEST_F(DualFileFaults, DataFileSyncFails) {
     prepare();
     const ProcessResult result = drive({"write", input(new_)}, faultEnv("sync", 1, "errno:EIO", path("1/data")));
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, testing_support::errorPrefixOf("lib/storage/storage_target.cpp", "\"Failed to sync \" <<") +
-                              "Failed to sync \"" + path("1/data") + "\": Input/output error (5)\nwrite: 52\n" +
-                              stateLine(holding(old_)));
-    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(new_) + "\n" + copyLines("2", old_));
-    expectReopenedAs(holding(old_));
+    expectUpdateFailedKeepingOld(
+        result,
+        testing_support::errorPrefixOf("lib/storage/storage_target.cpp", "\"Failed to sync \" <<") +
+            "Failed to sync \"" + path("1/data") + "\": Input/output error (5)\nwrite: 52\n",
+        new_);
 }
 
 // The sync comes after the rename: the new copy is on disk and wins at the
@@ -328,10 +315,7 @@ TEST_F(DualFileFaults, InvalidatingRemovalFails) {
 TEST_F(DualFileFaults, RemovalBeforeOpeningTheDataFails) {
     prepare();
     const ProcessResult result = drive({"write", input(new_)}, faultEnv("unlink", 2, "errno:EIO", path("1/data.chk")));
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "write: 5\n" + stateLine(holding(old_)));
-    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(older_) + "\n" + copyLines("2", old_));
-    expectReopenedAs(holding(old_));
+    expectUpdateFailedKeepingOld(result, "write: 5\n", older_);
 }
 
 TEST_F(DualFileFaults, InvalidatingRemovalFailsOnErase) {
@@ -346,10 +330,7 @@ TEST_F(DualFileFaults, EraseCannotRemoveTheData) {
     prepare();
     // The first removal on "1/data" is the check file's.
     const ProcessResult result = drive({"erase"}, faultEnv("unlink", 2, "errno:EIO", path("1/data")));
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "erase: 5\n" + stateLine(holding(old_)));
-    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(older_) + "\n" + copyLines("2", old_));
-    expectReopenedAs(holding(old_));
+    expectUpdateFailedKeepingOld(result, "erase: 5\n", older_);
 }
 
 // The copy's directory is gone and cannot be made again (at opening, nor
@@ -479,11 +460,10 @@ TEST_P(DataWriteFails, ReturnsTheErrno) {
     const std::string text = GetParam().second;
     const ProcessResult result =
         drive({"write", input(new_)}, faultEnv("write", 1, "errno:" + errorName, path("1/data")));
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, "lib/storage/storage_target:144 write failed: " + text +
-                              "\nwrite: " + text.substr(0, text.find(':')) + "\n" + stateLine(holding(old_)));
-    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data \n" + copyLines("2", old_));
-    expectReopenedAs(holding(old_));
+    expectUpdateFailedKeepingOld(
+        result,
+        "lib/storage/storage_target:144 write failed: " + text + "\nwrite: " + text.substr(0, text.find(':')) + "\n",
+        Bytes{});
 }
 
 INSTANTIATE_TEST_SUITE_P(Errors, DataWriteFails,
@@ -495,11 +475,8 @@ INSTANTIATE_TEST_SUITE_P(Errors, DataWriteFails,
 TEST_F(DualFileFaults, ShortDataWrite) {
     prepare();
     const ProcessResult result = drive({"write", input(new_)}, faultEnv("write", 1, "short:4", path("1/data")));
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out, shortWriteLine(path("1/data"), 4, new_.size()) + "write: 52\n" + stateLine(holding(old_)));
-    EXPECT_EQ(describeTree(base()),
-              "d 1\nd 2\nf 1/data " + hex(Bytes(new_.begin(), new_.begin() + 4)) + "\n" + copyLines("2", old_));
-    expectReopenedAs(holding(old_));
+    expectUpdateFailedKeepingOld(result, shortWriteLine(path("1/data"), 4, new_.size()) + "write: 52\n",
+                                 Bytes(new_.begin(), new_.begin() + 4));
 }
 
 TEST_F(DualFileFaults, DataFileCannotBeOpened) {
@@ -509,11 +486,7 @@ TEST_F(DualFileFaults, DataFileCannotBeOpened) {
     ASSERT_EQ(atOpening, firstReadTries() + 1);
     const ProcessResult result =
         drive({"write", input(new_)}, faultEnv("open", atOpening + 1, "errno:EIO", path("1/data")));
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out,
-              kOpenFailure + path("1/data") + ": Input/output error\nwrite: 52\n" + stateLine(holding(old_)));
-    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(older_) + "\n" + copyLines("2", old_));
-    expectReopenedAs(holding(old_));
+    expectUpdateFailedKeepingOld(result, kOpenFailure + path("1/data") + ": Input/output error\nwrite: 52\n", older_);
 }
 
 TEST_F(DualFileFaults, BlockWriteFailsOutsideABegunWrite) {
@@ -550,11 +523,8 @@ TEST_F(DualFileFaults, CopyingTheOldBlobFails) {
     prepare();
     const ProcessResult result =
         drive({"writeAt", "10", input(bytesOf("block"))}, faultEnv("write", 1, "errno:EIO", path("1/data")));
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.out,
-              "lib/storage/storage_target:199 Failed to copy old data\nwriteAt: 52\n" + stateLine(holding(old_)));
-    EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data \n" + copyLines("2", old_));
-    expectReopenedAs(holding(old_));
+    expectUpdateFailedKeepingOld(result, "lib/storage/storage_target:199 Failed to copy old data\nwriteAt: 52\n",
+                                 Bytes{});
 }
 
 // A power cut right after the data write: the commit never started.

@@ -18,6 +18,7 @@
 #include <gtest/gtest.h>
 
 #include "child_process.h"
+#include "dual_file_test_names.h"
 #include "hostile_tree.h"
 #include "lib/storage/dual_file_target.h"
 #include "scratch_dir.h"
@@ -26,16 +27,7 @@
 
 namespace {
 
-namespace fs = std::filesystem;
-using Storage::DualFileTarget;
-using Storage::TargetSlot;
-using store_test::absentBlob;
-using store_test::Bytes;
-using store_test::bytesOf;
-using store_test::contentOf;
-using store_test::holding;
-using store_test::patternBytes;
-using store_test::SlotContent;
+using namespace dual_file_test;
 using testing_support::Plant;
 
 // Long enough for a sanitized or emulated run; a wait never ends by itself.

@@ -14,6 +14,7 @@
 #include <cstring>
 #include <filesystem>
 #include <functional>
+#include <initializer_list>
 #include <iterator>
 #include <memory>
 #include <stdexcept>
@@ -24,6 +25,7 @@
 #include <gtest/gtest.h>
 
 #include "child_process.h"
+#include "dual_file_test_names.h"
 #include "files.h"
 #include "lib/util/log.h"
 #include "scratch_dir.h"
@@ -32,33 +34,14 @@
 
 namespace {
 
-// How an open failure reported by the descriptor helpers begins.
-const std::string kOpenFailure = testing_support::openFailurePrefix();
-
-namespace fs = std::filesystem;
-using Storage::DualFileTarget;
+using namespace dual_file_test;
 using Storage::SlotHandle;
-using Storage::TargetSlot;
-using store_test::absentBlob;
 using store_test::absentCheckFile;
-using store_test::Bytes;
-using store_test::bytesOf;
-using store_test::contentOf;
-using store_test::copyLines;
-using store_test::describeTree;
-using store_test::expectedCheckFile;
-using store_test::hex;
-using store_test::holding;
-using store_test::kPast;
-using store_test::kSecond;
 using store_test::mtimeNs;
 using store_test::nothingStored;
-using store_test::patternBytes;
 using store_test::setMtimeNs;
-using store_test::SlotContent;
 using testing_support::readBytes;
 using testing_support::runInChild;
-using testing_support::ScratchDir;
 using testing_support::writeBytes;
 
 constexpr int64_t kTwoSeconds = 2 * kSecond;
@@ -85,8 +68,54 @@ protected:
     static Status writeAt(TargetSlot& slot, int64_t offset, const Bytes& block) {
         return slot.writeAt(offset, block.data(), block.size());
     }
+    // Both reads at offset 0 fail with `status`, leave the buffer as it was
+    // and leave readSome's count alone.
+    static void expectReadsFail(TargetSlot& slot, Status status) {
+        uint8_t buffer[4] = {1, 2, 3, 4};
+        size_t count = 42;
+        EXPECT_EQ(slot.read(buffer, sizeof buffer, 0), status);
+        EXPECT_EQ(slot.readSome(buffer, sizeof buffer, 0, count), status);
+        EXPECT_EQ(count, 42u);
+        EXPECT_EQ(Bytes(buffer, buffer + 4), (Bytes{1, 2, 3, 4}));
+    }
+    // In a child with the log on standard output: `body` on the slot of a
+    // fresh one-slot target with the blob "new", then the slot's content in
+    // hex on a line of its own.
+    testing_support::ProcessResult newBlobInChild(const std::function<void(TargetSlot&, const Bytes&)>& body) {
+        return runInChild([&] {
+            setLogOutput(LOG_OUTPUT_STDOUT);
+            DualFileTarget target(base(), 1);
+            TargetSlot& slot = *target.getSlot(0).get();
+            body(slot, bytesOf("new"));
+            std::printf("%s\n", hex(contentOf(slot).data).c_str());
+            return 0;
+        });
+    }
+    // Writes each blob in turn through a one-slot target that is closed
+    // before this returns.
+    void storeInTurn(std::initializer_list<Bytes> blobs) {
+        DualFileTarget target(base(), 1);
+        TargetSlot& slot = slotOf(target);
+        for (const Bytes& blob : blobs) EXPECT_EQ(write(slot, blob), STATUS_OK);
+    }
+    // A data file in each copy directory and no check file beside either.
+    void writeUncheckedCopies(const Bytes& zero, const Bytes& one) {
+        fs::create_directories(copyDir(0));
+        fs::create_directories(copyDir(1));
+        writeBytes(data(0), zero);
+        writeBytes(data(1), one);
+    }
+    // The slot of a fresh one-slot target after each blob was written to it in
+    // turn; the target lives as long as the test.
+    TargetSlot& slotAfterWrites(std::initializer_list<Bytes> blobs) {
+        written = open();
+        TargetSlot& slot = slotOf(*written);
+        for (const Bytes& blob : blobs) EXPECT_EQ(write(slot, blob), STATUS_OK);
+        return slot;
+    }
 
     ScratchDir dir;
+    std::unique_ptr<DualFileTarget> written;
 };
 
 // ---- the target ----
@@ -99,12 +128,7 @@ TEST_F(DualFileStore, FreshOneSlotStoreHoldsNothing) {
     EXPECT_FALSE(slot.ownsSlot());
     EXPECT_FALSE(slot->exists());
     EXPECT_FALSE(slot->isValid());
-    uint8_t buffer[4] = {1, 2, 3, 4};
-    size_t count = 99;
-    EXPECT_EQ(slot->read(buffer, sizeof buffer, 0), STATUS_NOT_FOUND);
-    EXPECT_EQ(slot->readSome(buffer, sizeof buffer, 0, count), STATUS_NOT_FOUND);
-    EXPECT_EQ(count, 99u);
-    EXPECT_EQ(Bytes(buffer, buffer + 4), (Bytes{1, 2, 3, 4}));
+    expectReadsFail(*slot.get(), STATUS_NOT_FOUND);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n");
 }
 
@@ -302,11 +326,7 @@ TEST_F(DualFileStore, CommittedAbsentBlob) {
     TargetSlot& slot = slotOf(*target);
     EXPECT_TRUE(slot.isValid());
     EXPECT_FALSE(slot.exists());
-    uint8_t buffer[4] = {};
-    size_t count = 42;
-    EXPECT_EQ(slot.read(buffer, sizeof buffer, 0), STATUS_NOT_FOUND);
-    EXPECT_EQ(slot.readSome(buffer, sizeof buffer, 0, count), STATUS_NOT_FOUND);
-    EXPECT_EQ(count, 42u);
+    expectReadsFail(slot, STATUS_NOT_FOUND);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data.chk ffffffffffffffff\n");
 }
 
@@ -328,19 +348,12 @@ TEST_F(DualFileStore, AllOnesBesideADataFileIsInvalid) {
 }
 
 TEST_F(DualFileStore, NeitherCopyValidReadsFailOnCopy0) {
-    fs::create_directories(copyDir(0));
-    fs::create_directories(copyDir(1));
-    writeBytes(data(0), bytesOf("unchecked zero"));
-    writeBytes(data(1), bytesOf("unchecked one"));
+    writeUncheckedCopies(bytesOf("unchecked zero"), bytesOf("unchecked one"));
     auto target = open();
     TargetSlot& slot = slotOf(*target);
     EXPECT_FALSE(slot.isValid());
     EXPECT_FALSE(slot.exists());
-    uint8_t buffer[4] = {};
-    size_t count = 42;
-    EXPECT_EQ(slot.read(buffer, sizeof buffer, 0), STATUS_FAILED);
-    EXPECT_EQ(slot.readSome(buffer, sizeof buffer, 0, count), STATUS_FAILED);
-    EXPECT_EQ(count, 42u);
+    expectReadsFail(slot, STATUS_FAILED);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 1/data " + hex(bytesOf("unchecked zero")) + "\nf 2/data " +
                                         hex(bytesOf("unchecked one")) + "\n");
 }
@@ -763,10 +776,7 @@ TEST_F(DualFileStore, WritesAlternateBetweenTheCopies) {
 TEST_F(DualFileStore, WriteAfterReopeningGoesToTheOtherCopy) {
     const Bytes first = bytesOf("first");
     const Bytes second = bytesOf("second");
-    {
-        auto target = open();
-        EXPECT_EQ(write(slotOf(*target), first), STATUS_OK);
-    }
+    storeInTurn({first});
     auto target = open();
     EXPECT_EQ(write(slotOf(*target), second), STATUS_OK);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", second) + copyLines("2", first));
@@ -793,11 +803,7 @@ TEST_F(DualFileStore, CheckFileOfALargerBlob) {
 }
 
 TEST_F(DualFileStore, WriteReplacesALongerLeftover) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, patternBytes(3000, 14)), STATUS_OK);
-    EXPECT_EQ(write(slot, patternBytes(100, 15)), STATUS_OK);
-    EXPECT_EQ(write(slot, bytesOf("short")), STATUS_OK);
+    slotAfterWrites({patternBytes(3000, 14), patternBytes(100, 15), bytesOf("short")});
     EXPECT_EQ(readBytes(data(1)), bytesOf("short"));
     EXPECT_EQ(reopened(), holding(bytesOf("short")));
 }
@@ -824,9 +830,7 @@ TEST_F(DualFileStore, FirstCommitKeepsItsOwnTime) {
 }
 
 TEST_F(DualFileStore, LaterCommitIsStrictlyNewer) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("a")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("a")});
     for (int i = 0; i < 5; ++i) {
         const fs::path previous = check((i + 1) % 2);
         const fs::path next = check(i % 2);
@@ -855,9 +859,7 @@ protected:
 };
 
 TEST_P(FutureDatedPrevious, NextCheckFileIsTwoSecondsLater) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("first")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("first")});
     const int64_t future = store_test::nowNs() + 3600 * kSecond + 123456789;
     setMtimeNs(check(1), future);
 
@@ -872,10 +874,7 @@ TEST_P(FutureDatedPrevious, NextCheckFileIsTwoSecondsLater) {
 }
 
 TEST_P(FutureDatedPrevious, ReopeningPicksTheNewCommit) {
-    {
-        auto target = open();
-        EXPECT_EQ(write(slotOf(*target), bytesOf("first")), STATUS_OK);
-    }
+    storeInTurn({bytesOf("first")});
     const int64_t future = store_test::nowNs() + 3600 * kSecond;
     setMtimeNs(check(1), future);
     auto target = open();
@@ -954,10 +953,7 @@ TEST_F(DualFileStore, EraseOfAFreshStoreCommitsAnAbsentBlob) {
 TEST_F(DualFileStore, EraseRemovesTheOtherCopysData) {
     const Bytes first = bytesOf("first");
     const Bytes second = bytesOf("second");
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, first), STATUS_OK);
-    EXPECT_EQ(write(slot, second), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({first, second});
     EXPECT_EQ(slot.erase(), STATUS_OK);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", second) + "f 2/data.chk ffffffffffffffff\n");
     EXPECT_EQ(contentOf(slot), absentBlob());
@@ -989,10 +985,7 @@ TEST_F(DualFileStore, WriteRecreatesAMissingCopyDirectory) {
 // ---- incremental writes ----
 
 TEST_F(DualFileStore, FinaliseWithoutBeginChangesNothing) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("one")), STATUS_OK);
-    EXPECT_EQ(write(slot, bytesOf("two")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("one"), bytesOf("two")});
     const std::string before = describeTree(base(), true);
     EXPECT_EQ(slot.finalise(), STATUS_INVALID_OPERATION);
     EXPECT_EQ(describeTree(base(), true), before);
@@ -1008,10 +1001,7 @@ TEST_F(DualFileStore, FinaliseOfAFreshStoreChangesNothing) {
 }
 
 TEST_F(DualFileStore, BeginThenFinaliseCommitsAnAbsentBlob) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("one")), STATUS_OK);
-    EXPECT_EQ(write(slot, bytesOf("two")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("one"), bytesOf("two")});
     // Current is copy 0; copy 1 still holds "one".
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", bytesOf("two")) + "f 2/data.chk " +
@@ -1026,9 +1016,7 @@ TEST_F(DualFileStore, BeginThenFinaliseCommitsAnAbsentBlob) {
 
 TEST_F(DualFileStore, PendingBlocksAreInvisibleUntilFinalised) {
     const Bytes old = bytesOf("old content");
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, old), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({old});
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
     EXPECT_EQ(writeAt(slot, 0, bytesOf("head")), STATUS_OK);
     EXPECT_EQ(writeAt(slot, 10, bytesOf("tail")), STATUS_OK);
@@ -1045,10 +1033,7 @@ TEST_F(DualFileStore, PendingBlocksAreInvisibleUntilFinalised) {
 }
 
 TEST_F(DualFileStore, BeginDropsTheOtherCopysLeftovers) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, patternBytes(500, 16)), STATUS_OK);
-    EXPECT_EQ(write(slot, bytesOf("current")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({patternBytes(500, 16), bytesOf("current")});
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
     EXPECT_FALSE(fs::exists(data(1)));
     EXPECT_EQ(writeAt(slot, 0, bytesOf("new")), STATUS_OK);
@@ -1057,9 +1042,7 @@ TEST_F(DualFileStore, BeginDropsTheOtherCopysLeftovers) {
 }
 
 TEST_F(DualFileStore, SecondBeginDoesNotRestart) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("current")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("current")});
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
     EXPECT_EQ(writeAt(slot, 0, bytesOf("abc")), STATUS_OK);
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
@@ -1071,9 +1054,7 @@ TEST_F(DualFileStore, SecondBeginDoesNotRestart) {
 }
 
 TEST_F(DualFileStore, WriteAtInsideABegunWriteWithABadOffset) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("current")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("current")});
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
     EXPECT_EQ(writeAt(slot, -1, bytesOf("x")), STATUS_INVALID_PARAMETER);
     EXPECT_EQ(contentOf(slot), holding(bytesOf("current")));
@@ -1108,9 +1089,7 @@ TEST_F(DualFileStore, OneShotWriteInsideABegunWriteLeavesItBegun) {
 
 TEST_F(DualFileStore, WriteAtKeepsTheBytesAroundTheBlock) {
     const Bytes old = patternBytes(300, 17);
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, old), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({old});
     const Bytes block = patternBytes(20, 18);
     EXPECT_EQ(writeAt(slot, 100, block), STATUS_OK);
     Bytes expected = old;
@@ -1121,9 +1100,7 @@ TEST_F(DualFileStore, WriteAtKeepsTheBytesAroundTheBlock) {
 }
 
 TEST_F(DualFileStore, WriteAtPastTheEndExtends) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("0123456789")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("0123456789")});
     EXPECT_EQ(writeAt(slot, 8, bytesOf("ABCDE")), STATUS_OK);
     EXPECT_EQ(contentOf(slot), holding(bytesOf("01234567ABCDE")));
     EXPECT_EQ(writeAt(slot, 15, bytesOf("Z")), STATUS_OK);
@@ -1144,10 +1121,7 @@ TEST_F(DualFileStore, WriteAtOnAFreshStoreStartsFromNothing) {
 }
 
 TEST_F(DualFileStore, WriteAtOverAnInvalidCurrentCopyWritesIntoTheLeftover) {
-    fs::create_directories(copyDir(0));
-    fs::create_directories(copyDir(1));
-    writeBytes(data(0), bytesOf("unchecked current"));
-    writeBytes(data(1), bytesOf("ZZZZZZZZZZ"));
+    writeUncheckedCopies(bytesOf("unchecked current"), bytesOf("ZZZZZZZZZZ"));
     auto target = open();
     TargetSlot& slot = slotOf(*target);
     EXPECT_EQ(writeAt(slot, 2, bytesOf("ab")), STATUS_OK);
@@ -1156,10 +1130,7 @@ TEST_F(DualFileStore, WriteAtOverAnInvalidCurrentCopyWritesIntoTheLeftover) {
 }
 
 TEST_F(DualFileStore, WriteAtAfterEraseCopiesNothing) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("first")), STATUS_OK);
-    EXPECT_EQ(write(slot, bytesOf("second")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("first"), bytesOf("second")});
     EXPECT_EQ(slot.erase(), STATUS_OK);
     // The current copy (1) has no data; copy 0 still holds "second".
     EXPECT_EQ(writeAt(slot, 0, bytesOf("XY")), STATUS_OK);
@@ -1167,10 +1138,7 @@ TEST_F(DualFileStore, WriteAtAfterEraseCopiesNothing) {
 }
 
 TEST_F(DualFileStore, WriteAtWithABadOffsetLeavesTheCurrentCopy) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
-    EXPECT_EQ(write(slot, bytesOf("first")), STATUS_OK);
-    EXPECT_EQ(write(slot, bytesOf("second")), STATUS_OK);
+    TargetSlot& slot = slotAfterWrites({bytesOf("first"), bytesOf("second")});
     EXPECT_EQ(writeAt(slot, -5, bytesOf("x")), STATUS_INVALID_PARAMETER);
     EXPECT_EQ(contentOf(slot), holding(bytesOf("second")));
     EXPECT_FALSE(fs::exists(check(1)));
@@ -1181,22 +1149,11 @@ TEST_F(DualFileStore, WriteAtWithABadOffsetLeavesTheCurrentCopy) {
 
 // A directory in place of the other copy's check file cannot be removed.
 TEST_F(DualFileStore, UnremovableCheckPathFailsTheWrite) {
-    {
-        auto target = open();
-        EXPECT_EQ(write(slotOf(*target), bytesOf("old")), STATUS_OK);
-        EXPECT_EQ(write(slotOf(*target), bytesOf("older")), STATUS_OK);
-    }
+    storeInTurn({bytesOf("old"), bytesOf("older")});
     fs::remove(check(1));
     fs::create_directories(check(1) / "inside");
-    const auto result = runInChild([&] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        DualFileTarget target(base(), 1);
-        TargetSlot& slot = *target.getSlot(0).get();
-        const Bytes blob = bytesOf("new");
-        std::printf("write %u\n", slot.write(blob.data(), blob.size()));
-        std::printf("%s\n", hex(contentOf(slot).data).c_str());
-        return 0;
-    });
+    const auto result = newBlobInChild(
+        [](TargetSlot& slot, const Bytes& blob) { std::printf("write %u\n", slot.write(blob.data(), blob.size())); });
     EXPECT_EQ(result.out, "lib/storage/storage_target:334 Failure cleaning up checkfile \"" + check(1).string() +
                               "\"\nlib/storage/storage_target:378 generic:39\nwrite 39\n" + hex(bytesOf("older")) +
                               "\n");
@@ -1215,18 +1172,12 @@ TEST_F(DualFileStore, LinkedCopyDirectoryFailsEveryUpdate) {
     // Copy 1's directory becomes a dangling symbolic link.
     fs::remove_all(copyDir(1));
     fs::create_directory_symlink(dir / "nowhere", copyDir(1));
-    const auto result = runInChild([&] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        DualFileTarget target(base(), 1);
-        TargetSlot& slot = *target.getSlot(0).get();
-        const Bytes blob = bytesOf("new");
+    const auto result = newBlobInChild([](TargetSlot& slot, const Bytes& blob) {
         std::printf("write %u\n", slot.write(blob.data(), blob.size()));
         std::printf("writeAt %u\n", slot.writeAt(1, blob.data(), blob.size()));
         std::printf("erase %u\n", slot.erase());
         std::printf("beginWrite %u\n", slot.beginWrite());
         std::printf("finalise %u\n", slot.finalise());
-        std::printf("%s\n", hex(contentOf(slot).data).c_str());
-        return 0;
     });
     const std::string invalidated = "lib/storage/storage_target:378 generic:20\n";
     EXPECT_EQ(result.out, "lib/storage/storage_target:334 Failure cleaning up checkfile \"" +
@@ -1249,20 +1200,10 @@ TEST_F(DualFileStore, LinkedCopyDirectoryFailsEveryUpdate) {
 // A directory in place of the transient file: it can be neither opened nor
 // removed.
 TEST_F(DualFileStore, TransientFileThatCannotBeCleanedUp) {
-    {
-        auto target = open();
-        EXPECT_EQ(write(slotOf(*target), bytesOf("current")), STATUS_OK);
-    }
+    storeInTurn({bytesOf("current")});
     fs::create_directories(copyDir(0) / "data.chk.tmp" / "inside");
-    const auto result = runInChild([&] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        DualFileTarget target(base(), 1);
-        TargetSlot& slot = *target.getSlot(0).get();
-        const Bytes blob = bytesOf("new");
-        std::printf("write %u\n", slot.write(blob.data(), blob.size()));
-        std::printf("%s\n", hex(contentOf(slot).data).c_str());
-        return 0;
-    });
+    const auto result = newBlobInChild(
+        [](TargetSlot& slot, const Bytes& blob) { std::printf("write %u\n", slot.write(blob.data(), blob.size())); });
     EXPECT_EQ(result.out, kOpenFailure + (copyDir(0) / "data.chk.tmp").string() +
                               ": Is a directory\n"
                               "lib/storage/storage_target:461 finalise: write failed: 9: Bad file descriptor\n"

@@ -12,6 +12,7 @@
 #include <filesystem>
 #include <functional>
 #include <map>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -25,6 +26,7 @@
 #include "lib/storage/firmware_update_boot_target.h"
 #include "lib/storage/firmware_update_partition_target.h"
 #include "lib/util/log.h"
+#include "slot_changes_refused.h"
 #include "storage_log.h"
 
 namespace {
@@ -104,26 +106,51 @@ size_t countOf(const std::string& text, const std::string& part) {
     return count;
 }
 
-// ---- the boot-file target ----
+// ---- both targets ----
 
-TEST(FirmwareUpdateBoot, TwoSlotsOnePerBootFile) {
-    FirmwareUpdateBootTarget target;
-    EXPECT_EQ(target.getSlotCount(), 2u);
-    EXPECT_EQ(target.getDescription(), "FirmwareUpdateBootTarget /media/boot");
-    ASSERT_TRUE(target.getSlot(0));
-    ASSERT_TRUE(target.getSlot(1));
-    EXPECT_FALSE(target.getSlot(0).ownsSlot());
-    EXPECT_NE(target.getSlot(0).get(), target.getSlot(1).get());
-    EXPECT_EQ(target.getSlot(1).get(), target.getSlot(1).get());
-    EXPECT_FALSE(target.getSlot(2));
-    EXPECT_FALSE(target.getSlot(size_t{1} << 32));
-    size_t index = 0;
-    size_t size = 0;
-    EXPECT_EQ(target.addSlot("BOOT.BIN", index, size), STATUS_NOT_IMPLEMENTED);
-    EXPECT_EQ(target.removeSlot(0), STATUS_NOT_IMPLEMENTED);
-    EXPECT_EQ(target.removeAllSlots(), STATUS_NOTHING_TO_DO);
-    EXPECT_EQ(target.getSlotCount(), 2u);
+// What a firmware-update target looks like before any update: a fixed set of
+// slots, each handed out as the same borrowed slot, none added or removed.
+struct TargetShape {
+    const char* name;
+    std::function<std::unique_ptr<Storage::Target>()> make;
+    size_t slotCount;
+    const char* description;
+    // A name addSlot() is asked for.
+    const char* slotName;
+};
+
+class FirmwareUpdateTargetShape : public ::testing::TestWithParam<TargetShape> {};
+
+TEST_P(FirmwareUpdateTargetShape, FixedSlotsNoneAddedOrRemoved) {
+    const TargetShape& shape = GetParam();
+    const std::unique_ptr<Storage::Target> target = shape.make();
+    EXPECT_EQ(target->getSlotCount(), shape.slotCount);
+    EXPECT_EQ(target->getDescription(), shape.description);
+    for (size_t index = 0; index < shape.slotCount; ++index) {
+        ASSERT_TRUE(target->getSlot(index)) << index;
+        EXPECT_FALSE(target->getSlot(index).ownsSlot()) << index;
+        EXPECT_EQ(target->getSlot(index).get(), target->getSlot(index).get()) << index;
+        if (index > 0) {
+            EXPECT_NE(target->getSlot(index).get(), target->getSlot(index - 1).get()) << index;
+        }
+    }
+    EXPECT_FALSE(target->getSlot(shape.slotCount));
+    EXPECT_FALSE(target->getSlot(size_t{1} << 32));
+    store_test::expectSlotChangesRefused(*target, shape.slotName);
+    EXPECT_EQ(target->removeAllSlots(), STATUS_NOTHING_TO_DO);
+    EXPECT_EQ(target->getSlotCount(), shape.slotCount);
 }
+
+INSTANTIATE_TEST_SUITE_P(
+    FirmwareUpdate, FirmwareUpdateTargetShape,
+    ::testing::Values(TargetShape{"BootTwoSlotsOnePerBootFile",
+                                  [] { return std::make_unique<FirmwareUpdateBootTarget>(); }, 2,
+                                  "FirmwareUpdateBootTarget /media/boot", "BOOT.BIN"},
+                      TargetShape{"PartitionOneSlot", [] { return std::make_unique<FirmwareUpdatePartitionTarget>(); },
+                                  1, "FirmwareUpdatePartitionTarget", "x"}),
+    [](const ::testing::TestParamInfo<TargetShape>& info) { return std::string(info.param.name); });
+
+// ---- the boot-file target ----
 
 // No update in progress: nothing to finalise, write or close, and nothing
 // said about it.
@@ -480,22 +507,6 @@ TEST(FirmwareUpdateBoot, DestructionClosesTheTemporaryFile) {
 }
 
 // ---- the partition target ----
-
-TEST(FirmwareUpdatePartition, OneSlot) {
-    FirmwareUpdatePartitionTarget target;
-    EXPECT_EQ(target.getSlotCount(), 1u);
-    EXPECT_EQ(target.getDescription(), "FirmwareUpdatePartitionTarget");
-    ASSERT_TRUE(target.getSlot(0));
-    EXPECT_FALSE(target.getSlot(0).ownsSlot());
-    EXPECT_EQ(target.getSlot(0).get(), target.getSlot(0).get());
-    EXPECT_FALSE(target.getSlot(1));
-    EXPECT_FALSE(target.getSlot(size_t{1} << 32));
-    size_t index = 0;
-    size_t size = 0;
-    EXPECT_EQ(target.addSlot("x", index, size), STATUS_NOT_IMPLEMENTED);
-    EXPECT_EQ(target.removeSlot(0), STATUS_NOT_IMPLEMENTED);
-    EXPECT_EQ(target.removeAllSlots(), STATUS_NOTHING_TO_DO);
-}
 
 // Without an update: nothing is written, nothing mounted, nothing said.
 TEST(FirmwareUpdatePartition, IdleSlot) {

@@ -8,6 +8,7 @@
 
 #include "lib/storage/dual_file_target.h"
 #include "scratch_dir.h"
+#include "slot_changes_refused.h"
 #include "store_files.h"
 
 namespace {
@@ -211,12 +212,7 @@ TEST(SlotHandle, SelfMoveAssignmentKeepsTheSlot) {
 
 TEST(TargetDefaults, OptionalOperationsAreNotImplemented) {
     BareTarget target;
-    size_t index = 5;
-    size_t size = 6;
-    EXPECT_EQ(target.addSlot("x", index, size), STATUS_NOT_IMPLEMENTED);
-    EXPECT_EQ(index, 5u);
-    EXPECT_EQ(size, 6u);
-    EXPECT_EQ(target.removeSlot(0), STATUS_NOT_IMPLEMENTED);
+    store_test::expectSlotChangesRefused(target, "x");
     EXPECT_EQ(target.removeAllSlots(), STATUS_NOT_IMPLEMENTED);
 }
 

@@ -1,5 +1,8 @@
 #include "migration.h"
 
+#include <optional>
+#include <string>
+
 #include <gtest/gtest.h>
 
 #include "files.h"
@@ -19,6 +22,11 @@ Status passesG(const Block& block, size_t& length) {
     return STATUS_OK;
 }
 
+const Block kGood1{'G', '1', 'x'};
+const Block kGood2{'G', '2', 'y', 'z'};
+const Block kBad1{'B', '1'};
+const Block kBad2{'B', '2', '2'};
+
 class MigrationTest : public ::testing::Test {
 protected:
     // One slot: the copies live directly under the base directory.
@@ -30,70 +38,62 @@ protected:
     ScratchDir dir;
     Storage::DualFileTarget target{dir / "store", 1};
     const MigrationCheck check = passesG;
-    const Block good1{'G', '1', 'x'};
-    const Block good2{'G', '2', 'y', 'z'};
-    const Block bad1{'B', '1'};
-    const Block bad2{'B', '2', '2'};
 };
 
-TEST_F(MigrationTest, SimpleWritesBlockOneWholeWithoutChecking) {
-    EXPECT_EQ(runMigration(MigrationType::simple, target, 0, check, bad1, good2), STATUS_OK);
-    EXPECT_EQ(stored(), bad1);
-}
+// One migration of two blocks into a fresh one-slot store: its status, and
+// what the slot holds after it (nothing at all where `stored` is empty).
+struct MigrationRow {
+    const char* name;
+    MigrationType type;
+    size_t slot;
+    Block block1;
+    Block block2;
+    Status status;
+    std::optional<Block> stored;
+};
 
-TEST_F(MigrationTest, SimpleWritesAnEmptyBlock) {
-    EXPECT_EQ(runMigration(MigrationType::simple, target, 0, check, Block{}, Block{}), STATUS_OK);
-    EXPECT_EQ(stored(), Block{});
-    EXPECT_TRUE(target.getSlot(0)->exists());
-}
-
-TEST_F(MigrationTest, CheckedWritesTheReportedLength) {
-    EXPECT_EQ(runMigration(MigrationType::checked, target, 0, check, good1, bad2), STATUS_OK);
-    EXPECT_EQ(stored(), (Block{'G', '1'}));
-}
-
-TEST_F(MigrationTest, CheckedFailureWritesNothing) {
-    EXPECT_EQ(runMigration(MigrationType::checked, target, 0, check, bad1, good2), STATUS_NOT_FOUND + 2);
-    EXPECT_TRUE(nothingWritten());
-}
-
-TEST_F(MigrationTest, CheckedFailureIsReportedBeforeTheSlotIsAskedFor) {
-    EXPECT_EQ(runMigration(MigrationType::checked, target, 5, check, bad1, good2), STATUS_NOT_FOUND + 2);
-}
-
-TEST_F(MigrationTest, RedundantPrefersBlockOne) {
-    EXPECT_EQ(runMigration(MigrationType::redundant, target, 0, check, good1, good2), STATUS_OK);
-    EXPECT_EQ(stored(), (Block{'G', '1'}));
-}
-
-TEST_F(MigrationTest, RedundantFallsBackToBlockTwo) {
-    EXPECT_EQ(runMigration(MigrationType::redundant, target, 0, check, bad1, good2), STATUS_OK);
-    EXPECT_EQ(stored(), (Block{'G', '2'}));
-}
-
-TEST_F(MigrationTest, RedundantWithBothBadFailsWithBlockTwosStatus) {
-    EXPECT_EQ(runMigration(MigrationType::redundant, target, 0, check, bad1, bad2), STATUS_NOT_FOUND + 3);
-    EXPECT_TRUE(nothingWritten());
-}
-
-TEST_F(MigrationTest, MissingSlotIsAnInvalidParameterForEveryType) {
-    EXPECT_EQ(runMigration(MigrationType::simple, target, 1, check, good1, good2), STATUS_INVALID_PARAMETER);
-    EXPECT_EQ(runMigration(MigrationType::checked, target, 1, check, good1, good2), STATUS_INVALID_PARAMETER);
+const MigrationRow kMigrationRows[] = {
+    {"SimpleWritesBlockOneWholeWithoutChecking", MigrationType::simple, 0, kBad1, kGood2, STATUS_OK, kBad1},
+    {"SimpleWritesAnEmptyBlock", MigrationType::simple, 0, Block{}, Block{}, STATUS_OK, Block{}},
+    {"CheckedWritesTheReportedLength", MigrationType::checked, 0, kGood1, kBad2, STATUS_OK, Block{'G', '1'}},
+    {"CheckedFailureWritesNothing", MigrationType::checked, 0, kBad1, kGood2, STATUS_NOT_FOUND + 2, std::nullopt},
+    {"CheckedFailureIsReportedBeforeTheSlotIsAskedFor", MigrationType::checked, 5, kBad1, kGood2, STATUS_NOT_FOUND + 2,
+     std::nullopt},
+    {"RedundantPrefersBlockOne", MigrationType::redundant, 0, kGood1, kGood2, STATUS_OK, Block{'G', '1'}},
+    {"RedundantFallsBackToBlockTwo", MigrationType::redundant, 0, kBad1, kGood2, STATUS_OK, Block{'G', '2'}},
+    {"RedundantWithBothBadFailsWithBlockTwosStatus", MigrationType::redundant, 0, kBad1, kBad2, STATUS_NOT_FOUND + 3,
+     std::nullopt},
+    // A missing slot is an invalid parameter for every type.
+    {"SimpleMissingSlot", MigrationType::simple, 1, kGood1, kGood2, STATUS_INVALID_PARAMETER, std::nullopt},
+    {"CheckedMissingSlot", MigrationType::checked, 1, kGood1, kGood2, STATUS_INVALID_PARAMETER, std::nullopt},
     // Redundant asks for the slot before any check runs.
-    EXPECT_EQ(runMigration(MigrationType::redundant, target, 1, check, bad1, bad2), STATUS_INVALID_PARAMETER);
-    EXPECT_TRUE(nothingWritten());
+    {"RedundantMissingSlot", MigrationType::redundant, 1, kBad1, kBad2, STATUS_INVALID_PARAMETER, std::nullopt},
+    {"UnknownTypeWritesNothingAndSucceeds", static_cast<MigrationType>(3), 0, kGood1, kGood2, STATUS_OK, std::nullopt},
+};
+
+class MigrationRows : public MigrationTest, public ::testing::WithParamInterface<MigrationRow> {};
+
+TEST_P(MigrationRows, StatusAndWhatIsStored) {
+    const MigrationRow& row = GetParam();
+    EXPECT_EQ(runMigration(row.type, target, row.slot, check, row.block1, row.block2), row.status);
+    if (row.stored) {
+        EXPECT_EQ(stored(), *row.stored);
+        EXPECT_TRUE(target.getSlot(0)->exists());
+    } else {
+        EXPECT_TRUE(nothingWritten());
+    }
 }
 
-TEST_F(MigrationTest, UnknownTypeWritesNothingAndSucceeds) {
-    EXPECT_EQ(runMigration(static_cast<MigrationType>(3), target, 0, check, good1, good2), STATUS_OK);
-    EXPECT_TRUE(nothingWritten());
-}
+INSTANTIATE_TEST_SUITE_P(Migration, MigrationRows, ::testing::ValuesIn(kMigrationRows),
+                         [](const ::testing::TestParamInfo<MigrationRow>& info) {
+                             return std::string(info.param.name);
+                         });
 
 TEST_F(MigrationTest, WriteFailureIsTheResult) {
     // The copy's directory is a file: the data file cannot be created.
     std::filesystem::remove_all(dir / "store/2");
     testing_support::writeText(dir / "store/2", "in the way");
-    EXPECT_NE(runMigration(MigrationType::simple, target, 0, check, good1, good2), STATUS_OK);
+    EXPECT_NE(runMigration(MigrationType::simple, target, 0, check, kGood1, kGood2), STATUS_OK);
     EXPECT_FALSE(target.getSlot(0)->isValid());
 }
 

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cstdint>
 #include <fstream>
+#include <functional>
 #include <iterator>
 #include <random>
 #include <sstream>
@@ -128,20 +129,29 @@ std::vector<size_t> randomCuts(std::mt19937& random, size_t size) {
     return cuts;
 }
 
-TEST(Crc32, IncrementalAtRandomSplitsMatchesOneShot) {
+// `rounds` random inputs of up to `maxLength` bytes, each cut at random
+// places and fed piece by piece, piece `i` of round `round` through
+// `updateFor(i, round)`: the finished state is the bitwise CRC of the whole,
+// and crc32()'s.
+void expectRandomSplitsMatch(size_t maxLength, int rounds,
+                             const std::function<Crc32Paths::Update(size_t i, int round)>& updateFor) {
     std::mt19937 random(77u);
-    std::uniform_int_distribution<size_t> lengthOf(0, 70000);
-    for (int round = 0; round < 100; ++round) {
+    std::uniform_int_distribution<size_t> lengthOf(0, maxLength);
+    for (int round = 0; round < rounds; ++round) {
         const Bytes data = randomBytes(random, lengthOf(random));
         const std::vector<size_t> cuts = randomCuts(random, data.size());
 
         uint32_t state = kCrc32Initial;
         for (size_t i = 0; i + 1 < cuts.size(); ++i) {
-            state = crc32Update(state, data.data() + cuts[i], cuts[i + 1] - cuts[i]);
+            state = updateFor(i, round)(state, data.data() + cuts[i], cuts[i + 1] - cuts[i]);
         }
         ASSERT_EQ(crc32Finish(state), bitwiseCrc32(data.data(), data.size())) << "round " << round;
         ASSERT_EQ(crc32Finish(state), crc32(data.data(), data.size())) << "round " << round;
     }
+}
+
+TEST(Crc32, IncrementalAtRandomSplitsMatchesOneShot) {
+    expectRandomSplitsMatch(70000, 100, [](size_t, int) -> Crc32Paths::Update { return crc32Update; });
 }
 
 // The way a file is checksummed: whole 4096-byte blocks and a short tail.
@@ -252,19 +262,10 @@ TEST_P(Crc32Path, LargeBuffersMatchBitwise) {
 // Pieces cut at random places, each fed by this path or by the tables in
 // turn: the running state means the same to all of them.
 TEST_P(Crc32Path, RandomSplitsMixedWithTheTablesMatchBitwise) {
-    std::mt19937 random(77u);
-    std::uniform_int_distribution<size_t> lengthOf(0, 20000);
-    for (int round = 0; round < 60; ++round) {
-        const Bytes data = randomBytes(random, lengthOf(random));
-        const std::vector<size_t> cuts = randomCuts(random, data.size());
-
-        uint32_t state = kCrc32Initial;
-        for (size_t i = 0; i + 1 < cuts.size(); ++i) {
-            const Crc32Paths::Update update = (i + round) % 2 == 0 ? GetParam().update : Crc32Paths::updateTable;
-            state = update(state, data.data() + cuts[i], cuts[i + 1] - cuts[i]);
-        }
-        ASSERT_EQ(crc32Finish(state), bitwiseCrc32(data.data(), data.size())) << "round " << round;
-    }
+    const Crc32Paths::Update path = GetParam().update;
+    expectRandomSplitsMatch(20000, 60, [path](size_t i, int round) {
+        return (i + static_cast<size_t>(round)) % 2 == 0 ? path : Crc32Paths::updateTable;
+    });
 }
 
 TEST_P(Crc32Path, EverySingleBitFlipOfALongInputMatchesBitwise) {

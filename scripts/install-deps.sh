@@ -5,7 +5,8 @@
 #                           the crash exploration compares its records with
 #                           strace; a program is built against the installed
 #                           package with make and pkg-config; the power-cut
-#                           campaign's judgement is tested with Python)
+#                           campaign's judgement is tested with Python; the
+#                           Debian configure line takes dpkg-dev's flags)
 #   install-deps.sh cross   also the ARM64 cross compiler, the emulator that
 #                           runs its programs, and GoogleTest's sources to
 #                           build for ARM64
@@ -43,8 +44,8 @@ for group in "$@"; do
       packages+=(qemu-system-arm cpio fdisk e2fsprogs kmod python3 binutils)
       arm64_packages=1
       ;;
-    tests) packages+=(fdisk e2fsprogs strace make pkgconf python3) ;;
-    coverage) packages+=(fdisk e2fsprogs strace make pkgconf python3 gcovr) ;;
+    tests) packages+=(fdisk e2fsprogs strace make pkgconf python3 dpkg-dev) ;;
+    coverage) packages+=(fdisk e2fsprogs strace make pkgconf python3 dpkg-dev gcovr) ;;
     cross) packages+=(g++-aarch64-linux-gnu qemu-user googletest file) ;;
     package)
       packages+=(debhelper dpkg-dev fakeroot lintian autopkgtest fdisk e2fsprogs strace make pkgconf python3)

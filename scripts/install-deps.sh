@@ -52,7 +52,7 @@ for group in "$@"; do
       ;;
     cross-package)
       packages+=(debhelper dpkg-dev fakeroot crossbuild-essential-arm64 qemu-user make pkgconf
-        libc6-dev:arm64 libstdc++-12-dev:arm64 libgtest-dev:arm64)
+        libc6-dev:arm64 libstdc++-12-dev:arm64 libgtest-dev:arm64 pkgconf:arm64)
       arm64_packages=1
       ;;
     fresh-root) packages+=(mmdebstrap) ;;

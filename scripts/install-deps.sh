@@ -48,7 +48,7 @@ for group in "$@"; do
     coverage) packages+=(fdisk e2fsprogs strace make pkgconf python3 dpkg-dev gcovr) ;;
     cross) packages+=(g++-aarch64-linux-gnu qemu-user googletest file) ;;
     package)
-      packages+=(debhelper dpkg-dev fakeroot lintian autopkgtest fdisk e2fsprogs strace make pkgconf python3)
+      packages+=(debhelper dpkg-dev fakeroot lintian autopkgtest fdisk make pkgconf python3)
       ;;
     cross-package)
       packages+=(debhelper dpkg-dev fakeroot crossbuild-essential-arm64 qemu-user make pkgconf

@@ -40,7 +40,7 @@ case $mode in
       echo "the package build warns (above)" >&2
       exit 1
     fi
-    grep -E '^(100% tests passed|[0-9]+% tests passed)' "$out/amd64/build.log"
+    grep -E '^[0-9]+% tests passed' "$out/amd64/build.log"
     changes=$(ls "$out"/amd64/migrate-settings_"$version"_*.changes)
     lintian --fail-on error,warning --info "$changes"
     ls -l "$out"/amd64/*.deb

@@ -5,7 +5,7 @@
 #                          packages with the build-time tests, then lintian,
 #                          which fails on any error or warning
 #   package.sh arm64       the arm64 packages, cross-built, with the tests
-#                          run under qemu-user
+#                          run under qemu-user, then lintian
 #   package.sh autopkgtest the autopkgtests (debian/tests) of the native
 #                          packages on this machine (installs them here)
 #   package.sh arm64-consumer  the consumer program cross-built against the
@@ -53,6 +53,7 @@ case $mode in
       exit 1
     }
     grep -E '^[0-9]+% tests passed' "$out/arm64/build.log"
+    lintian --fail-on error,warning --info "$out"/arm64/migrate-settings_"$version"_arm64.changes
     for deb in "$out"/arm64/*_arm64.deb; do
       dpkg-deb -f "$deb" Package Architecture
     done

@@ -157,7 +157,8 @@ if [ "$shared" = 1 ]; then
     { echo "migrate_settings does not use the shared storage library"; exit 1; }
   runtime=(env LD_LIBRARY_PATH="$usr/$libdir")
 fi
-"${runtime[@]}" "$usr/bin/migrate_settings" --help | grep -q '^Usage: ' || { echo "the installed tool does not run"; exit 1; }
+"${runtime[@]}" "$usr/bin/migrate_settings" --help >"$scratch/help.out" 2>&1 || { echo "the installed tool does not run:"; cat "$scratch/help.out"; exit 1; }
+grep -q "^Usage: " "$scratch/help.out" || { echo "the installed tool prints no usage:"; cat "$scratch/help.out"; exit 1; }
 # Its log lines name their sources as every build does, whatever prefix
 # maps the distribution's flags carry (here: where no eMMC is found).
 "${runtime[@]}" "$usr/bin/migrate_settings" --base "$scratch/base" --target settings --query-present \

@@ -1,7 +1,13 @@
-# Debian's libgtest-dev holds libraries for the build machine only. A cross
-# build compiles GoogleTest from the sources that Debian ships with it
-# (package googletest) and answers the tests' find_package(GTest) with them.
+# Debian's libgtest-dev holds libraries for the build machine only, unless
+# the target's own (libgtest-dev:arm64) is installed, as a package build
+# for the target has it. Otherwise a cross build compiles GoogleTest from
+# the sources that Debian ships with it (package googletest) and answers
+# the tests' find_package(GTest) with them.
 if(NOT CMAKE_CROSSCOMPILING)
+  return()
+endif()
+find_package(GTest QUIET)
+if(GTest_FOUND)
   return()
 endif()
 

@@ -5,7 +5,8 @@
 #                           the crash exploration compares its records with
 #                           strace; a program is built against the installed
 #                           package with make and pkg-config; the power-cut
-#                           campaign's judgement is tested with Python)
+#                           campaign's judgement is tested with Python; the
+#                           Debian configure line takes dpkg-dev's flags)
 #   install-deps.sh cross   also the ARM64 cross compiler, the emulator that
 #                           runs its programs, and GoogleTest's sources to
 #                           build for ARM64
@@ -20,6 +21,15 @@
 #                           and Debian's arm64 packages become reachable
 #                           (dpkg --add-architecture arm64), where the
 #                           guest's kernel and programs come from
+#   install-deps.sh package  also what builds the Debian packages and checks
+#                           them (debhelper, lintian, autopkgtest) and what
+#                           their build-time tests need
+#   install-deps.sh cross-package  also Debian's arm64 cross toolchain and
+#                           the arm64 libraries the cross-built packages and
+#                           their tests link (arm64 becomes reachable as for
+#                           device), and the emulator that runs the tests
+#   install-deps.sh fresh-root  also mmdebstrap, which bootstraps a minimal
+#                           Debian root from Debian's archive
 #   install-deps.sh bench   also the micro-benchmark library, zlib (the CRC
 #                           reference), sfdisk (run by every registry
 #                           opening), hyperfine, and the peers and tools that
@@ -35,9 +45,18 @@ for group in "$@"; do
       packages+=(qemu-system-arm cpio fdisk e2fsprogs kmod python3 binutils procps)
       arm64_packages=1
       ;;
-    tests) packages+=(fdisk e2fsprogs strace make pkgconf python3) ;;
-    coverage) packages+=(fdisk e2fsprogs strace make pkgconf python3 gcovr) ;;
+    tests) packages+=(fdisk e2fsprogs strace make pkgconf python3 dpkg-dev) ;;
+    coverage) packages+=(fdisk e2fsprogs strace make pkgconf python3 dpkg-dev gcovr) ;;
     cross) packages+=(g++-aarch64-linux-gnu qemu-user googletest file) ;;
+    package)
+      packages+=(debhelper dpkg-dev fakeroot lintian autopkgtest fdisk make pkgconf python3)
+      ;;
+    cross-package)
+      packages+=(debhelper dpkg-dev fakeroot crossbuild-essential-arm64 qemu-user make pkgconf
+        libc6-dev:arm64 libstdc++-12-dev:arm64 libgtest-dev:arm64 pkgconf:arm64)
+      arm64_packages=1
+      ;;
+    fresh-root) packages+=(mmdebstrap) ;;
     format) packages+=(clang-format) ;;
     fuzz) packages+=(clang libclang-rt-14-dev) ;;
     bench) packages+=(libbenchmark-dev zlib1g-dev fdisk hyperfine libubootenv-tool sqlite3 time python3) ;;

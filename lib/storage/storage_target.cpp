@@ -314,7 +314,7 @@ Status DualFileTarget::Slot::commit(unsigned index, SlotDirectories& directories
             } else {
                 LOGE_AT(kCheckWriteShortLine) << "Failed to write expected data: " << written;
             }
-            (void)::ftruncate(tmp.get(), 0);  // an orphaned partial file is harmless; the removal matters
+            [[maybe_unused]] const int cut = ::ftruncate(tmp.get(), 0);  // an orphan is harmless; removal matters
             if (directory.remove(kTransientName) != 0) LOGE_AT(kCheckCleanupLine) << "Failed to cleanup check file";
             return STATUS_FAILED;
         }
@@ -750,7 +750,7 @@ Status FirmwareUpdateBootTarget::Slot::compareWithDestination() {
         const size_t wanted = std::min<size_t>(kCompareBlock, remaining);
         const ssize_t got = ::read(receive_.get(), received, wanted);
         if (got <= 0) {
-            (void)::read(file.get(), stored, wanted);
+            [[maybe_unused]] const ssize_t ignored = ::read(file.get(), stored, wanted);
             result = STATUS_OUT_OF_RANGE;
             break;
         }

@@ -58,12 +58,5 @@ PKG_CONFIG_LIBDIR="$prefix/$libdir/pkgconfig" PKG_CONFIG_PATH= \
   exit 1
 }
 
-run_consumer() {
-  local program=$1 store=$2
-  "${emulator[@]}" "$program" "$store" >"$scratch/output"
-  printf '%s\n' "DualFileTarget $store with 2 slots" 'slot 0: empty' \
-    'slot 1: "settings for another program" crc32 b8eb8420' >"$scratch/expected_output"
-  diff -u "$scratch/expected_output" "$scratch/output"
-}
-run_consumer "$scratch/build/storage_consumer" "$scratch/store"
-run_consumer "$scratch/make/storage_consumer" "$scratch/make-store"
+"$source_dir/tests/consumer/run_consumer.sh" "$scratch/store" "${emulator[@]}" "$scratch/build/storage_consumer"
+"$source_dir/tests/consumer/run_consumer.sh" "$scratch/make-store" "${emulator[@]}" "$scratch/make/storage_consumer"

@@ -1,12 +1,23 @@
 #include "source_lines.h"
 
+#include <cstdlib>
 #include <fstream>
 #include <stdexcept>
 
 namespace testing_support {
 
+namespace {
+
+// An installed test suite (a ptest) reads the sources it was shipped with.
+std::string sourceRoot() {
+    const char* root = std::getenv("MIGRATE_SETTINGS_SOURCE_ROOT");
+    return root != nullptr ? root : SOURCE_ROOT;
+}
+
+}  // namespace
+
 int sourceLineOf(const std::string& sourcePath, const std::string& text) {
-    std::ifstream in(std::string(SOURCE_ROOT) + "/" + sourcePath);
+    std::ifstream in(sourceRoot() + "/" + sourcePath);
     if (!in) throw std::runtime_error("cannot read " + sourcePath);
     int found = 0;
     int number = 0;

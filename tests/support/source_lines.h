@@ -9,7 +9,8 @@
 namespace testing_support {
 
 // The number of the one line of `sourcePath` (relative to the top of the
-// source tree, e.g. "libcommon/lib/util/fd.cpp") that contains `text`.
+// source tree, e.g. "libcommon/lib/util/fd.cpp"; the tree is the build's, or
+// $MIGRATE_SETTINGS_SOURCE_ROOT when set) that contains `text`.
 // Throws std::runtime_error when the file cannot be read or not exactly one
 // line contains `text`.
 int sourceLineOf(const std::string& sourcePath, const std::string& text);

@@ -60,6 +60,13 @@ Status lockTimedOut(const char* what, const std::string& path) {
     return STATUS_TIMEOUT;
 }
 
+// "Failed to VERB "PATH": REASON (ERRNO)": a copy's file that the card or
+// the file system failed.
+void logFileFailure(const char* verb, const fs::path& path, int error) {
+    LOGE << "Failed to " << verb << " " << std::quoted(path.string()) << ": " << std::strerror(error) << " (" << error
+         << ")";
+}
+
 // A short write carries no errno (a file system that filled up, mostly):
 // the line says how far it got.
 Status shortWrite(const fs::path& path, ssize_t written, size_t size) {
@@ -139,9 +146,8 @@ void DualFileTarget::Slot::judge(SlotDirectories& directories, const LockDeadlin
         checks[i] = validate(i, directories, cleanUp);
         if (failedToRead(checks[i])) {
             const Copy& copy = copies_[i];
-            const fs::path& file = checks[i].fault == CopyFault::kDataUnreadable ? copy.dataPath : copy.checkPath;
-            LOGE << "Failed to read " << std::quoted(file.string()) << ": " << std::strerror(checks[i].error) << " ("
-                 << checks[i].error << ")";
+            logFileFailure("read", checks[i].fault == CopyFault::kDataUnreadable ? copy.dataPath : copy.checkPath,
+                           checks[i].error);
         }
     }
     current_ = currentCopy(checks[0], checks[1]);
@@ -292,10 +298,7 @@ Status DualFileTarget::Slot::commit(unsigned index, SlotDirectories& directories
     if (directory.computeCheckAndSync(value, syncError) != STATUS_OK) {
         // A card that fails its writes says so here first, before the
         // check file is touched.
-        if (syncError != 0) {
-            LOGE << "Failed to sync " << std::quoted(copy.dataPath.string()) << ": " << std::strerror(syncError) << " ("
-                 << syncError << ")";
-        }
+        if (syncError != 0) logFileFailure("sync", copy.dataPath, syncError);
         return STATUS_FAILED;
     }
 

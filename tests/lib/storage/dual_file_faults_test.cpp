@@ -211,7 +211,7 @@ TEST_F(DualFileFaults, DataFileSyncFails) {
     const ProcessResult result = drive({"write", input(new_)}, faultEnv("sync", 1, "errno:EIO", path("1/data")));
     expectUpdateFailedKeepingOld(
         result,
-        testing_support::errorPrefixOf("lib/storage/storage_target.cpp", "\"Failed to sync \" <<") +
+        testing_support::errorPrefixOf("lib/storage/storage_target.cpp", "\"Failed to \" << verb") +
             "Failed to sync \"" + path("1/data") + "\": Input/output error (5)\nwrite: 52\n",
         new_);
 }
@@ -376,7 +376,7 @@ TEST_F(DualFileFaults, CheckFileReadFailsAtOpening) {
     prepare();
     const ProcessResult result = drive({}, faultFromEnv("read", 1, "errno:EIO", path("2/data.chk")));
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_EQ(result.out, testing_support::errorPrefixOf("lib/storage/storage_target.cpp", "\"Failed to read \" <<") +
+    EXPECT_EQ(result.out, testing_support::errorPrefixOf("lib/storage/storage_target.cpp", "\"Failed to \" << verb") +
                               "Failed to read \"" + path("2/data.chk") + "\": Input/output error (5)\n" +
                               stateLine(holding(older_)));
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("1", older_) + "f 2/data " + hex(old_) + "\n");

@@ -32,6 +32,7 @@ kernel=$out/vmlinuz
 initramfs=$out/initramfs.cpio
 card=$out/card.img
 assembled=$out/guest-assembled
+packages=$root/build/packages/arm64
 
 usage() {
   echo "usage: scripts/arm64-device.sh build | test | shell | power-cuts N [SEED] | replay [--quick|--sample|--clock=CLOCK [--slots=N] [--scenarios=S,...]] [FS...] | faults [--full|--broken]" >&2
@@ -70,21 +71,48 @@ build() {
   # The test list's programs run as they are on the device, not under qemu-user.
   cmake --preset arm64-device >/dev/null
   cmake --build --preset arm64-device
+  # The guest installs the tools from the arm64 packages, as a device build does.
+  if packages_are_stale; then
+    scripts/package.sh arm64
+  fi
   if guest_is_stale; then
     ctest --preset arm64-device --show-only=json-v1 >"$out/tests.json"
     python3 "$guest/test_list.py" --time-factor 4 /usr/bin/qemu-aarch64 -L /usr/aarch64-linux-gnu \
       <"$out/tests.json" >"$out/arm64-device-tests.list"
-    python3 "$guest/assemble_guest.py" "$out/guest" "$root" "$out" "$initramfs" "$kernel"
+    python3 "$guest/assemble_guest.py" "$out/guest" "$root" "$out" "$initramfs" "$kernel" $(project_debs)
     touch "$assembled"
   fi
   [ "$card" -nt tests/device/device_layout.sh ] && [ "$card" -nt "$0" ] || make_card
   echo "=== arm64-device: built in $((SECONDS - start)) s ($(sed -n 's/^# \([0-9]*\) tests$/\1/p' "$out/arm64-device-tests.list") tests)"
 }
 
-# The guest holds the sources and the build's programs: it is stale when
-# any of them is newer than it.
+# The project's arm64 packages the guest installs.
+project_debs() {
+  local version
+  version=$(sed -n '1s/.*(\(.*\)).*/\1/p' debian/changelog)
+  echo "$packages/migrate-settings_${version}_arm64.deb" "$packages/libmigrate-settings-dev_${version}_arm64.deb"
+}
+
+# The packages are built from the tracked files: stale when one is missing
+# or any of those files is newer than it, but for the ones no package build
+# reads (the guest's own scripts, the other scripts, the documents).
+packages_are_stale() {
+  local deb newer
+  for deb in $(project_debs); do
+    [ -f "$deb" ] || return 0
+  done
+  newer=$(git ls-files -z -- . ':!tests/device/arm64' ':!scripts' ':!.ci' ':!*.md' | xargs -0 -r sh -c 'find "$@" -maxdepth 0 -newer "$0" -print -quit' "$deb" 2>/dev/null || true)
+  [ -n "$newer" ]
+}
+
+# The guest holds the sources, the build's programs and the packages: it
+# is stale when any of them is newer than it.
 guest_is_stale() {
   [ -f "$assembled" ] || return 0
+  local deb
+  for deb in $(project_debs); do
+    [ "$deb" -nt "$assembled" ] && return 0
+  done
   local newer
   newer=$(find "$root" \( -path "$root/.git" -o -path "$out/guest" -o \
     \( -path "$root/build/*" ! -path "$out" ! -path "$out/*" \) \) -prune -o \

@@ -3,12 +3,15 @@
 arm64 packages and the project's arm64-device build, and packs it as an
 initramfs.
 
-    assemble_guest.py WORK_DIR SOURCE_DIR BUILD_DIR OUTPUT_INITRAMFS OUTPUT_KERNEL
+    assemble_guest.py WORK_DIR SOURCE_DIR BUILD_DIR OUTPUT_INITRAMFS OUTPUT_KERNEL PROJECT_DEBS...
 
 WORK_DIR keeps the downloaded packages (reused by later runs) and the
 unpacked root. The project's sources and build keep their absolute paths
 in the guest, so that the test programs find what they were built with.
-Only Debian's package registry is reached (apt-get download).
+The project's own arm64 packages, PROJECT_DEBS, wait in PACKAGE_CACHE for
+the guest's dpkg to install them at boot, into a package database that
+holds the Debian packages the guest was assembled from. Only Debian's
+package registry is reached (apt-get download).
 """
 
 import os
@@ -34,6 +37,13 @@ WHOLE_PACKAGES = ["coreutils"]
 # The C and C++ runtime for dynamically linked programs (test programs,
 # the fault-injection shim), with the loader.
 RUNTIME_PACKAGES = ["libc6", "libstdc++6", "libgcc-s1"]
+# dpkg, with the programs it runs (sh, rm and diff come from dash,
+# coreutils and diffutils) and the one library it needs besides lib*.
+PACKAGE_MANAGER_PACKAGES = ["dpkg", "tar", "diffutils", "libc-bin", "zlib1g"]
+PACKAGE_MANAGER_PROGRAMS = ["usr/bin/dpkg", "usr/bin/dpkg-deb", "usr/bin/dpkg-split", "usr/bin/dpkg-query", "sbin/start-stop-daemon",
+                            "bin/tar", "usr/bin/diff", "sbin/ldconfig"]
+# Where the project's packages wait to be installed, in the guest.
+PACKAGE_CACHE = "var/cache/migrate-settings"
 
 # The kernel's modules the guest loads, with what they need (modules.dep).
 MODULES = ["sdhci-pci", "ext4", "crc32c_generic", "crc32_generic", "loop", "dm-mod", "dm-log-writes", "dm-snapshot", "dm-flakey",
@@ -143,6 +153,39 @@ def add_libraries(unpacked, root, elf, copied):
         add_libraries(unpacked, root, library, copied)
 
 
+def register_packages(root, debs):
+    """A dpkg database that holds DEBS, the packages the guest's programs
+    and libraries come from: their control fields, installed, with no file
+    lists, since the guest carries only part of their files. dpkg checks
+    the project's packages' dependencies against them."""
+    database = root / "var" / "lib" / "dpkg"
+    for directory in ("info", "updates", "triggers", "alternatives", "parts"):
+        (database / directory).mkdir(parents=True, exist_ok=True)
+    stanzas = []
+    for deb in sorted(debs, key=lambda d: d.name):
+        fields = output("dpkg-deb", "-f", str(deb)).rstrip("\n")
+        package, _, rest = fields.partition("\n")
+        stanzas.append(f"{package}\nStatus: install ok installed\n{rest}\n")
+        name = package.split(": ", 1)[1]
+        multi_arch_same = re.search(r"^Multi-Arch: same$", rest, re.M)
+        (database / "info" / f"{name}{':' + ARCH if multi_arch_same else ''}.list").write_text("")
+    (database / "status").write_text("\n".join(stanzas))
+    (database / "available").write_text("")
+
+
+def add_project_packages(root, project_debs):
+    cache = root / PACKAGE_CACHE
+    cache.mkdir(parents=True, exist_ok=True)
+    for deb in project_debs:
+        if dpkg_field(deb, "Architecture") != ARCH:
+            sys.exit(f"assemble_guest: {deb} is not an {ARCH} package")
+        copy_file(deb, cache / deb.name)
+
+
+def dpkg_field(deb, field):
+    return output("dpkg-deb", "-f", str(deb), field).strip()
+
+
 def is_elf(path):
     with open(path, "rb") as file:
         return file.read(4) == b"\x7fELF"
@@ -198,11 +241,14 @@ def add_project(root, source, build, work):
 
 def main():
     work, source, build, initramfs, kernel_out = (Path(a).resolve() for a in sys.argv[1:6])
+    project_debs = [Path(a).resolve() for a in sys.argv[6:]]
+    if not project_debs:
+        sys.exit("assemble_guest: no project packages given")
     debs = work / "debs"
     unpacked = work / "unpacked"
     root = work / "root"
     kernel = kernel_package()
-    packages = library_closure(PROGRAM_PACKAGES + RUNTIME_PACKAGES) + ["busybox-static", kernel]
+    packages = library_closure(PROGRAM_PACKAGES + RUNTIME_PACKAGES + PACKAGE_MANAGER_PACKAGES) + ["busybox-static", kernel]
     available = download(packages, debs)
 
     shutil.rmtree(unpacked, ignore_errors=True)
@@ -221,7 +267,7 @@ def main():
     loader = find_library(unpacked, "ld-linux-aarch64.so.1")
     copy_file(loader, root / "lib" / "ld-linux-aarch64.so.1")
     copy_file(loader, root / "lib" / TRIPLET / "ld-linux-aarch64.so.1")
-    for relative in PROGRAMS:
+    for relative in PROGRAMS + PACKAGE_MANAGER_PROGRAMS:
         copy_with_libraries(unpacked, root, relative, copied)
     for package in WHOLE_PACKAGES:
         for line in output("dpkg-deb", "-c", str(available[package])).splitlines():
@@ -236,6 +282,8 @@ def main():
     (root / "bin" / "sh").symlink_to("dash")
 
     add_modules(unpacked, root, version)
+    register_packages(root, [available[p] for p in packages if p != kernel])
+    add_project_packages(root, project_debs)
     add_project(root, source, build, work)
     test_list = build / "arm64-device-tests.list"
     copy_file(test_list, root / test_list.relative_to("/"))
@@ -247,7 +295,8 @@ def main():
     guest = source / "tests" / "device" / "arm64"
     copy_file(guest / "init.sh", root / "init")
     (root / "etc" / "arm64-device.conf").write_text(
-        f"source_dir='{source}'\nbuild_dir='{build}'\nmodules='{' '.join(MODULES)}'\n")
+        f"source_dir='{source}'\nbuild_dir='{build}'\nmodules='{' '.join(MODULES)}'\n"
+        f"packages='/{PACKAGE_CACHE}'\ninstalled_tools=/usr/bin\n")
     copy_file(guest / "fstab", root / "etc" / "fstab")
     (root / "etc" / "passwd").write_text("root:x:0:0:root:/root:/bin/sh\nnobody:x:65534:65534:nobody:/:/bin/sh\n")
     (root / "etc" / "group").write_text("root:x:0:\nnogroup:x:65534:\n")

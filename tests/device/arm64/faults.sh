@@ -45,10 +45,9 @@
 set -u
 . /etc/arm64-device.conf
 set_name=${1:-bounded}
-tools=$build_dir/lib/storage/tools
-tool=$tools/migrate_settings
-inspect=$tools/inspect_store
-make_data=$tools/make_example_data
+tool=$installed_tools/migrate_settings
+inspect=$installed_tools/inspect_store
+make_data=$build_dir/lib/storage/tools/make_example_data
 driver=$build_dir/tests/lib/storage/dual_file_driver
 boot_driver=$build_dir/tests/device/targets/device_target_driver
 shim=$build_dir/tests/fault_injection/libfault_injection.so

@@ -57,6 +57,13 @@ done </etc/fstab
 mount -a || echo "arm64-device: not every file system of /etc/fstab could be mounted"
 # Tests that need the simulated device use this eMMC instead of loop devices.
 echo /dev/mmcblk0 >/run/arm64-device
+# The tools come from the project's packages, installed as a device build
+# installs them; everything below runs those. By its path: this shell
+# prefers busybox's own dpkg to PATH.
+if ! /usr/bin/dpkg -i "$packages"/*.deb >/tmp/dpkg-install.log 2>&1; then
+    echo "arm64-device: installing the packages failed:"
+    sed 's/^/arm64-device:   /' /tmp/dpkg-install.log
+fi
 
 mode=
 replay_set=

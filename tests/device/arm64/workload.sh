@@ -26,7 +26,7 @@
 # With arm64_writer=broken the operations are those of a writer that
 # rewrites the current copy in place, which a power cut can catch.
 . /etc/arm64-device.conf
-tool=$build_dir/lib/storage/tools/migrate_settings
+tool=$installed_tools/migrate_settings
 make_data=$build_dir/lib/storage/tools/make_example_data
 driver=$build_dir/tests/lib/storage/dual_file_driver
 broken_writer=$build_dir/tests/crash/broken_order_writer

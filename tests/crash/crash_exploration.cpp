@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cstdio>
 #include <stdexcept>
+#include <utility>
 
 #include <unistd.h>
 
@@ -131,9 +132,15 @@ fs::path scratchParent() {
                                                                                     : fs::temp_directory_path();
 }
 
+std::string stateKey(const FsImage& image, size_t slotCount) {
+    return std::to_string(slotCount) + "\n" + fingerprint(image);
+}
+
 }  // namespace
 
-Explorer::Explorer() : scratch_(scratchParent()) {}
+Explorer::Explorer(fs::path keepStatesIn) : scratch_(scratchParent()), keptStates_(std::move(keepStatesIn)) {
+    if (!keptStates_.empty()) fs::create_directories(keptStates_);
+}
 
 Explorer::~Explorer() = default;
 
@@ -172,10 +179,17 @@ std::vector<SlotContent> Explorer::open(const FsImage& image, size_t slotCount, 
     return slots;
 }
 
-const Explorer::Observation& Explorer::observe(const FsImage& image, size_t slotCount, Totals& totals) {
-    const std::string key = std::to_string(slotCount) + "\n" + fingerprint(image);
+void Explorer::keep(const FsImage& image, size_t slotCount, const std::string& name) {
+    if (keptStates_.empty() || !kept_.insert(stateKey(image, slotCount)).second) return;
+    materialise(image, keptStates_ / name);
+}
+
+const Explorer::Observation& Explorer::observe(const FsImage& image, size_t slotCount, const std::string& name,
+                                               Totals& totals) {
+    const std::string key = stateKey(image, slotCount);
     const auto known = observations_.find(key);
     if (known != observations_.end()) return known->second;
+    keep(image, slotCount, name);
 
     Observation observation;
     FsImage cleaned;
@@ -192,6 +206,7 @@ const Explorer::Observation& Explorer::observe(const FsImage& image, size_t slot
         for (size_t i = 0; i < removed.size(); ++i) {
             if (mask & (size_t{1} << i)) partial.dropName(removed[i]);
         }
+        keep(partial, slotCount, name + "-cleanup" + std::to_string(mask));
         if (open(partial, slotCount, nullptr) != observation.slots) {
             observation.cleanupProblem = "a second opening after a cut clean-up disagrees";
         }
@@ -230,9 +245,12 @@ Totals Explorer::explore(const Scenario& scenario) {
             break;
         }
         ++totals.crashPoints;
+        size_t stateAtPoint = 0;
         totals.states +=
             forEachCrashState(record.durable, record.ops, crashPoint, scenario.order, [&](const FsImage& image) {
-                const Observation& seen = observe(image, scenario.slotCount, totals);
+                const std::string name =
+                    scenario.name() + "-cut" + std::to_string(crashPoint) + "-" + std::to_string(stateAtPoint++);
+                const Observation& seen = observe(image, scenario.slotCount, name, totals);
                 std::string problem = seen.cleanupProblem;
                 for (size_t slot = 0; slot < scenario.slotCount && problem.empty(); ++slot) {
                     const SlotContent& shown = seen.slots[slot];

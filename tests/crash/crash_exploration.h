@@ -8,8 +8,10 @@
 #pragma once
 
 #include <cstddef>
+#include <filesystem>
 #include <map>
 #include <memory>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -53,7 +55,12 @@ struct ScenarioRecord;
 
 class Explorer {
 public:
-    Explorer();
+    // With `keepStatesIn`, every distinct state a store is opened on is
+    // also written there once, as a store's target directory named after
+    // the first cut that left it: "<scenario>-cut<crash point>-<state>",
+    // and "-cleanup<subset>" after it for a clean-up a second cut stopped.
+    // The scenario's name gives the slot count.
+    explicit Explorer(std::filesystem::path keepStatesIn = {});
     ~Explorer();
 
     // Records `scenario` (once for all metadata orders) and checks every
@@ -69,7 +76,8 @@ private:
         std::string cleanupProblem;  // empty when a second opening agreed
     };
 
-    const Observation& observe(const FsImage& image, size_t slotCount, Totals& totals);
+    const Observation& observe(const FsImage& image, size_t slotCount, const std::string& name, Totals& totals);
+    void keep(const FsImage& image, size_t slotCount, const std::string& name);
     std::vector<store_test::SlotContent> open(const FsImage& image, size_t slotCount, FsImage* afterOpening);
 
     // In memory when the machine has a memory file system: the exploration
@@ -78,6 +86,8 @@ private:
     testing_support::ScratchDir scratch_;
     std::map<std::string, Observation> observations_;
     std::map<std::string, std::unique_ptr<ScenarioRecord>> records_;
+    std::filesystem::path keptStates_;
+    std::set<std::string> kept_;  // keys, as observations_ has them
     std::vector<std::string> reports_;
 };
 

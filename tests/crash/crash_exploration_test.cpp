@@ -7,7 +7,13 @@
 // CRASH_SEQUENCES=16 or 32 in the environment explores that many of the 64
 // sequences in each case, chosen so that every kind of update still comes
 // at every position equally often.
+//
+// CRASH_STATES_DIR=<directory> writes every distinct state a store is opened
+// on into that directory, one target directory each (see Explorer), for a
+// second reader of the format to judge.
 #include <cstdio>
+#include <cstdlib>
+#include <filesystem>
 #include <string>
 #include <vector>
 
@@ -30,6 +36,11 @@ public:
 const ::testing::Environment* const kPrintGrandTotals = ::testing::AddGlobalTestEnvironment(new PrintGrandTotals);
 
 constexpr size_t kAllSequences = 64;
+
+std::filesystem::path keptStatesDir() {
+    const char* directory = std::getenv("CRASH_STATES_DIR");
+    return directory == nullptr ? "" : directory;
+}
 
 // Sequences of three updates: each copy is rewritten at least once more
 // after holding a blob, and shorter sequences are their prefixes. `count`
@@ -81,7 +92,7 @@ TEST_P(CrashExploration, EveryPowerCutLeavesTheAcknowledgedOrTheInFlightBlob) {
     ASSERT_TRUE(count == kAllSequences || count == kAllSequences / 2 || count == kAllSequences / 4)
         << "CRASH_SEQUENCES must be 16, 32 or 64";
     const std::vector<std::string> sequences = threeUpdateSequences(count);
-    Explorer explorer;
+    Explorer explorer(keptStatesDir());
     for (const MetadataOrder order : {MetadataOrder::kInOrder, MetadataOrder::kPerFile}) {
         Totals totals;
         for (const std::string& updates : sequences) {
@@ -111,7 +122,7 @@ INSTANTIATE_TEST_SUITE_P(AllCases, CrashExploration,
 class CrashExplorationOfABrokenWriter : public NativeRuns {};
 
 TEST_F(CrashExplorationOfABrokenWriter, CatchesACheckFileCommittedBeforeItsData) {
-    Explorer explorer;
+    Explorer explorer(keptStatesDir());
     const Totals totals = explorer.explore(Scenario{"WXX", 1, Clock::kForward, MetadataOrder::kInOrder});
     std::printf("broken writer: %s\n", describe(totals).c_str());
     ASSERT_GT(totals.violations, 0u);

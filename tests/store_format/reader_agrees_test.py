@@ -6,28 +6,18 @@ card or less trusted code might leave them.
 
     reader_agrees_test.py MIGRATE_SETTINGS INSPECT_STORE DUAL_FILE_DRIVER
 """
-import json
 import os
 import random
-import subprocess
 import sys
 import tempfile
-import zlib
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, HERE)
 import read_store  # noqa: E402
+from inspect_answers import answers, run  # noqa: E402
 
 TARGETS = [('settings', 'settings', 1), ('overlay', 'app/overlays', 8), ('lut', 'app/luts', 26)]
 ROUNDS = 12
-
-
-def run(*words, allowed=(0,)):
-    result = subprocess.run(words, stdout=subprocess.PIPE, stderr=subprocess.PIPE)
-    if result.returncode not in allowed:
-        raise AssertionError('%s exited %d: %s%s' % (' '.join(words), result.returncode, result.stdout.decode(),
-                                                    result.stderr.decode()))
-    return result
 
 
 def populate(tools, base, rng, work):
@@ -89,23 +79,6 @@ def damage(slot, rng):
     return kind
 
 
-def inspected(tools, base, name, index, work):
-    _, inspect, _ = tools
-    # 1: the report names a problem.
-    report = json.loads(run(inspect, '--base', base, '--target', name, '--index', str(index), '--json',
-                            allowed=(0, 1)).stdout)
-    slot = report['targets'][0]['slots'][0]
-    if slot['state'] == 'absent-blob':
-        return 'absent-blob %d' % slot['current']
-    if slot['state'] != 'present':
-        return 'none'
-    dump = os.path.join(work, 'dump')
-    run(inspect, '--base', base, '--target', name, '--index', str(index), '--dump=' + dump)
-    with open(dump, 'rb') as f:
-        blob = f.read()
-    return 'present %d %d 0x%08x' % (slot['current'], len(blob), zlib.crc32(blob))
-
-
 def main():
     tools = sys.argv[1:4]
     compared = disagreements = 0
@@ -120,7 +93,7 @@ def main():
                     slot = target if slots == 1 else os.path.join(target, str(index))
                     what = damage(slot, rng) if rng.random() < 0.5 else 'none'
                     ours = read_store.read_slot(target, slots, index)
-                    theirs = inspected(tools, base, name, index, work)
+                    theirs = answers(tools[1], base, name, work, index)[index]
                     compared += 1
                     if ours != theirs:
                         disagreements += 1

@@ -27,13 +27,11 @@ using e2e::concat;
 using e2e::ProcessResult;
 using testing_support::Plant;
 
-// Long enough for an emulated run; a wait never ends by itself.
-constexpr unsigned kTimeLimitSeconds = 30;
 // The unprivileged user an application runs as.
 constexpr uid_t kNobody = 65534;
 
 void expectFinished(const ProcessResult& result) {
-    EXPECT_NE(result.signal, SIGALRM) << "still running after " << kTimeLimitSeconds << " s";
+    EXPECT_NE(result.signal, SIGALRM) << "still running after " << e2e::kRunTimeLimitSeconds << " s";
     EXPECT_EQ(result.signal, 0) << result.out << result.err;
 }
 
@@ -65,7 +63,7 @@ protected:
     }
 
     ProcessResult run(const std::vector<std::string>& args) const {
-        return e2e::runTool(concat({"--base", base.string()}, args), kTimeLimitSeconds);
+        return e2e::runTool(concat({"--base", base.string()}, args), e2e::kRunTimeLimitSeconds);
     }
 
     // Everything outside the base directory and the data files.

@@ -427,19 +427,13 @@ TEST_F(FirmwareUpdateBootOnDevice, FiveFailedReadBacks) {
         std::printf("finalise %u\n", slot.finalise());
         return 0;
     });
-    std::string attempts;
-    for (int attempt = 0; attempt < 5; ++attempt) {
-        attempts +=
-            "Opening \"/media/boot/BOOT0010.BIN\" for write\n"
-            "libcommon/lib/util/fd:N Failed to open /media/boot/BOOT0010.BIN: Operation not permitted\n"
-            "lib/storage/storage_target:N Failed to open BOOT.BIN for writing\n";
-    }
-    EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT0010.BIN", 1000) +
-                                                    testing_support::needsUpdatingLines("BOOT0010.BIN") + attempts +
-                                                    "Remounting \"/media/boot\" as ro\n"
-                                                    "Closing #1\n"
-                                                    "finalise 52 valid 0\n"
-                                                    "finalise 2\n");
+    EXPECT_EQ(normalisedStorageLog(result.out),
+              receivedLines("BOOT0010.BIN", 1000) + testing_support::needsUpdatingLines("BOOT0010.BIN") +
+                  testing_support::failedOpenLines("BOOT0010.BIN", "Operation not permitted") +
+                  "Remounting \"/media/boot\" as ro\n"
+                  "Closing #1\n"
+                  "finalise 52 valid 0\n"
+                  "finalise 2\n");
     EXPECT_EQ(recorder.calls(), std::string(kRemountRw) + kRemountRo);
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
     EXPECT_EQ(fileBytes(bootFile("BOOT0010.BIN")), fileBytes(sd::originalBootFile("BOOT0010.BIN")));

@@ -82,6 +82,13 @@ protected:
         }
     }
 
+    // migrateUtilSaveTwice, and nothing outside the store changes.
+    void migrateUtilSaveTwiceLeavingOutsideAlone(uint8_t seed) {
+        const std::string before = outside();
+        migrateUtilSaveTwice(seed);
+        EXPECT_EQ(outside(), before);
+    }
+
     void plant(const std::string& relative, Plant what) {
         std::string reason;
         if (!testing_support::plantAt(base / relative, what, victims, reason)) GTEST_SKIP() << reason;
@@ -113,9 +120,7 @@ TEST_F(HostileStores, LinkAtTheOtherCopysDataIsNeverWrittenThrough) {
 // plant is met whichever copy is current.
 TEST_F(HostileStores, HardLinkAtADataFileIsNeverWrittenThrough) {
     plant("app/utilSave/2/data", Plant::kHardLinkToRootOnlyFile);
-    const std::string before = outside();
-    migrateUtilSaveTwice(30);
-    EXPECT_EQ(outside(), before);
+    migrateUtilSaveTwiceLeavingOutsideAlone(30);
     EXPECT_EQ(run({"--target", "util_save", "--query-present"}).exitStatus, 0);
 }
 
@@ -123,9 +128,7 @@ TEST_F(HostileStores, HardLinkAtADataFileIsNeverWrittenThrough) {
 // commit truncate the link's target and write the 8 check bytes into it.
 TEST_F(HostileStores, HardLinkAtTheTransientCheckFileIsNeverWrittenThrough) {
     plant("app/utilSave/1/data.chk.tmp", Plant::kHardLinkToRootOnlyFile);
-    const std::string before = outside();
-    migrateUtilSaveTwice(40);
-    EXPECT_EQ(outside(), before);
+    migrateUtilSaveTwiceLeavingOutsideAlone(40);
     EXPECT_FALSE(fs::exists(fs::symlink_status(base / "app/utilSave/1/data.chk.tmp")));
 }
 

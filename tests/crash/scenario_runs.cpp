@@ -6,6 +6,7 @@
 #include <stdexcept>
 
 #include "crash_states.h"
+#include "enum_names.h"
 #include "files.h"
 
 namespace crash {
@@ -22,15 +23,9 @@ constexpr size_t kPatchSize = 300;
 }  // namespace
 
 const char* clockName(Clock clock) {
-    switch (clock) {
-        case Clock::kForward:
-            return "forward";
-        case Clock::kEqual:
-            return "equal";
-        case Clock::kBackward:
-            return "backward";
-    }
-    return "?";
+    static constexpr testing_support::EnumName<Clock> kNames[] = {
+        {Clock::kForward, "forward"}, {Clock::kEqual, "equal"}, {Clock::kBackward, "backward"}};
+    return testing_support::nameIn(kNames, clock);
 }
 
 int64_t clockOf(Clock clock, size_t run) {

@@ -11,6 +11,7 @@
 #include <sstream>
 #include <stdexcept>
 
+#include "enum_names.h"
 #include "files.h"
 
 namespace simulated_device {
@@ -185,15 +186,10 @@ MountState mountState(const std::string& mountPoint) {
 }
 
 const char* toString(MountState state) {
-    switch (state) {
-        case MountState::kNotMounted:
-            return "not mounted";
-        case MountState::kReadOnly:
-            return "read-only";
-        case MountState::kReadWrite:
-            return "read-write";
-    }
-    return "?";
+    static constexpr testing_support::EnumName<MountState> kNames[] = {{MountState::kNotMounted, "not mounted"},
+                                                                       {MountState::kReadOnly, "read-only"},
+                                                                       {MountState::kReadWrite, "read-write"}};
+    return testing_support::nameIn(kNames, state);
 }
 
 Bytes makeBootVectorRecord(uint32_t value, uint8_t seed) {

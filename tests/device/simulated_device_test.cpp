@@ -394,6 +394,17 @@ protected:
         return pid;
     }
 
+    // Starts the runner with `args`, waits until it writes `ready`, then
+    // sends it `signal`; `status` is its wait status.
+    void startThenSignal(const std::vector<std::string>& args, const fs::path& ready, int signal, int& status) {
+        const pid_t pid = spawn(args);
+        ASSERT_GT(pid, 0);
+        const bool started = waitFor(ready, std::chrono::seconds(60));
+        ASSERT_EQ(::kill(pid, signal), 0);
+        ASSERT_EQ(::waitpid(pid, &status, 0), pid);
+        ASSERT_TRUE(started);
+    }
+
     // A command that names its run directory in `ready`, then waits for `go`.
     std::vector<std::string> waitingCommand(const fs::path& ready, const fs::path& go) {
         return {"--",
@@ -488,13 +499,8 @@ TEST_F(SimulatedDeviceLifecycle, NothingIsVisibleOutsideWhileItRuns) {
 
 TEST_F(SimulatedDeviceLifecycle, TerminatedRunnerTearsDown) {
     const fs::path ready = work_ / "ready";
-    const pid_t pid = spawn(waitingCommand(ready, work_ / "never"));
-    ASSERT_GT(pid, 0);
-    const bool started = waitFor(ready, std::chrono::seconds(60));
-    ASSERT_EQ(::kill(pid, SIGTERM), 0);
     int status = 0;
-    ASSERT_EQ(::waitpid(pid, &status, 0), pid);
-    ASSERT_TRUE(started);
+    ASSERT_NO_FATAL_FAILURE(startThenSignal(waitingCommand(ready, work_ / "never"), ready, SIGTERM, status));
     EXPECT_TRUE(WIFSIGNALED(status));
     EXPECT_EQ(WTERMSIG(status), SIGTERM);
     EXPECT_EQ(runDirsUnder(tmp_.path()), std::vector<std::string>{});
@@ -505,13 +511,9 @@ TEST_F(SimulatedDeviceLifecycle, KilledRunIsClearedByTheNextRun) {
         GTEST_SKIP() << "without setpriv the command outlives a killed runner";
     }
     const fs::path ready = work_ / "ready";
-    const pid_t pid = spawn(onLoopDevices(waitingCommand(ready, work_ / "never")));
-    ASSERT_GT(pid, 0);
-    const bool started = waitFor(ready, std::chrono::seconds(60));
-    ASSERT_EQ(::kill(pid, SIGKILL), 0);
     int status = 0;
-    ASSERT_EQ(::waitpid(pid, &status, 0), pid);
-    ASSERT_TRUE(started);
+    ASSERT_NO_FATAL_FAILURE(
+        startThenSignal(onLoopDevices(waitingCommand(ready, work_ / "never")), ready, SIGKILL, status));
     const fs::path abandoned = trimmed(testing_support::readText(ready));
     EXPECT_TRUE(fs::exists(abandoned));
     EXPECT_EQ(loopsBackedUnder(tmp_.path()).size(), 3u);

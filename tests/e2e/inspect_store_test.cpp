@@ -37,10 +37,6 @@ using testing_support::ProcessResult;
 using testing_support::readBytes;
 using testing_support::writeBytes;
 
-const std::string kInspect = INSPECT_STORE_BIN;
-// Long enough for an emulated run; a wait on a FIFO never ends by itself.
-constexpr unsigned kTimeLimitSeconds = 30;
-
 const store_test::Bytes kFirst = store_test::patternBytes(300, 1);
 const store_test::Bytes kLater = store_test::patternBytes(200, 2);
 
@@ -50,9 +46,9 @@ ProcessResult inspect(const fs::path& root, const std::vector<std::string>& args
                       const testing_support::Environment& env = {}) {
     const auto snapshotTree = [](const fs::path& tree) { return testing_support::snapshotTree(tree, {"out"}); };
     const std::string before = snapshotTree(root);
-    std::vector<std::string> argv = {kInspect};
+    std::vector<std::string> argv = {e2e::kInspectStore};
     argv.insert(argv.end(), args.begin(), args.end());
-    const ProcessResult result = testing_support::runProgram(argv, env, kTimeLimitSeconds);
+    const ProcessResult result = testing_support::runProgram(argv, env, e2e::kRunTimeLimitSeconds);
     EXPECT_EQ(result.signal, 0) << "ended by signal " << result.signal << e2e::describe(args);
     EXPECT_EQ(snapshotTree(root), before) << "inspect_store changed the tree:" << e2e::describe(args);
     return result;
@@ -627,11 +623,11 @@ TEST_F(InspectStore, ABadCommandLineIs2WithUsageOnStandardError) {
         EXPECT_EQ(result.exitStatus, 2) << e2e::describe(row.args);
         EXPECT_EQ(result.out, "");
         EXPECT_NE(result.err.find(row.message), std::string::npos) << result.err;
-        EXPECT_NE(result.err.find("Usage: " + kInspect + " "), std::string::npos) << result.err;
+        EXPECT_NE(result.err.find("Usage: " + e2e::kInspectStore + " "), std::string::npos) << result.err;
     }
     const ProcessResult help = run({"--help"});
     EXPECT_EQ(help.exitStatus, 0);
-    EXPECT_EQ(help.out.rfind("Usage: " + kInspect + " ", 0), 0u) << help.out;
+    EXPECT_EQ(help.out.rfind("Usage: " + e2e::kInspectStore + " ", 0), 0u) << help.out;
     EXPECT_EQ(help.err, "");
 }
 

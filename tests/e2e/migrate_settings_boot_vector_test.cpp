@@ -11,7 +11,7 @@
 #include <gtest/gtest-spi.h>
 #include <gtest/gtest.h>
 
-#include "scratch_dir.h"
+#include "scratch_store.h"
 #include "source_lines.h"
 #include "tool_run.h"
 
@@ -20,6 +20,7 @@ namespace {
 namespace fs = std::filesystem;
 using e2e::Bytes;
 using e2e::checkFileFor;
+using e2e::Files;
 using e2e::Host;
 using e2e::kLastFileReadRegisterLine;
 using e2e::kSfdiskComplaints;
@@ -30,9 +31,6 @@ using e2e::settingsBlock;
 using e2e::storedFiles;
 using e2e::withoutBootVectorFailure;
 using testing_support::readBytes;
-using testing_support::ScratchDir;
-
-using Files = std::vector<std::string>;
 
 // The line number is where the statement stands in the source.
 const std::string kFailureLine =
@@ -182,16 +180,8 @@ TEST_F(BootVectorFailureFilter, OnDeviceTheLineFails) {
 // ---------------------------------------------------------------------------
 // Whole runs, exactly as they come out
 
-class BootVectorRun : public ::testing::Test {
+class BootVectorRun : public e2e::ScratchStore {
 protected:
-    ScratchDir scratch;
-    const fs::path base = scratch / "base";
-
-    std::string dataFile(const std::string& name, const Bytes& bytes) const {
-        testing_support::writeBytes(scratch / name, bytes);
-        return (scratch / name).string();
-    }
-
     ProcessResult run(const std::vector<std::string>& args) const {
         return runTool(e2e::concat({"--base", base.string()}, args));
     }

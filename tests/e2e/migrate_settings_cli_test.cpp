@@ -8,7 +8,7 @@
 
 #include <gtest/gtest.h>
 
-#include "scratch_dir.h"
+#include "scratch_store.h"
 #include "tool_run.h"
 
 namespace {
@@ -17,15 +17,13 @@ namespace fs = std::filesystem;
 using e2e::Bytes;
 using e2e::concat;
 using e2e::describe;
+using e2e::Files;
 using e2e::ProcessResult;
 using e2e::registerLines;
 using e2e::runAccepted;
 using e2e::runTool;
 using e2e::storedFiles;
 using testing_support::readBytes;
-using testing_support::ScratchDir;
-
-using Files = std::vector<std::string>;
 
 const std::string kOptionList =
     "  -b, --base=arg          Base path for storage.\n"
@@ -67,19 +65,12 @@ Bytes head(const Bytes& bytes, size_t length) { return Bytes(bytes.begin(), byte
 // run() is for lines that get past parsing and so build the registry;
 // runUnparsed() for lines that end in parsing, whose output is compared
 // as it came.
-class CliRun : public ::testing::Test {
+class CliRun : public e2e::ScratchStore {
 protected:
-    ScratchDir scratch;
-    const fs::path base = scratch / "base";
     const Bytes aBytes = settingsAndLut();
     const Bytes bBytes = e2e::overlayFile(16, 300);
-    const std::string a = write("a", aBytes);
-    const std::string b = write("b", bBytes);
-
-    std::string write(const std::string& name, const Bytes& bytes) const {
-        testing_support::writeBytes(scratch / name, bytes);
-        return (scratch / name).string();
-    }
+    const std::string a = dataFile("a", aBytes);
+    const std::string b = dataFile("b", bBytes);
 
     ProcessResult run(const std::vector<std::string>& args) const {
         return runAccepted(concat({"--base", base.string()}, args));

@@ -24,9 +24,6 @@ using e2e::concat;
 using e2e::ProcessResult;
 using testing_support::LockHolder;
 
-const std::string kInspect = INSPECT_STORE_BIN;
-// Long enough for an emulated run; a wait on a lock ends by itself sooner.
-constexpr unsigned kTimeLimitSeconds = 30;
 // The tool's wait for a slot's lock, and what a run may take beyond it:
 // on the emulated device a run alone can take seconds beside the others.
 #ifndef OVERLAP_WAIT_MARGIN_SECONDS
@@ -59,7 +56,7 @@ protected:
     }
 
     ProcessResult run(const std::vector<std::string>& args) const {
-        return e2e::runTool(concat({"--base", base.string()}, args), kTimeLimitSeconds);
+        return e2e::runTool(concat({"--base", base.string()}, args), e2e::kRunTimeLimitSeconds);
     }
 
     ProcessResult migrate(const char* target, const std::string& data) const {
@@ -71,8 +68,9 @@ protected:
     // What inspect_store says the slot serves, in hexadecimal; empty when it
     // serves nothing.
     std::string served(const char* target) const {
-        const ProcessResult result = testing_support::runProgram(
-            {kInspect, "--base", base.string(), "--target", target, "--dump=-"}, {}, kTimeLimitSeconds);
+        const ProcessResult result =
+            testing_support::runProgram({e2e::kInspectStore, "--base", base.string(), "--target", target, "--dump=-"},
+                                        {}, e2e::kRunTimeLimitSeconds);
         return result.exitStatus == 0 ? testing_support::hex(Bytes(result.out.begin(), result.out.end())) : "";
     }
 };

@@ -10,7 +10,7 @@
 #include <gtest/gtest.h>
 
 #include "fault_injection.h"
-#include "scratch_dir.h"
+#include "scratch_store.h"
 #include "tool_run.h"
 
 namespace {
@@ -19,6 +19,7 @@ namespace fs = std::filesystem;
 using e2e::Bytes;
 using e2e::checkFileFor;
 using e2e::concat;
+using e2e::Files;
 using e2e::lutFile;
 using e2e::overlayFile;
 using e2e::ProcessResult;
@@ -26,24 +27,13 @@ using e2e::registerLines;
 using e2e::settingsBlock;
 using e2e::storedFiles;
 using testing_support::readBytes;
-using testing_support::ScratchDir;
 using testing_support::writeBytes;
 using testing_support::writeText;
 
-using Files = std::vector<std::string>;
-
 const std::string kOpenFailurePrefix = "lib/storage/tools/migrate_settings:494 Failed to open '";
 
-// One scratch directory per test: data files at its top, the store in "base".
-class ToolRun : public ::testing::Test {
+class ToolRun : public e2e::ScratchStore {
 protected:
-    ScratchDir scratch;
-    const fs::path base = scratch / "base";
-
-    std::string dataFile(const std::string& name, const Bytes& bytes) {
-        writeBytes(scratch / name, bytes);
-        return (scratch / name).string();
-    }
     std::string inScratch(const std::string& name) const { return (scratch / name).string(); }
 
     // Every run names the scratch store; nothing here may reach the device's.

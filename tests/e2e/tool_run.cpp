@@ -13,6 +13,7 @@ namespace e2e {
 namespace fs = std::filesystem;
 
 const std::string kBinary = MIGRATE_SETTINGS_BIN;
+const std::string kInspectStore = INSPECT_STORE_BIN;
 
 const std::string kLastFileReadRegisterLine =
     "Register kIpiStorageTargetResourceManufacturingPartition = FileReadTarget /media/static [0]\n";
@@ -122,7 +123,7 @@ std::vector<std::string> concat(std::vector<std::string> head, const std::vector
 
 std::string registerLines(const fs::path& base) { return testing_support::registerLines(base); }
 
-std::vector<std::string> storedFiles(const fs::path& base) {
+Files storedFiles(const fs::path& base) {
     std::vector<std::string> files;
     std::error_code error;
     if (!fs::is_directory(base, error)) return files;

@@ -18,6 +18,12 @@ using testing_support::Bytes;
 using testing_support::ProcessResult;
 
 extern const std::string kBinary;
+// The built inspect_store.
+extern const std::string kInspectStore;
+
+// A time limit for runs: long enough for an emulated run, and an end to one
+// that waits on a FIFO or a held lock longer than it should.
+constexpr unsigned kRunTimeLimitSeconds = 30;
 
 // Runs the tool with `args` after its own path; the result as it came. With
 // a time limit, a run still going after that many seconds is ended by
@@ -65,9 +71,12 @@ std::string registerLines(const std::filesystem::path& base);
 // boot-vector target is built.
 extern const std::string kLastFileReadRegisterLine;
 
+// Relative paths below a store's base directory.
+using Files = std::vector<std::string>;
+
 // Every entry below `base` that is not a directory, as sorted relative
 // paths; empty when `base` does not exist.
-std::vector<std::string> storedFiles(const std::filesystem::path& base);
+Files storedFiles(const std::filesystem::path& base);
 
 // IEEE 802.3 CRC-32, bit by bit.
 uint32_t crc32(const Bytes& bytes);

@@ -6,6 +6,7 @@
 #include <stdexcept>
 #include <thread>
 
+#include "enum_names.h"
 #include "lib/storage/dual_file_target.h"
 #include "overlap_slots.h"
 
@@ -47,15 +48,9 @@ void driveThread(const DriverPlan& plan, size_t thread, std::vector<Operation>& 
 }
 
 const char* kindWord(OperationKind kind) {
-    switch (kind) {
-        case OperationKind::kWrite:
-            return "write";
-        case OperationKind::kRead:
-            return "read";
-        case OperationKind::kQuery:
-            return "query";
-    }
-    return "?";
+    static constexpr testing_support::EnumName<OperationKind> kWords[] = {
+        {OperationKind::kWrite, "write"}, {OperationKind::kRead, "read"}, {OperationKind::kQuery, "query"}};
+    return testing_support::nameIn(kWords, kind);
 }
 
 }  // namespace

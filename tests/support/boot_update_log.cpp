@@ -24,4 +24,13 @@ std::string needsUpdatingLines(const std::string& file) {
     return quoted(file) + " needs updating\nRemounting \"/media/boot\" as rw\n";
 }
 
+std::string failedOpenLines(const std::string& file, const std::string& error) {
+    const std::string opening = "Opening " + quoted(file) + " for write\n";
+    const std::string failed = "libcommon/lib/util/fd:N Failed to open /media/boot/" + file + ": " + error + "\n";
+    const std::string refused = "lib/storage/storage_target:N Failed to open BOOT.BIN for writing\n";
+    std::string lines;
+    for (int attempt = 0; attempt < 5; ++attempt) lines += opening + failed + refused;
+    return lines;
+}
+
 }  // namespace testing_support

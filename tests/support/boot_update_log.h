@@ -22,4 +22,9 @@ std::string finalisingLines(const std::string& file, size_t bytes);
 // The file differs: the read-write remount.
 std::string needsUpdatingLines(const std::string& file);
 
+// The five attempts to write `file`, each failing to open it with the
+// message `error` ("No such file or directory"). The last line names
+// BOOT.BIN for either file.
+std::string failedOpenLines(const std::string& file, const std::string& error);
+
 }  // namespace testing_support

@@ -11,6 +11,7 @@
 #include <cstring>
 #include <stdexcept>
 
+#include "enum_names.h"
 #include "files.h"
 
 namespace testing_support {
@@ -67,18 +68,25 @@ std::string entryLine(const fs::path& path, const std::string& relative) {
 
 }  // namespace
 
+// Every plant with its name, in the order the sweeps meet them.
+constexpr EnumName<Plant> kPlantNames[] = {{Plant::kLinkToFile, "link_to_file"},
+                                           {Plant::kLinkToDirectory, "link_to_directory"},
+                                           {Plant::kDanglingLink, "dangling_link"},
+                                           {Plant::kLinkLoop, "link_loop"},
+                                           {Plant::kFifo, "fifo"},
+                                           {Plant::kSocket, "socket"},
+                                           {Plant::kDirectory, "directory"},
+                                           {Plant::kDeviceNode, "device_node"},
+                                           {Plant::kHardLinkToFile, "hard_link_to_file"},
+                                           {Plant::kHardLinkToRootOnlyFile, "hard_link_to_root_only_file"},
+                                           {Plant::kHardLinkToStoreFile, "hard_link_to_store_file"}};
+
 const std::vector<Plant>& allPlants() {
-    static const std::vector<Plant> plants = {Plant::kLinkToFile,
-                                              Plant::kLinkToDirectory,
-                                              Plant::kDanglingLink,
-                                              Plant::kLinkLoop,
-                                              Plant::kFifo,
-                                              Plant::kSocket,
-                                              Plant::kDirectory,
-                                              Plant::kDeviceNode,
-                                              Plant::kHardLinkToFile,
-                                              Plant::kHardLinkToRootOnlyFile,
-                                              Plant::kHardLinkToStoreFile};
+    static const std::vector<Plant> plants = [] {
+        std::vector<Plant> all;
+        for (const EnumName<Plant>& entry : kPlantNames) all.push_back(entry.first);
+        return all;
+    }();
     return plants;
 }
 
@@ -87,33 +95,7 @@ bool isHardLink(Plant plant) {
            plant == Plant::kHardLinkToStoreFile;
 }
 
-std::string plantName(Plant plant) {
-    switch (plant) {
-        case Plant::kLinkToFile:
-            return "link_to_file";
-        case Plant::kLinkToDirectory:
-            return "link_to_directory";
-        case Plant::kDanglingLink:
-            return "dangling_link";
-        case Plant::kLinkLoop:
-            return "link_loop";
-        case Plant::kFifo:
-            return "fifo";
-        case Plant::kSocket:
-            return "socket";
-        case Plant::kDirectory:
-            return "directory";
-        case Plant::kDeviceNode:
-            return "device_node";
-        case Plant::kHardLinkToFile:
-            return "hard_link_to_file";
-        case Plant::kHardLinkToRootOnlyFile:
-            return "hard_link_to_root_only_file";
-        case Plant::kHardLinkToStoreFile:
-            return "hard_link_to_store_file";
-    }
-    return "unknown";
-}
+std::string plantName(Plant plant) { return nameIn(kPlantNames, plant); }
 
 Victims::Victims(const fs::path& directory)
     : file_(directory / "victim-file"),

@@ -61,18 +61,16 @@ const std::string kUpToDateLines =
     "Did not update file as it was already up to date\n"
     "finalise 0 valid 0\n";
 
+// A copy of `bytes` into the boot file that was read back intact, and the
+// end of the update.
+std::string copiedLines(const std::string& name, size_t bytes) {
+    return "Opening " + quoted(name) + " for write\nWrote " + std::to_string(bytes) +
+           " bytes\nReadback successful for " + quoted(name) +
+           "\nRemounting \"/media/boot\" as ro\nClosing #1\nfinalise 0 valid 0\n";
+}
+
 std::string rewrittenLines(const std::string& name, size_t bytes) {
-    return testing_support::needsUpdatingLines(name) + "Opening " + quoted(name) +
-           " for write\n"
-           "Wrote " +
-           std::to_string(bytes) +
-           " bytes\n"
-           "Readback successful for " +
-           quoted(name) +
-           "\n"
-           "Remounting \"/media/boot\" as ro\n"
-           "Closing #1\n"
-           "finalise 0 valid 0\n";
+    return testing_support::needsUpdatingLines(name) + copiedLines(name, bytes);
 }
 
 // Begin, stream `data` in blocks of `block` bytes at increasing offsets,
@@ -427,19 +425,13 @@ TEST_F(FirmwareUpdateBootOnDevice, FiveFailedReadBacks) {
         std::printf("finalise %u\n", slot.finalise());
         return 0;
     });
-    std::string attempts;
-    for (int attempt = 0; attempt < 5; ++attempt) {
-        attempts +=
-            "Opening \"/media/boot/BOOT0010.BIN\" for write\n"
-            "libcommon/lib/util/fd:N Failed to open /media/boot/BOOT0010.BIN: Operation not permitted\n"
-            "lib/storage/storage_target:N Failed to open BOOT.BIN for writing\n";
-    }
-    EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT0010.BIN", 1000) +
-                                                    testing_support::needsUpdatingLines("BOOT0010.BIN") + attempts +
-                                                    "Remounting \"/media/boot\" as ro\n"
-                                                    "Closing #1\n"
-                                                    "finalise 52 valid 0\n"
-                                                    "finalise 2\n");
+    EXPECT_EQ(normalisedStorageLog(result.out),
+              receivedLines("BOOT0010.BIN", 1000) + testing_support::needsUpdatingLines("BOOT0010.BIN") +
+                  testing_support::failedOpenLines("BOOT0010.BIN", "Operation not permitted") +
+                  "Remounting \"/media/boot\" as ro\n"
+                  "Closing #1\n"
+                  "finalise 52 valid 0\n"
+                  "finalise 2\n");
     EXPECT_EQ(recorder.calls(), std::string(kRemountRw) + kRemountRo);
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
     EXPECT_EQ(fileBytes(bootFile("BOOT0010.BIN")), fileBytes(sd::originalBootFile("BOOT0010.BIN")));
@@ -467,13 +459,8 @@ TEST_F(FirmwareUpdateBootFaults, ShortCopyIsRetried) {
     EXPECT_EQ(normalisedStorageLog(result.out), receivedLines("BOOT.BIN", 9000) +
                                                     testing_support::needsUpdatingLines("BOOT.BIN") +
                                                     "Opening \"/media/boot/BOOT.BIN\" for write\n"
-                                                    "Wrote 100 bytes\n"
-                                                    "Opening \"/media/boot/BOOT.BIN\" for write\n"
-                                                    "Wrote 9000 bytes\n"
-                                                    "Readback successful for \"/media/boot/BOOT.BIN\"\n"
-                                                    "Remounting \"/media/boot\" as ro\n"
-                                                    "Closing #1\n"
-                                                    "finalise 0 valid 0\n");
+                                                    "Wrote 100 bytes\n" +
+                                                    copiedLines("BOOT.BIN", 9000));
     EXPECT_EQ(recorder.calls(), std::string(kRemountRw) + kRemountRo);
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")), data);
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
@@ -489,13 +476,8 @@ TEST_F(FirmwareUpdateBootFaults, FailedCopyIsReportedAndRetried) {
               receivedLines("BOOT.BIN", 9000) + testing_support::needsUpdatingLines("BOOT.BIN") +
                   "Opening \"/media/boot/BOOT.BIN\" for write\n"
                   "lib/storage/storage_target:N cat: write failed: 5: Input/output error\n"
-                  "Wrote 4096 bytes\n"
-                  "Opening \"/media/boot/BOOT.BIN\" for write\n"
-                  "Wrote 9000 bytes\n"
-                  "Readback successful for \"/media/boot/BOOT.BIN\"\n"
-                  "Remounting \"/media/boot\" as ro\n"
-                  "Closing #1\n"
-                  "finalise 0 valid 0\n");
+                  "Wrote 4096 bytes\n" +
+                  copiedLines("BOOT.BIN", 9000));
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")), data);
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
 }

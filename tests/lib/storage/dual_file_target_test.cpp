@@ -105,6 +105,10 @@ protected:
         writeBytes(data(0), zero);
         writeBytes(data(1), one);
     }
+    // The slot of a fresh one-slot target, the target living as long as the
+    // test.
+    TargetSlot& freshSlot() { return slotAfterWrites({}); }
+
     // The slot of a fresh one-slot target after each blob was written to it in
     // turn; the target lives as long as the test.
     TargetSlot& slotAfterWrites(std::initializer_list<Bytes> blobs) {
@@ -322,8 +326,7 @@ TEST_F(DualFileStore, OpeningKeepsValidFilesAsTheyAre) {
 
 TEST_F(DualFileStore, CommittedAbsentBlob) {
     store_test::writeAbsentCopy(copyDir(0), kPast);
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     EXPECT_TRUE(slot.isValid());
     EXPECT_FALSE(slot.exists());
     expectReadsFail(slot, STATUS_NOT_FOUND);
@@ -349,8 +352,7 @@ TEST_F(DualFileStore, AllOnesBesideADataFileIsInvalid) {
 
 TEST_F(DualFileStore, NeitherCopyValidReadsFailOnCopy0) {
     writeUncheckedCopies(bytesOf("unchecked zero"), bytesOf("unchecked one"));
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     EXPECT_FALSE(slot.isValid());
     EXPECT_FALSE(slot.exists());
     expectReadsFail(slot, STATUS_FAILED);
@@ -362,8 +364,7 @@ TEST_F(DualFileStore, ReadsNeverFallBackToTheOtherCopy) {
     // Copy 1 is current; its data file goes missing after opening.
     store_test::writeCopy(copyDir(0), bytesOf("older"), kPast);
     store_test::writeCopy(copyDir(1), bytesOf("newer"), kPast + kSecond);
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     fs::remove(data(1));
     EXPECT_FALSE(slot.exists());
     EXPECT_TRUE(slot.isValid());
@@ -373,8 +374,7 @@ TEST_F(DualFileStore, ReadsNeverFallBackToTheOtherCopy) {
 
 TEST_F(DualFileStore, ReadWhenTheCopyDirectoryBecameAFile) {
     store_test::writeCopy(copyDir(0), bytesOf("only"), kPast);
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     fs::remove_all(copyDir(0));
     writeBytes(copyDir(0), bytesOf("a file"));
     uint8_t buffer[8] = {};
@@ -386,8 +386,7 @@ TEST_F(DualFileStore, ReadWhenTheCopyDirectoryBecameAFile) {
 // Each operation reaches the base afresh: once it is gone, so is the blob.
 TEST_F(DualFileStore, ReadAfterTheBaseDirectoryWentAway) {
     store_test::writeCopy(copyDir(0), bytesOf("only"), kPast);
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     fs::rename(base(), dir / "elsewhere");
     uint8_t buffer[8] = {};
     size_t count = 42;
@@ -400,8 +399,7 @@ TEST_F(DualFileStore, ReadAfterTheBaseDirectoryWentAway) {
 // Something that exists but cannot be opened for reading: the open's errno.
 TEST_F(DualFileStore, ReadOfADataPathThatExistsButCannotBeOpened) {
     store_test::writeCopy(copyDir(0), bytesOf("only"), kPast);
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     fs::remove(data(0));
     const int listener = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
     ASSERT_GE(listener, 0);
@@ -421,8 +419,7 @@ TEST_F(DualFileStore, ReadOfADataPathThatExistsButCannotBeOpened) {
 // The data file turned into a directory: it opens, the read fails.
 TEST_F(DualFileStore, ReadOfADataPathThatBecameADirectory) {
     store_test::writeCopy(copyDir(0), bytesOf("only"), kPast);
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     fs::remove(data(0));
     fs::create_directory(data(0));
     uint8_t buffer[8] = {};
@@ -432,8 +429,7 @@ TEST_F(DualFileStore, ReadOfADataPathThatBecameADirectory) {
 TEST_F(DualFileStore, PartialReadAtTheEnd) {
     const Bytes blob = patternBytes(120, 7);
     store_test::writeCopy(copyDir(0), blob, kPast);
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
 
     Bytes buffer(100, 0xAA);
     EXPECT_EQ(slot.read(buffer.data(), 100, 90), STATUS_OK);
@@ -452,8 +448,7 @@ TEST_F(DualFileStore, PartialReadAtTheEnd) {
 TEST_F(DualFileStore, ReadsAtAndPastTheEndGiveNothing) {
     const Bytes blob = patternBytes(120, 8);
     store_test::writeCopy(copyDir(0), blob, kPast);
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     uint8_t buffer[16] = {};
     for (const int64_t offset : {int64_t{120}, int64_t{121}, int64_t{1} << 40}) {
         size_t count = 99;
@@ -754,8 +749,7 @@ TEST_F(DualFileStore, WritesAlternateBetweenTheCopies) {
     const Bytes first = bytesOf("first blob");
     const Bytes second = patternBytes(5000, 12);
     const Bytes third = bytesOf("third");
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
 
     EXPECT_EQ(write(slot, first), STATUS_OK);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n" + copyLines("2", first));
@@ -783,8 +777,7 @@ TEST_F(DualFileStore, WriteAfterReopeningGoesToTheOtherCopy) {
 }
 
 TEST_F(DualFileStore, EmptyWriteCommitsAnEmptyFile) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     EXPECT_EQ(slot.write(nullptr, 0), STATUS_OK);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 2/data \nf 2/data.chk 0000000000000000\n");
     EXPECT_EQ(contentOf(slot), holding({}));
@@ -877,8 +870,7 @@ TEST_P(FutureDatedPrevious, ReopeningPicksTheNewCommit) {
     storeInTurn({bytesOf("first")});
     const int64_t future = store_test::nowNs() + 3600 * kSecond;
     setMtimeNs(check(1), future);
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     EXPECT_EQ(commit(slot), STATUS_OK);
     const SlotContent committed = contentOf(slot);
     EXPECT_NE(committed, holding(bytesOf("first")));
@@ -942,8 +934,7 @@ TEST_F(DualFileStore, SecondCommitInTheSameTickIsTwoSecondsLater) {
 // ---- erase ----
 
 TEST_F(DualFileStore, EraseOfAFreshStoreCommitsAnAbsentBlob) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     EXPECT_EQ(slot.erase(), STATUS_OK);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 2/data.chk ffffffffffffffff\n");
     EXPECT_EQ(contentOf(slot), absentBlob());
@@ -966,16 +957,14 @@ TEST_F(DualFileStore, EraseRemovesTheOtherCopysData) {
 }
 
 TEST_F(DualFileStore, EraseRecreatesAMissingCopyDirectory) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     fs::remove(copyDir(1));
     EXPECT_EQ(slot.erase(), STATUS_OK);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\nf 2/data.chk ffffffffffffffff\n");
 }
 
 TEST_F(DualFileStore, WriteRecreatesAMissingCopyDirectory) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     fs::remove_all(base());
     EXPECT_EQ(write(slot, bytesOf("back")), STATUS_OK);
     EXPECT_EQ(describeTree(base()), "d 2\n" + copyLines("2", bytesOf("back")));
@@ -993,8 +982,7 @@ TEST_F(DualFileStore, FinaliseWithoutBeginChangesNothing) {
 }
 
 TEST_F(DualFileStore, FinaliseOfAFreshStoreChangesNothing) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     EXPECT_EQ(slot.finalise(), STATUS_INVALID_OPERATION);
     EXPECT_EQ(describeTree(base()), "d 1\nd 2\n");
     EXPECT_EQ(contentOf(slot), nothingStored());
@@ -1075,8 +1063,7 @@ TEST_F(DualFileStore, ABegunWriteLeftUnfinishedIsNotCommitted) {
 }
 
 TEST_F(DualFileStore, OneShotWriteInsideABegunWriteLeavesItBegun) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     EXPECT_EQ(slot.beginWrite(), STATUS_OK);
     EXPECT_EQ(write(slot, bytesOf("one-shot")), STATUS_OK);
     EXPECT_EQ(contentOf(slot), holding(bytesOf("one-shot")));
@@ -1112,8 +1099,7 @@ TEST_F(DualFileStore, WriteAtPastTheEndExtends) {
 }
 
 TEST_F(DualFileStore, WriteAtOnAFreshStoreStartsFromNothing) {
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     EXPECT_EQ(writeAt(slot, 5, bytesOf("xy")), STATUS_OK);
     const Bytes expected = {0, 0, 0, 0, 0, 'x', 'y'};
     EXPECT_EQ(contentOf(slot), holding(expected));
@@ -1122,8 +1108,7 @@ TEST_F(DualFileStore, WriteAtOnAFreshStoreStartsFromNothing) {
 
 TEST_F(DualFileStore, WriteAtOverAnInvalidCurrentCopyWritesIntoTheLeftover) {
     writeUncheckedCopies(bytesOf("unchecked current"), bytesOf("ZZZZZZZZZZ"));
-    auto target = open();
-    TargetSlot& slot = slotOf(*target);
+    TargetSlot& slot = freshSlot();
     EXPECT_EQ(writeAt(slot, 2, bytesOf("ab")), STATUS_OK);
     EXPECT_EQ(contentOf(slot), holding(bytesOf("ZZabZZZZZZ")));
     EXPECT_EQ(readBytes(data(0)), bytesOf("unchecked current"));

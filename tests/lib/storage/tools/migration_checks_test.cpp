@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <functional>
 #include <string>
 
 #include "child_process.h"
@@ -60,14 +61,16 @@ struct CheckRow {
 
 void PrintTo(const CheckRow& row, std::ostream* os) { *os << row.name; }
 
-class SettingsCheck : public ::testing::TestWithParam<CheckRow> {};
-
-TEST_P(SettingsCheck, StatusAndLength) {
-    const CheckRow& row = GetParam();
-    size_t length = 12345;
-    EXPECT_EQ(checkSettingsBlock(row.block, length), row.expected);
+// The row's status and length from `check`, called with `length` as it
+// comes in.
+void expectRow(const CheckRow& row, size_t length, const std::function<Status(const Block&, size_t&)>& check) {
+    EXPECT_EQ(check(row.block, length), row.expected);
     EXPECT_EQ(length, row.expectedLength);
 }
+
+class SettingsCheck : public ::testing::TestWithParam<CheckRow> {};
+
+TEST_P(SettingsCheck, StatusAndLength) { expectRow(GetParam(), 12345, checkSettingsBlock); }
 
 Block withLength(Block block, uint16_t declared) {
     block[0] = static_cast<uint8_t>(declared);
@@ -107,10 +110,7 @@ TEST(SettingsCheck, TwoLengthBytesOnlyAreTheLength) {
 class LutCheck : public ::testing::TestWithParam<CheckRow> {};
 
 TEST_P(LutCheck, StatusAndLength) {
-    const CheckRow& row = GetParam();
-    size_t length = 1;
-    EXPECT_EQ(checkLutHeader(row.block, length, 0), row.expected);
-    EXPECT_EQ(length, row.expectedLength);
+    expectRow(GetParam(), 1, [](const Block& block, size_t& length) { return checkLutHeader(block, length, 0); });
 }
 
 INSTANTIATE_TEST_SUITE_P(Boundaries, LutCheck,
@@ -158,10 +158,7 @@ TEST(LutCheck, VersionLineIsAWarning) {
 class OverlayCheck : public ::testing::TestWithParam<CheckRow> {};
 
 TEST_P(OverlayCheck, StatusAndLength) {
-    const CheckRow& row = GetParam();
-    size_t length = 1;
-    EXPECT_EQ(checkOverlayHeader(row.block, length, 3), row.expected);
-    EXPECT_EQ(length, row.expectedLength);
+    expectRow(GetParam(), 1, [](const Block& block, size_t& length) { return checkOverlayHeader(block, length, 3); });
 }
 
 Block overlayWith(size_t offset, uint8_t value, Block block = overlayBlock(284, 0)) {

@@ -101,11 +101,19 @@ TEST(UniqueFd, MovedFromDoesNotCloseOnDestruction) {
     EXPECT_EQ(target.get(), raw);
 }
 
-TEST(UniqueFd, MoveAssignmentClosesThePreviousDescriptor) {
+// Two descriptors of /dev/null, open when a test starts.
+class UniqueFdOfTwo : public ::testing::Test {
+protected:
+    void SetUp() override {
+        ASSERT_GE(first, 0);
+        ASSERT_GE(second, 0);
+    }
+
     const int first = openDevNull();
     const int second = openDevNull();
-    ASSERT_GE(first, 0);
-    ASSERT_GE(second, 0);
+};
+
+TEST_F(UniqueFdOfTwo, MoveAssignmentClosesThePreviousDescriptor) {
     UniqueFd target(first);
     UniqueFd source(second);
     target = std::move(source);
@@ -138,11 +146,7 @@ TEST(UniqueFd, ReleaseGivesUpOwnershipWithoutClosing) {
     EXPECT_EQ(::close(raw), 0);
 }
 
-TEST(UniqueFd, ResetClosesAndTakesTheNewDescriptor) {
-    const int first = openDevNull();
-    const int second = openDevNull();
-    ASSERT_GE(first, 0);
-    ASSERT_GE(second, 0);
+TEST_F(UniqueFdOfTwo, ResetClosesAndTakesTheNewDescriptor) {
     UniqueFd fd(first);
     fd.reset(second);
     EXPECT_TRUE(isClosed(first));

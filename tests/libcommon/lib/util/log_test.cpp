@@ -21,9 +21,11 @@
 
 #include "child_process.h"
 #include "lib/util/status.h"
+#include "log_in_child.h"
 
 namespace {
 
+using testing_support::logInChild;
 using testing_support::ProcessResult;
 using testing_support::runInChild;
 
@@ -64,16 +66,6 @@ ProcessResult recordInChild(int mode, int threshold, const std::function<void()>
         setLogLevel(threshold);
         const std::string records = recordWrites(mode == LOG_OUTPUT_STDERR ? 2 : 1, body);
         std::fwrite(records.data(), 1, records.size(), stdout);
-        return 0;
-    });
-}
-
-// Child with the given output mode and threshold; plain captured output.
-ProcessResult logInChild(int mode, int threshold, const std::function<void()>& body) {
-    return runInChild([&] {
-        setLogOutput(mode);
-        setLogLevel(threshold);
-        body();
         return 0;
     });
 }

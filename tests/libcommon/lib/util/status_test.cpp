@@ -12,6 +12,7 @@
 #include <gtest/gtest.h>
 
 #include "child_process.h"
+#include "log_in_child.h"
 
 namespace {
 
@@ -90,12 +91,7 @@ TEST(StatusFromError, RealFileSystemQuery) {
 
 // Runs `body` in a child that logs to standard output with threshold `threshold`.
 ProcessResult reportInChild(int threshold, const std::function<void()>& body) {
-    return runInChild([&] {
-        setLogOutput(LOG_OUTPUT_STDOUT);
-        setLogLevel(threshold);
-        body();
-        return 0;
-    });
+    return testing_support::logInChild(LOG_OUTPUT_STDOUT, threshold, body);
 }
 
 TEST(StatusReport, FixedLineReportNamesThisFile) {

@@ -205,7 +205,7 @@ def overlap_figures(results):
         fail(f"{path} has no totals line")
     locks = {"overlap": "on", "overlap (locks off)": "off (`FAULT_LOCKS=off`)"}
     return table(["Locks", "Rounds:", "Acknowledged:", "Lost:", "Stale reads:", "Waits beyond the bound:"],
-                 [[locks[m[1]]] + [number(c) for c in m.groups()[1:]] for m in found])
+                 [[locks[m[1]]] + [number(c) for c in m.groups()[1:]] for m in sorted(found, key=lambda m: m[1])])
 
 
 def fuzz_figures(results):
@@ -220,10 +220,12 @@ def fuzz_figures(results):
 def soak_figures(results):
     path = results / "soak.txt"
     m = one(path, r"soak: (\d+) runs, (\d+) killed \((\d+) old, (\d+) new\), (\d+) violations", "totals")
+    seed = matches(path, r"soak: seed (\d+) .*")
     late = matches(path, r"soak: (\d+) kills came after the run had ended; typical run at the end \d+ us")
-    return table(["Runs:", "Killed:", "Killed, old blob kept:", "Killed, new blob in place:", "Violations:",
+    return table(["Seed", "Runs:", "Killed:", "Killed, old blob kept:", "Killed, new blob in place:", "Violations:",
                   "Kills after the run had ended:"],
-                 [[number(c) for c in m.groups()] + [number(late[-1][1]) if late else "–"]])
+                 [[seed[-1][1] if seed else "–"] + [number(c) for c in m.groups()] +
+                  [number(late[-1][1]) if late else "–"]])
 
 
 def coverage_figures(results):

@@ -230,6 +230,8 @@ def add_project(root, source, build, work):
     for directory, subdirectories, names in os.walk(build):
         here = Path(directory)
         subdirectories[:] = [d for d in subdirectories if d != "CMakeFiles" and here / d != work]
+        # Tests run in their build directory, which may hold no program.
+        (root / here.relative_to("/")).mkdir(parents=True, exist_ok=True)
         for name in names:
             path = here / name
             if path.is_symlink() or not path.is_file() or not is_elf(path) or path.suffix in (".o", ".a"):

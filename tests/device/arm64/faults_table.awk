@@ -1,5 +1,5 @@
 # The faults campaign's cases as a Markdown table, a row for each file
-# system, operation, fault and recovery:
+# system, operation and fault, with the recoveries its cases met:
 #   awk -f faults_table.awk build/arm64-device/faults-full-console.log
 # Only the lines of the campaign proper ("@@ case N ..."), up to its totals:
 # the broken store's cases follow them.
@@ -24,8 +24,12 @@ done || !/^@@ case [0-9]+ / { next }
     } else {
         fault = "writes fail" (fault == "writes-fail@0" ? " before it" : " at a step")
     }
-    key = fs " | " operation " | " fault " | " recovery
+    key = fs " | " operation " | " fault
     if (!(key in cases)) order[++rows] = key
+    if (!((key, recovery) in met)) {
+        met[key, recovery] = 1
+        recoveries[key] = recoveries[key] (recoveries[key] == "" ? "" : ", ") recovery
+    }
     cases[key]++
     status = $0
     if (sub(/.* (exit|finalise)=/, "", status)) {
@@ -48,11 +52,11 @@ done || !/^@@ case [0-9]+ / { next }
     }
 }
 END {
-    print "| file system | operation | fault | recovery | cases | returned 0 | failed | served old | served new | other | lost | hangs | crashes | failed otherwise | stale |"
+    print "| file system | operation | fault | recoveries | cases | returned 0 | failed | served old | served new | other | lost | hangs | crashes | failed otherwise | stale |"
     print "|---|---|---|---|---:|---:|---:|---:|---:|---:|---:|---:|---:|---:|---:|"
     for (r = 1; r <= rows; r++) {
         k = order[r]
-        printf "| %s | %d | %d | %d | %d | %d | %d | %d | %d | %d | %d | %d |\n", k, cases[k], returned[k], failed[k],
+        printf "| %s | %s | %d | %d | %d | %d | %d | %d | %d | %d | %d | %d | %d |\n", k, recoveries[k], cases[k], returned[k], failed[k],
             served[k, "old"], served[k, "new"], served[k, "other"], result[k, "lost"], result[k, "hang"],
             result[k, "crash"], result[k, "failed"], result[k, "stale"]
     }

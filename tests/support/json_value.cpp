@@ -73,31 +73,35 @@ private:
     JsonValue parseObject() {
         JsonValue value;
         value.type = JsonValue::Type::kObject;
-        expect('{');
-        skipSpace();
-        if (take("}")) return value;
-        for (;;) {
+        parseElements('{', '}', [&] {
             skipSpace();
             if (at_ >= text_.size() || text_[at_] != '"') fail("expected a member name");
             const std::string name = parseString();
             expect(':');
             if (!value.members.emplace(name, parseValue()).second) fail("repeated member " + name);
-            skipSpace();
-            if (take("}")) return value;
-            expect(',');
-        }
+        });
+        return value;
     }
 
     JsonValue parseArray() {
         JsonValue value;
         value.type = JsonValue::Type::kArray;
-        expect('[');
+        parseElements('[', ']', [&] { value.items.push_back(parseValue()); });
+        return value;
+    }
+
+    // The comma-separated elements between `open` and `close`, each read by
+    // `parseElement`.
+    template <typename ParseElement>
+    void parseElements(char open, char close, ParseElement parseElement) {
+        expect(open);
         skipSpace();
-        if (take("]")) return value;
+        const std::string end(1, close);
+        if (take(end)) return;
         for (;;) {
-            value.items.push_back(parseValue());
+            parseElement();
             skipSpace();
-            if (take("]")) return value;
+            if (take(end)) return;
             expect(',');
         }
     }

@@ -290,10 +290,10 @@ present() { echo "present:$(cksum <"$1" | cut -d ' ' -f 1)"; }
 blobs=$work/blobs
 make_blobs() {
     mkdir -p "$blobs"
-    "$make_data" settings "$blobs/a" 65535 >/dev/null
-    "$make_data" settings "$blobs/b" 40000 >/dev/null
-    "$make_data" settings "$blobs/c" 20000 >/dev/null
-    "$make_data" settings "$blobs/next" 3000 >/dev/null
+    local blob
+    for blob in a:65535 b:40000 c:20000 next:3000; do
+        "$make_data" settings "$blobs/${blob%:*}" "${blob#*:}" >/dev/null
+    done
     head -c 30000 "$blobs/a" >"$blobs/part1"
     tail -c 12000 "$blobs/b" >"$blobs/part2"
 }
@@ -352,6 +352,23 @@ fault_at() {
     status=$?
     op_status=$status
     judge_status
+}
+
+# update_under_fault PATH TABLE DEVICE COMMAND...: COMMAND with DEVICE's
+# writes failing from its start ($step 0) or from its $step-th mutating
+# call on PATH on.
+update_under_fault() {
+    local path=$1 new_table=$2 device=$3
+    shift 3
+    if [ "$step" = 0 ]; then
+        table "$new_table" "$device"
+        wrap=(timeout -k 5 "$run_limit")
+        "$@" >"$work/op.log" 2>&1
+        status=$?
+        judge_status
+    else
+        fault_at "$step" "$path" "$new_table" "$device" "$@"
+    fi
 }
 
 # ---- the cases ----
@@ -485,16 +502,8 @@ boot_case() {
     old_sum=$(cksum <"$work/boot-old" | cut -d ' ' -f 1)
     new_sum=$(cksum <"$work/boot-new" | cut -d ' ' -f 1)
     outcome=ok
-    if [ "$step" = 0 ]; then
-        table "0 $size flakey /dev/mmcblk0p1 0 0 86400 1 error_writes" bootfaults
-        wrap=(timeout -k 5 "$run_limit")
-        boot_update >"$work/op.log" 2>&1
-        status=$?
-        judge_status
-    else
-        fault_at "$step" /media/boot/BOOT.BIN "0 $size flakey /dev/mmcblk0p1 0 0 86400 1 error_writes" bootfaults \
-            boot_update
-    fi
+    update_under_fault /media/boot/BOOT.BIN "0 $size flakey /dev/mmcblk0p1 0 0 86400 1 error_writes" bootfaults \
+        boot_update
     op_status=$(sed -n 's/^finalise \([0-9]*\) .*/\1/p' "$work/op.log")
     if [ "$recovery" = cut ]; then table "0 $size error" bootfaults; else table "$boot_linear" bootfaults; fi
     unmount /media/boot
@@ -554,16 +563,8 @@ partition_case() {
     fi
     dm_create partfaults "$part_linear"
     outcome=ok
-    if [ "$step" = 0 ]; then
-        table "0 $size flakey /dev/mmcblk0p2 0 0 86400 1 error_writes" partfaults
-        wrap=(timeout -k 5 "$run_limit")
-        partition_update >"$work/op.log" 2>&1
-        status=$?
-        judge_status
-    else
-        fault_at "$step" /dev/mmcblk0p2 "0 $size flakey /dev/mmcblk0p2 0 0 86400 1 error_writes" partfaults \
-            partition_update
-    fi
+    update_under_fault /dev/mmcblk0p2 "0 $size flakey /dev/mmcblk0p2 0 0 86400 1 error_writes" partfaults \
+        partition_update
     op_status=$(sed -n 's/^finalise \([0-9]*\)$/\1/p' "$work/op.log")
     if [ "$recovery" = cut ]; then table "0 $size error" partfaults; else table "$part_linear" partfaults; fi
     # The namespace's mount goes with its last process, not at once.

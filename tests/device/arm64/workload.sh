@@ -78,12 +78,16 @@ report() {
 # at every boot.
 make_blobs() {
     mkdir -p "$blobs"
-    "$make_data" settings "$blobs/settings-small" 100 >/dev/null
-    "$make_data" settings "$blobs/settings-mid" 4000 >/dev/null
-    "$make_data" settings "$blobs/settings-large" 65535 >/dev/null
-    "$make_data" overlay "$blobs/overlay-small" 1024 >/dev/null
-    "$make_data" overlay "$blobs/overlay-mid" 300000 >/dev/null
-    "$make_data" overlay "$blobs/overlay-large" 1048292 >/dev/null
+    while read -r kind name size; do
+        "$make_data" "$kind" "$blobs/$name" "$size" >/dev/null
+    done <<EOF
+settings settings-small 100
+settings settings-mid 4000
+settings settings-large 65535
+overlay overlay-small 1024
+overlay overlay-mid 300000
+overlay overlay-large 1048292
+EOF
     # A settings block whose check fails: the redundant migration must take
     # the other candidate.
     cp "$blobs/settings-mid" "$blobs/settings-bad"

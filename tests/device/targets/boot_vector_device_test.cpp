@@ -21,16 +21,10 @@
 #include "simulated_device.h"
 #include "storage_log.h"
 
+namespace device_test {
 namespace {
 
-namespace fs = std::filesystem;
-namespace sd = simulated_device;
-using device_test::Bytes;
-using device_test::hex;
 using Storage::BootVectorTarget;
-using Storage::TargetSlot;
-using testing_support::normalisedStorageLog;
-using testing_support::ProcessResult;
 using testing_support::runInChild;
 
 constexpr uint64_t kUsualSector = 30703616;
@@ -93,13 +87,13 @@ protected:
         original = sd::writtenBootVectorRecord();
         ASSERT_EQ(sd::bootVectorSector(), kUsualSector);
         ASSERT_EQ(original.size(), 20u);
-        diskNumber = device_test::blockDeviceNumber(sd::kDisk);
+        diskNumber = blockDeviceNumber(sd::kDisk);
         ASSERT_NE(diskNumber, 0u);
     }
 
     void TearDown() override {
         if (original.empty()) return;
-        if (device_test::blockDeviceNumber(sd::kDisk) != diskNumber) device_test::makeBlockNode(sd::kDisk, diskNumber);
+        if (blockDeviceNumber(sd::kDisk) != diskNumber) makeBlockNode(sd::kDisk, diskNumber);
         sd::writeImageBytes(sd::bootVectorOffset(), original);
     }
 
@@ -311,7 +305,7 @@ TEST_F(BootVectorOnDevice, WriteWhenTheDeviceCannotBeOpened) {
               "write 52\n"
               "read 0 20 " +
                   hex(record) + "\n");
-    device_test::makeBlockNode(sd::kDisk, diskNumber);
+    makeBlockNode(sd::kDisk, diskNumber);
     EXPECT_EQ(hex(sd::readDeviceBytes(sd::kDisk, sd::bootVectorOffset(), 20)), hex(original));
 }
 
@@ -441,3 +435,4 @@ TEST_F(BootVectorNoFreeArea, NothingToParse) {
 }
 
 }  // namespace
+}  // namespace device_test

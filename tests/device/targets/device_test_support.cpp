@@ -16,8 +16,6 @@
 
 namespace device_test {
 
-namespace fs = std::filesystem;
-
 void mustRun(const std::string& command) {
     const ProcessResult result = testing_support::runShell(command);
     if (result.exitStatus != 0) {

@@ -13,10 +13,19 @@
 #include "child_process.h"
 #include "fake_mount_commands.h"
 #include "files.h"
+#include "lib/storage/storage_target.h"
+#include "simulated_device.h"
+#include "storage_log.h"
 
+// The device targets' tests live in this namespace, beside the names they
+// all use.
 namespace device_test {
 
+namespace fs = std::filesystem;
+namespace sd = simulated_device;
 using Bytes = std::vector<uint8_t>;
+using Storage::TargetSlot;
+using testing_support::normalisedStorageLog;
 using testing_support::ProcessResult;
 
 // As testing_support::runShell, but a failure throws std::runtime_error

@@ -30,18 +30,10 @@
 #include "simulated_device.h"
 #include "storage_log.h"
 
+namespace device_test {
 namespace {
 
-namespace fs = std::filesystem;
-namespace sd = simulated_device;
-using device_test::Bytes;
-using device_test::fileBytes;
-using device_test::MountRecorder;
-using device_test::pattern;
 using Storage::FirmwareUpdateBootTarget;
-using Storage::TargetSlot;
-using testing_support::normalisedStorageLog;
-using testing_support::ProcessResult;
 
 constexpr const char* kRemountRw = testing_support::kBootRemountRwCall;
 constexpr const char* kRemountRo = testing_support::kBootRemountRoCall;
@@ -106,7 +98,7 @@ protected:
     }
 
     void TearDown() override {
-        if (restore) device_test::restoreBootFiles();
+        if (restore) restoreBootFiles();
     }
 
     // Runs a whole update of `slotIndex` in a child, at the informational
@@ -160,7 +152,7 @@ TEST_F(FirmwareUpdateBootOnDevice, SizeIsTakenModulo2To32) {
         if (put != 1) GTEST_SKIP() << "/tmp cannot hold a sparse file of 4 GiB";
     }
     const Bytes ten = pattern(10, 40);
-    device_test::changeBootPartition([&] { testing_support::writeBytes(bootFile("BOOT.BIN"), ten); });
+    changeBootPartition([&] { testing_support::writeBytes(bootFile("BOOT.BIN"), ten); });
     const Bytes imageBefore = bootPartitionImage();
     recorder.clear();
 
@@ -196,7 +188,7 @@ TEST_F(FirmwareUpdateBootOnDevice, DifferentDataIsWrittenAndReadBack) {
     EXPECT_EQ(fileBytes(bootFile("BOOT0010.BIN")), fileBytes(sd::originalBootFile("BOOT0010.BIN")));
 
     // On the partition itself, not only in the cache.
-    device_test::mustRun("umount /media/boot && mount /media/boot");
+    mustRun("umount /media/boot && mount /media/boot");
     EXPECT_EQ(sd::mountState(sd::kBootMount), sd::MountState::kReadOnly);
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")) == data, true);
 }
@@ -270,13 +262,12 @@ TEST_F(FirmwareUpdateBootOnDevice, ShorterDataReplacesTheWholeFile) {
 // From the first begin on, /tmp holds no firmware file: it is unlinked at
 // once and lives only behind the descriptor.
 TEST_F(FirmwareUpdateBootOnDevice, TemporaryFileIsNeverLeftInTmp) {
-    const std::vector<std::string> before = device_test::temporaryFirmwareFiles();
+    const std::vector<std::string> before = temporaryFirmwareFiles();
     const Bytes data = pattern(5000, 6);
     const ProcessResult result = recorder.run(LOG_PRIORITY_INFO, [&] {
         auto show = [&](const char* when) {
-            const bool same = device_test::temporaryFirmwareFiles() == before;
-            std::printf("%s: tmp %s\n%s", when, same ? "unchanged" : "CHANGED",
-                        device_test::temporaryFirmwareDescriptors().c_str());
+            const bool same = temporaryFirmwareFiles() == before;
+            std::printf("%s: tmp %s\n%s", when, same ? "unchanged" : "CHANGED", temporaryFirmwareDescriptors().c_str());
         };
         FirmwareUpdateBootTarget target;
         TargetSlot& slot = *target.getSlot(0).get();
@@ -308,7 +299,7 @@ TEST_F(FirmwareUpdateBootOnDevice, TemporaryFileIsNeverLeftInTmp) {
                   rewrittenLines("BOOT.BIN", 5000).substr(0, rewrittenLines("BOOT.BIN", 5000).rfind("finalise")) +
                   "finalise 0\n"
                   "after finalise: tmp unchanged\n");
-    EXPECT_EQ(device_test::temporaryFirmwareFiles(), before);
+    EXPECT_EQ(temporaryFirmwareFiles(), before);
     EXPECT_EQ(fileBytes(bootFile("BOOT.BIN")), data);
 }
 
@@ -317,7 +308,7 @@ TEST_F(FirmwareUpdateBootOnDevice, TemporaryFileIsNeverLeftInTmp) {
 TEST_F(FirmwareUpdateBootOnDevice, MissingDestinationIsCreatedUnderTheUmask) {
     for (const mode_t mask : {mode_t{022}, mode_t{027}, mode_t{0}}) {
         SCOPED_TRACE("umask " + std::to_string(mask));
-        device_test::changeBootPartition([] { fs::remove(bootFile("BOOT0010.BIN")); });
+        changeBootPartition([] { fs::remove(bootFile("BOOT0010.BIN")); });
         recorder.clear();
         const Bytes data = pattern(777, static_cast<uint8_t>(mask));
         const ProcessResult result = recorder.run(LOG_PRIORITY_INFO, [&] {
@@ -416,7 +407,7 @@ TEST_F(FirmwareUpdateBootOnDevice, FailedRemountEndsTheUpdate) {
 // read-back fails, and after the fifth the file system is read-only again.
 // The message names BOOT.BIN for either slot.
 TEST_F(FirmwareUpdateBootOnDevice, FiveFailedReadBacks) {
-    device_test::changeBootPartition([] { device_test::setImmutable(bootFile("BOOT0010.BIN"), true); });
+    changeBootPartition([] { setImmutable(bootFile("BOOT0010.BIN"), true); });
     recorder.clear();
     const ProcessResult result = recorder.run(LOG_PRIORITY_INFO, [] {
         FirmwareUpdateBootTarget target;
@@ -492,3 +483,4 @@ TEST_F(FirmwareUpdateBootFaults, DriverWithoutFaults) {
 }
 
 }  // namespace
+}  // namespace device_test

@@ -27,17 +27,10 @@
 #include "source_lines.h"
 #include "storage_log.h"
 
+namespace device_test {
 namespace {
 
-namespace fs = std::filesystem;
-namespace sd = simulated_device;
-using device_test::Bytes;
-using device_test::MountRecorder;
-using device_test::pattern;
 using Storage::FirmwareUpdatePartitionTarget;
-using Storage::TargetSlot;
-using testing_support::normalisedStorageLog;
-using testing_support::ProcessResult;
 
 constexpr const char* kUnmount = "umount [/media/resources]\n";
 constexpr const char* kMount = "mount [/media/resources]\n";
@@ -65,7 +58,7 @@ protected:
     void SetUp() override {
         SKIP_UNLESS_ON_SIMULATED_DEVICE();
         if (sd::variant() != "normal") GTEST_SKIP() << "for the normal image";
-        deviceNumber = device_test::blockDeviceNumber(sd::kResourcePartition);
+        deviceNumber = blockDeviceNumber(sd::kResourcePartition);
         ASSERT_NE(deviceNumber, 0u);
         ASSERT_EQ(sd::mountState(sd::kResourcesMount), sd::MountState::kReadWrite);
         ASSERT_EQ(testing_support::readText(sd::kResourcesMarker), sd::kResourcesMarkerText);
@@ -74,18 +67,17 @@ protected:
     // A fresh resource partition, as the runner makes it, mounted.
     void TearDown() override {
         if (deviceNumber == 0) return;
-        if (device_test::blockDeviceNumber(sd::kResourcePartition) != deviceNumber) {
-            device_test::makeBlockNode(sd::kResourcePartition, deviceNumber);
+        if (blockDeviceNumber(sd::kResourcePartition) != deviceNumber) {
+            makeBlockNode(sd::kResourcePartition, deviceNumber);
         }
         if (sd::mountState(sd::kResourcesMount) != sd::MountState::kNotMounted) {
-            device_test::mustRun("umount /media/resources");
+            mustRun("umount /media/resources");
         }
         testing_support::ScratchDir stage;
         testing_support::writeText(stage / "resources.id", sd::kResourcesMarkerText);
         // No discard: on the emulated device's card it costs seconds.
-        device_test::mustRun("mkfs.ext4 -q -F -E nodiscard -L resources -d '" + stage.path().string() +
-                             "' /dev/mmcblk0p2");
-        device_test::mustRun("mount /media/resources");
+        mustRun("mkfs.ext4 -q -F -E nodiscard -L resources -d '" + stage.path().string() + "' /dev/mmcblk0p2");
+        mustRun("mount /media/resources");
     }
 
     ProcessResult run(int threshold, const std::function<int(TargetSlot&)>& body) {
@@ -112,8 +104,7 @@ TEST_F(FirmwareUpdatePartitionOnDevice, ImageIsStreamedAndMounted) {
         ASSERT_EQ(::ftruncate(fd, 8 << 20), 0);
         ::close(fd);
     }
-    device_test::mustRun("mkfs.ext4 -q -F -L newimage -d '" + (dir / "content").string() + "' '" +
-                         (dir / "image").string() + "'");
+    mustRun("mkfs.ext4 -q -F -L newimage -d '" + (dir / "content").string() + "' '" + (dir / "image").string() + "'");
     const Bytes image = testing_support::readBytes(dir / "image");
     ASSERT_EQ(image.size(), 8u << 20);
 
@@ -258,12 +249,12 @@ TEST_F(FirmwareUpdatePartitionOnDevice, DevicePathThatIsNoBlockDevice) {
         EXPECT_EQ(recorder.calls(), "");
         EXPECT_EQ(sd::mountState(sd::kResourcesMount), sd::MountState::kReadWrite);
     }
-    device_test::makeBlockNode(sd::kResourcePartition, deviceNumber);
+    makeBlockNode(sd::kResourcePartition, deviceNumber);
 }
 
 // On a first begin a failed unmount ends it.
 TEST_F(FirmwareUpdatePartitionOnDevice, FirstBeginStopsWhenTheUnmountFails) {
-    device_test::mustRun("umount /media/resources");
+    mustRun("umount /media/resources");
     const ProcessResult result = run(LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         const Status begun = slot.beginWrite();
         std::printf("begin %u valid %d\n", begun, slot.isValid() ? 1 : 0);
@@ -283,7 +274,7 @@ TEST_F(FirmwareUpdatePartitionOnDevice, FirstBeginStopsWhenTheUnmountFails) {
 // unmounted and stays so.
 TEST_F(FirmwareUpdatePartitionOnDevice, DeviceThatCannotBeOpened) {
     // Major 240 is reserved for local use; nothing here registers it.
-    device_test::makeBlockNode(sd::kResourcePartition, makedev(240, 0));
+    makeBlockNode(sd::kResourcePartition, makedev(240, 0));
     const ProcessResult result = run(LOG_PRIORITY_INFO, [](TargetSlot& slot) {
         const Status begun = slot.beginWrite();
         std::printf("begin %u valid %d\n", begun, slot.isValid() ? 1 : 0);
@@ -341,3 +332,4 @@ TEST_F(FirmwareUpdatePartitionOnDevice, MountOfAMountPointUnknownToTheMountTable
 }
 
 }  // namespace
+}  // namespace device_test

@@ -18,12 +18,8 @@
 #include "simulated_device.h"
 #include "storage_log.h"
 
+namespace device_test {
 namespace {
-
-namespace fs = std::filesystem;
-namespace sd = simulated_device;
-using testing_support::normalisedStorageLog;
-using testing_support::ProcessResult;
 
 ProcessResult runTool(std::vector<std::string> args) {
     args.insert(args.begin(), MIGRATE_SETTINGS_BIN);
@@ -82,9 +78,9 @@ TEST_F(RegistrationOnDevice, HealthyDeviceLogsNothingByDefault) {
 // between two runs is reported by the second, which otherwise works as
 // before.
 TEST_F(RegistrationOnDevice, EveryRunReadsTheBootVector) {
-    const device_test::Bytes original = sd::writtenBootVectorRecord();
+    const Bytes original = sd::writtenBootVectorRecord();
     ASSERT_EQ(original.size(), 20u);
-    device_test::Bytes spoilt = original;
+    Bytes spoilt = original;
     spoilt[8] = static_cast<uint8_t>(spoilt[8] + 1);
     sd::writeImageBytes(sd::bootVectorOffset(), spoilt);
     const ProcessResult result =
@@ -173,3 +169,4 @@ TEST(DeviceTargetNames, CannotBeChosenOnTheCommandLine) {
 }
 
 }  // namespace
+}  // namespace device_test

@@ -42,7 +42,10 @@ from pathlib import Path
 
 BROKEN_LIMIT = 30
 LONGEST_RUN_SECONDS = 4.0
-BOOT_LIMIT_SECONDS = 120
+BOOT_LIMIT_SECONDS = 240
+# A running guest always uses CPU time (its timer ticks at the least): a qemu
+# that used none for this long froze with its guest's clock (qemu 7.2).
+FREEZE_SECONDS = 120
 
 
 class Boot:
@@ -65,6 +68,29 @@ class Boot:
             if line == "@@ state done":
                 self.report_done.set()
         self.ended.set()
+
+    def cpu_ticks(self):
+        """The CPU time qemu used so far, in clock ticks."""
+        try:
+            fields = Path(f"/proc/{self.process.pid}/stat").read_text().rsplit(")", 1)[1].split()
+        except OSError:
+            return None
+        return int(fields[11]) + int(fields[12])
+
+    def await_report(self, limit=BOOT_LIMIT_SECONDS, freeze=FREEZE_SECONDS, poll=10):
+        """'reported' once the stores' report is complete; 'frozen' when qemu
+        used no CPU time for `freeze` seconds; 'late' after `limit`."""
+        started = time.monotonic()
+        last, still_since = self.cpu_ticks(), started
+        while not self.report_done.wait(poll):
+            now, ticks = time.monotonic(), self.cpu_ticks()
+            if ticks != last:
+                last, still_since = ticks, now
+            elif now - still_since >= freeze:
+                return "frozen"
+            if now - started >= limit:
+                return "late"
+        return "reported"
 
     def cut(self):
         self.process.kill()
@@ -92,6 +118,7 @@ class Campaign:
         self.next_op = 0
         self.cuts = self.acknowledged = self.old = self.new = self.flights = self.violations = 0
         self.repairs = 0  # boots on which e2fsck had to repair a file system first
+        self.freezes = 0
 
     def boot(self, mode):
         words = [w.replace("@CARD@", str(self.card)).replace("@MODE@", mode) for w in self.words]
@@ -180,9 +207,18 @@ class Campaign:
 
     def cut_once(self, rng):
         boot = self.boot(f"workload arm64_op={self.next_op}")
-        if not boot.report_done.wait(BOOT_LIMIT_SECONDS):
+        outcome = boot.await_report()
+        if outcome != "reported":
             boot.cut()
-            self.violation("the device did not boot to its workload")
+            # Killed before its first operation, the device boots again as
+            # it would after any cut; a second freeze fails the campaign.
+            if outcome == "frozen" and self.freezes == 0:
+                self.freezes += 1
+                print(f"{self.name}: the emulator froze: no CPU time for {FREEZE_SECONDS} s; booting again",
+                      flush=True)
+                return self.cut_once(rng)
+            self.violation("the device did not boot to its workload" + (" (the emulator froze again)"
+                                                                        if outcome == "frozen" else ""))
             return
         checked = self.check(list(boot.lines))
         time.sleep(rng.uniform(0, LONGEST_RUN_SECONDS))

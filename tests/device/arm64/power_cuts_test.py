@@ -126,5 +126,26 @@ class Judgement(unittest.TestCase):
         self.assertEqual(c.totals(), "0 cuts, 1 acknowledged, 0 old, 0 new, 0 in flight, 0 violations")
 
 
+
+class AwaitingTheReport(unittest.TestCase):
+    """A boot that reports, one that works without reporting, and one whose
+    emulator uses no CPU time at all, as a frozen qemu."""
+
+    def outcome(self, script, limit=3.0):
+        boot = power_cuts.Boot(["sh", "-c", script], io.StringIO())
+        try:
+            return boot.await_report(limit=limit, freeze=1.0, poll=0.1)
+        finally:
+            boot.cut()
+
+    def test_a_report_is_awaited(self):
+        self.assertEqual(self.outcome("sleep 0.3; echo '@@ state done'; sleep 5"), "reported")
+
+    def test_a_busy_boot_without_report_is_late(self):
+        self.assertEqual(self.outcome("while :; do :; done"), "late")
+
+    def test_a_boot_without_cpu_time_is_frozen(self):
+        self.assertEqual(self.outcome("exec sleep 30"), "frozen")
+
 if __name__ == "__main__":
     unittest.main()

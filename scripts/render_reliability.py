@@ -203,7 +203,8 @@ def overlap_figures(results):
         fail(f"{path} has no totals line")
     locks = {"overlap": "on", "overlap (locks off)": "off (`FAULT_LOCKS=off`)"}
     return table(["Locks", "Rounds:", "Acknowledged:", "Lost:", "Stale reads:", "Waits beyond the bound:"],
-                 [[locks[m[1]]] + [number(c) for c in m.groups()[1:]] for m in sorted(found, key=lambda m: m[1])])
+                 [[locks[m[1]]] + [number(c) for c in m.groups()[1:]]
+                  for m in sorted(found, key=lambda m: (m[1], int(m[2])))])
 
 
 def fuzz_figures(results):

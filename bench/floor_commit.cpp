@@ -39,6 +39,9 @@ FloorCopy::FloorCopy(const std::filesystem::path& directory)
     : data((directory / "data").string()), check(data + ".chk"), tmp(check + ".tmp") {}
 
 int floorCommit(const FloorCopy& copy, const uint8_t* data, size_t size) {
+    // The copy stops being valid before its data is touched, as in the
+    // store; a first write finds no check file to remove.
+    if (::unlink(copy.check.c_str()) != 0 && errno != ENOENT) return errno;
     {
         // Closed before the commit, as the store does: on ext4 that close
         // already starts writing back a file that was truncated.

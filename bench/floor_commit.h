@@ -2,9 +2,9 @@
 // commit and nothing else. The copy's check file is removed, the data file is
 // truncated, written and synced, an 8-byte check file is written under a
 // temporary name and renamed over the check file, and the file system is
-// synced. No checksum is computed (the
-// check file holds the size only), nothing is read back, validated or
-// re-timed. Whatever the store spends above this is its own cost.
+// synced. No checksum is computed (the check file holds the size only),
+// nothing is read back, validated or re-timed. Whatever the store spends
+// above this is its own cost.
 #pragma once
 
 #include <cstddef>
@@ -27,8 +27,8 @@ struct FloorCopy {
 
 // Writes `size` bytes at `data` as `copy` with ten system calls: unlink (the
 // check file), open, write, fsync, close (the data file), open, write,
-// rename, syncfs, close (the new check file). Returns 0, or the errno of the first call that failed (EIO
-// for a short write).
+// rename, syncfs, close (the new check file). Returns 0, or the errno of the
+// first call that failed (EIO for a short write).
 int floorCommit(const FloorCopy& copy, const uint8_t* data, size_t size);
 
 }  // namespace bench
